@@ -1,0 +1,88 @@
+// TLTally: one measurement, from its targets to its report.
+//
+// Gathered once on all processors; analysed and reported on one thread. Regions belong to their processes,
+// objects to the tables until the report has grouped the processes, then to the groups.
+
+#pragma once
+
+#include "analysis/TLMemoryCategory.h"
+#include "analysis/TLProcessGroup.h"
+#include "base/IntegerTable.h"
+#include "output/protocol/TLOutputFormatter.h"
+#include "output/protocol/TLTime.h"
+#include "platform/dispatch.h"
+#include "process/TLProcess.h"
+
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <vector>
+
+namespace tally {
+
+class TLTally {
+  public:
+    using ProcessList = std::vector<std::shared_ptr<TLProcess>>;
+    using ObjectTable = IntegerTable<std::shared_ptr<TLMemoryObject>>;
+
+    explicit TLTally(ProcessList processes) : processes_(std::move(processes)) {}
+    TLTally(const TLTally&) = delete;
+    TLTally& operator=(const TLTally&) = delete;
+
+    // Gathering (defined in cli/Gathering.cpp).
+
+    /// Gathers every process, highest pid first, on all processors. @return whether it was interrupted.
+    bool gatherAllProcesses();
+    /// A started source that runs `handler` on every SIGINT; the caller cancels it.
+    static std::unique_ptr<platform::SignalSource> installSigintHandler(std::function<void()> handler);
+    /// The accounting switch (vm/PhysTallyCollection.h).
+    static bool physTallyCollectionEnabled();
+    static void setPhysTallyCollectionEnabled(int value);
+
+    // Analysis.
+
+    /// Files every region of every process under its memory object and computes the totals.
+    void analyzeMemoryObjects();
+
+    // Report.
+
+    void addOutputFormatter(std::shared_ptr<TLOutputFormatter> formatter) {
+        outputFormatters_.push_back(std::move(formatter));
+    }
+    /// The processes that are not hidden, in list order.
+    ProcessList displayedProcesses() const;
+    /// Drives every formatter through the whole report. analyzeMemoryObjects must have run since the last
+    /// one.
+    void printReport(bool regionlistLikeOutput, bool summarize);
+    /// Whether `a` is shown before `b`: by total, then by pid, the larger first.
+    bool compareProcessesForDisplay(const TLProcess& a, const TLProcess& b) const;
+
+    const ProcessList& processes() const { return processes_; }
+    const std::map<std::int32_t, std::uint64_t>& pidToTally() const { return pidToTally_; }
+    const std::optional<TLTime>& gatherStartTime() const { return gatherStartTime_; }
+    const std::optional<TLTime>& gatherEndTime() const { return gatherEndTime_; }
+
+    std::atomic<bool> earlyExit = false; // only ever set to true, by the interrupt handler
+    std::uint32_t qualityOfService = platform::QOS_CLASS_UTILITY;
+
+  private:
+    struct MemoryObjectTables {
+        ObjectTable memoryObjects;
+        std::map<platform::uuid_t, ObjectTable> sharedCacheMemoryObjects;
+        ObjectTable textMemoryObjects;
+        ObjectTable linkeditMemoryObjects;
+        std::vector<std::shared_ptr<TLMemoryObject>> uniqueMemoryObjects;
+    };
+
+    ProcessList processes_;                            // never changes
+    std::map<std::int32_t, std::uint64_t> pidToTally_; // bytes, of the displayed processes
+    MemoryObjectTables tables_;
+    std::vector<std::shared_ptr<TLOutputFormatter>> outputFormatters_;
+    std::optional<TLTime> gatherStartTime_;
+    std::optional<TLTime> gatherEndTime_;
+};
+
+} // namespace tally

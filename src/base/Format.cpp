@@ -1,0 +1,73 @@
+#include "base/Format.h"
+
+#include <cstdarg>
+#include <cstdio>
+
+namespace tally {
+
+std::string formatted(const char* format, ...) {
+    std::va_list arguments;
+    va_start(arguments, format);
+    std::va_list again;
+    va_copy(again, arguments);
+    const int length = std::vsnprintf(nullptr, 0, format, arguments);
+    va_end(arguments);
+    std::string text(length > 0 ? static_cast<std::size_t>(length) : 0, '\0');
+    std::vsnprintf(text.data(), text.size() + 1, format, again);
+    va_end(again);
+    return text;
+}
+
+namespace {
+
+/// Length of the UTF-8 sequence at the start of `text`; 0 when there is none.
+std::size_t sequenceLength(std::string_view text) {
+    const auto lead = static_cast<unsigned char>(text[0]);
+    const std::size_t length = lead < 0x80             ? 1
+                               : (lead & 0xe0) == 0xc0 ? 2
+                               : (lead & 0xf0) == 0xe0 ? 3
+                               : (lead & 0xf8) == 0xf0 ? 4
+                                                       : 0;
+    if (length == 0 || length > text.size()) {
+        return 0;
+    }
+    for (std::size_t i = 1; i < length; ++i) {
+        if ((static_cast<unsigned char>(text[i]) & 0xc0) != 0x80) {
+            return 0;
+        }
+    }
+    return length;
+}
+
+bool isControl(std::string_view sequence) {
+    const auto first = static_cast<unsigned char>(sequence[0]);
+    if (sequence.size() == 1) {
+        return first < 0x20 || first == 0x7f || (first >= 0x80 && first <= 0x9f);
+    }
+    return sequence.size() == 2 && first == 0xc2 && static_cast<unsigned char>(sequence[1]) <= 0x9f;
+}
+
+} // namespace
+
+std::string printable(std::string_view text) {
+    std::string safe;
+    safe.reserve(text.size());
+    while (!text.empty()) {
+        const std::size_t length = sequenceLength(text);
+        const std::string_view sequence = text.substr(0, length == 0 ? 1 : length);
+        if (isControl(sequence)) {
+            safe += '?';
+        } else {
+            safe += sequence;
+        }
+        text.remove_prefix(sequence.size());
+    }
+    return safe;
+}
+
+void printLineToStandardError(std::string_view message) {
+    const std::string line = printable(message) + "\n";
+    std::fwrite(line.data(), 1, line.size(), stderr);
+}
+
+} // namespace tally

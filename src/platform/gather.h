@@ -1,0 +1,27 @@
+// The frame of one gather: what is read once for all of its tasks, and what the platform has to say about
+// one.
+
+#pragma once
+
+#include "platform/kern_return.h"
+
+#include <string>
+#include <vector>
+
+namespace tally::platform {
+
+/// Everything that the platform reads once per gather is read again after one of these was made, and is
+/// dropped with it. One at a time; tasks may also be walked without one.
+class GatherScope {
+  public:
+    GatherScope();
+    ~GatherScope();
+    GatherScope(const GatherScope&) = delete;
+    GatherScope& operator=(const GatherScope&) = delete;
+};
+
+/// Takes what the platform noted about the figures of `task` since the last call: texts for the process's
+/// warnings, such as a figure that rights did not allow and an estimate stands in for.
+std::vector<std::string> task_take_notices(mach_port_t task);
+
+} // namespace tally::platform

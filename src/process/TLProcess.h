@@ -1,0 +1,118 @@
+// TLProcess: the base of every analysed target.
+//
+// Holds a target's identity, the facts that every report needs, its regions once gathered, and the problems
+// met on the way. A target kind overrides the hooks. Made on one thread, gathered once by one thread, then
+// only read.
+
+#pragma once
+
+#include "platform/bsd_process.h"
+#include "process/TLAuxData.h"
+#include "vm/MemoryHolder.h"
+#include "vm/TLMemoryRegion.h"
+#include "vm/TLSharedCache.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace tally {
+
+/// What is known of a process's readiness to be ended when idle.
+enum class TLIdleExitStatus : std::int32_t { unknown = 0, notTracked = 1, clean = 2, dirty = 3 };
+
+class TLProcess : public MemoryHolder {
+  public:
+    using RegionList = std::vector<TLMemoryRegion>;
+
+    TLProcess() = default;
+    TLProcess(const TLProcess&) = delete;
+    TLProcess& operator=(const TLProcess&) = delete;
+
+    /// The process of `pid`; null when it does not exist or cannot be read.
+    static std::shared_ptr<TLProcess> processWithPid(std::int32_t pid);
+    /// The right kind of process for `info`; null when it cannot be read. With `announceRefusal` the reason
+    /// goes to standard error.
+    static std::shared_ptr<TLProcess> processWithBsdInfo(const platform::proc_bsdinfo& info,
+                                                         bool announceRefusal = true);
+    /// The last component of the executable's path, else a name from the record, else "Unknown". Thread-safe.
+    static std::string nameForBsdInfo(const platform::proc_bsdinfo& info);
+
+    /// Takes the identity from `info` and obtains what the kind needs to read the target.
+    /// @return false when that fails; the object is of no use then.
+    virtual bool initWithBsdInfo(const platform::proc_bsdinfo& info);
+    /// Collects the regions, or the problems met instead.
+    virtual void gatherData() {}
+    /// Auxiliary data; absent when the kind has none to tell now.
+    virtual std::optional<TLAuxDictionary> auxData() const { return TLAuxDictionary(); }
+    bool breakDownPhysTally() const override;
+
+    std::int32_t pid() const override { return pid_; }
+    void setPid(std::int32_t pid) { pid_ = pid; }
+    bool is64bit() const { return is64bit_; }
+    void setIs64bit(bool is64bit) { is64bit_ = is64bit; }
+    bool isTranslated() const { return isTranslated_; }
+    void setIsTranslated(bool isTranslated) { isTranslated_ = isTranslated; }
+    TLIdleExitStatus idleExitStatus() const { return idleExitStatus_; }
+    const std::shared_ptr<const TLSharedCache>& sharedCache() const { return sharedCache_; }
+    void setSharedCache(std::shared_ptr<const TLSharedCache> cache) { sharedCache_ = std::move(cache); }
+    std::vector<std::string> errors() const { return errors_; } // a copy
+    bool hasErrors() const { return !errors_.empty(); }
+    const std::vector<std::string>& warnings() const { return warnings_; }
+    const std::vector<std::string>& globalErrors() const { return globalErrors_; }
+    bool hiddenFromDisplay() const { return hiddenFromDisplay_; }
+    void setHiddenFromDisplay(bool hidden) { hiddenFromDisplay_ = hidden; }
+    const std::string& name() const { return name_; }
+    void setName(std::string name) { name_ = std::move(name); }
+    const std::string& displayString() const { return displayString_; }
+    void setDisplayString(std::string text) { displayString_ = std::move(text); }
+    std::uint64_t pageSize() const override { return pageSize_; }
+    void setPageSize(std::uint64_t pageSize) { pageSize_ = pageSize; }
+
+    /// Whether gatherData has left regions.
+    bool hasMemoryRegions() const { return memoryRegions_.has_value(); }
+    /// The regions; an empty list when there are none.
+    RegionList& memoryRegions();
+    const RegionList& memoryRegions() const;
+    void setMemoryRegions(RegionList regions) { memoryRegions_ = std::move(regions); }
+
+    std::int64_t asNumber() const { return pid_; }
+    std::string description() const;
+
+    void addWarning(std::string text) { warnings_.push_back(std::move(text)); }
+    void addError(std::string text) { errors_.push_back(std::move(text)); }
+    /// Adds a problem of the whole run; only after all workers have finished.
+    void _addGlobalError(std::string text) { globalErrors_.push_back(std::move(text)); }
+
+    // Hooks.
+    virtual std::uint64_t _gatherPageSize() const;
+    virtual bool _populateTask() { return false; }
+    virtual bool _isAlive() const { return false; }
+
+    friend bool operator==(const TLProcess& a, const TLProcess& b) { return a.pid_ == b.pid_; }
+
+  protected:
+    void setIdleExitStatus(TLIdleExitStatus status) { idleExitStatus_ = status; }
+    bool announcesRefusal() const { return announcesRefusal_; }
+
+  private:
+    std::int32_t pid_ = 0;
+    bool is64bit_ = false;
+    bool isTranslated_ = false;
+    bool hiddenFromDisplay_ = false;
+    bool announcesRefusal_ = true;
+    TLIdleExitStatus idleExitStatus_ = TLIdleExitStatus::unknown;
+    std::shared_ptr<const TLSharedCache> sharedCache_;
+    std::vector<std::string> errors_;
+    std::vector<std::string> warnings_;
+    std::vector<std::string> globalErrors_;
+    std::string name_;
+    std::optional<RegionList> memoryRegions_;
+    std::string displayString_;
+    std::uint64_t pageSize_ = 0;
+};
+
+} // namespace tally

@@ -1,0 +1,77 @@
+// TLMemoryObject: one kernel VM object, with all regions that map it.
+//
+// Turns the sizes of its regions into totals without counting a page twice, and answers how the object looks
+// from one process. Accepts regions until finalizeSizes, then is only read. Points to regions, which their
+// processes own and keep in place.
+
+#pragma once
+
+#include "base/IntegerTable.h"
+#include "base/Name.h"
+#include "vm/MemoryHolder.h"
+#include "vm/TLMemoryRegion.h"
+#include "vm/TLRangeList.h"
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace tally {
+
+class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
+  public:
+    using RegionList = std::vector<TLMemoryRegion*>;
+
+    TLMemoryObject() = default;
+    TLMemoryObject(const TLMemoryObject&) = delete;
+    TLMemoryObject& operator=(const TLMemoryObject&) = delete;
+
+    /// Adds a region of `process`, which must be given.
+    void addRegionForProcess(TLMemoryRegion& region, const MemoryHolder* process);
+    void addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t pageSize, const MemoryHolder* process);
+    /// Computes the totals, once. `breakDown`: as the plain sums of what the regions are charged.
+    void finalizeSizes(bool breakDown);
+
+    bool hasUnmappedOwnedRegion() const;
+    bool hasProcessSpecificSizes() const;
+    /// The region whose names the object bears; null when it has none.
+    const TLMemoryRegion* representativeRegion() const;
+    Name name() const;
+    Name detailedName() const;
+    std::string fullName() const; // empty without a region
+    /// The flag of the first region.
+    bool verbose() const;
+
+    /// The object as `process` sees it: the object itself, or one made for the process.
+    std::shared_ptr<const TLMemoryObject> viewForProcess(const MemoryHolder& process) const;
+    /// A copy of a final object: its dirty, swapped, clean and wired totals, its regions and its owner.
+    std::shared_ptr<TLMemoryObject> copy() const;
+
+    // Totals in bytes, valid once accurateSizes.
+    std::uint64_t totalDirtySize = 0;
+    std::uint64_t totalCleanSize = 0;
+    std::uint64_t totalSwappedSize = 0;
+    std::uint64_t totalReclaimableSize = 0;
+    std::int32_t ownerPid = -1; // -1: none
+    std::uint64_t totalWiredSize = 0;
+
+    bool accurateSizes() const { return accurateSizes_; }
+    const RegionList& memoryRegions() const { return *memoryRegions_; }
+    const TLRangeList* rangeList() const { return rangeList_.get(); }
+    /// Lists of regions by pid; empty unless they add information.
+    const std::vector<std::pair<std::int32_t, RegionList>>& processMemoryRegions() const {
+        return processMemoryRegions_;
+    }
+
+  private:
+    const RegionList* regionsOf(std::int32_t pid) const;
+    bool processListsAddInformation() const;
+
+    bool accurateSizes_ = false;
+    std::shared_ptr<RegionList> memoryRegions_ = std::make_shared<RegionList>();
+    std::vector<std::pair<std::int32_t, RegionList>> processMemoryRegions_;
+    std::unique_ptr<TLRangeList> rangeList_;
+};
+
+} // namespace tally

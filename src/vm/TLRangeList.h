@@ -1,0 +1,60 @@
+// TLRangeList: the union of byte ranges of one VM object.
+//
+// Decides how overlapping ranges merge; knows nothing of processes or formats.
+// Invariant: nodes are sorted by start and no two share a page or touch at a page boundary.
+// Cost: one pass over the chain per insertion, begun at the last insertion where that lies before the new
+// range; nodes are freed as they fold. Not thread-safe: a list belongs to one object and one thread.
+
+#pragma once
+
+#include <cstdint>
+#include <memory>
+
+namespace tally {
+
+struct TLMemoryRegion;
+
+/// Byte counts of a range or a sum of ranges.
+struct TLRangeSizes {
+    std::uint64_t dirty = 0;
+    std::uint64_t swapped = 0;
+    std::uint64_t clean = 0;
+    std::uint64_t reclaimable = 0;
+    std::uint64_t wired = 0;
+
+    friend bool operator==(const TLRangeSizes&, const TLRangeSizes&) = default;
+};
+
+struct TLRangeListNode {
+    std::uint64_t start = 0; // offset in the VM object, bytes
+    std::uint64_t size = 0;
+    TLRangeSizes sizes;
+    std::unique_ptr<TLRangeListNode> next;
+
+    std::uint64_t end() const { return start + size; }
+};
+
+class TLRangeList {
+  public:
+    TLRangeList() = default;
+    TLRangeList(const TLRangeList&) = delete;
+    TLRangeList& operator=(const TLRangeList&) = delete;
+    ~TLRangeList();
+
+    /// Adds [start, start + size). Where it overlaps a node, each counter of the merged node is
+    /// max(either, sum - overlap): the overlap is never counted twice and neither part is lost.
+    void addSubrange(std::uint64_t start, std::uint64_t size, std::uint64_t pageSize,
+                     const TLRangeSizes& sizes);
+    /// Adds the subranges of `region` if it has some, else the region as one range.
+    void addRegionRange(const TLMemoryRegion& region, std::uint64_t pageSize);
+    void mergeRangeList(const TLRangeList& other, std::uint64_t pageSize);
+    TLRangeSizes sumSizes() const;
+
+    const TLRangeListNode* rangeListHead() const { return head_.get(); }
+
+  private:
+    std::unique_ptr<TLRangeListNode> head_;
+    TLRangeListNode* lastInserted_ = nullptr;
+};
+
+} // namespace tally
