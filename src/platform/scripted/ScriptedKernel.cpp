@@ -1,0 +1,200 @@
+#include "platform/scripted/ScriptedKernel.h"
+
+#include "base/Assertion.h"
+#include "platform/scripted/Answer.h"
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <stdexcept>
+
+namespace tally::platform {
+
+namespace {
+
+std::atomic<ScriptedKernel*> currentKernel = nullptr;
+
+// A fault for a call that is not listed here would never happen and its test would prove nothing.
+constexpr std::array<std::string_view, 44> callNames{
+    "GatherScope",
+    "QRYDirectedGraphWithData",
+    "QRYRegionTypeDescriptionForTag",
+    "RKCreateKernelSymbolicator",
+    "RKForeachSymbolOwner",
+    "RKResolvedPath",
+    "blwriter_open",
+    "copyLoadedModuleIdentifiers",
+    "dispatch_source_sigint",
+    "dyld_shared_cache_for_task",
+    "effectiveUserId",
+    "hasInternalContent",
+    "ledger_entries",
+    "ledger_template",
+    "mach_get_times",
+    "mach_memory_info",
+    "mach_port_deallocate",
+    "mach_port_retain",
+    "mach_timebase_info",
+    "mach_vm_page_range_query",
+    "mach_vm_purgable_get_state",
+    "mach_vm_region",
+    "mach_vm_region_recurse",
+    "ownPid",
+    "prepareStandardStreams",
+    "proc_get_dirty",
+    "proc_listallpids",
+    "proc_pid_rusage",
+    "proc_pidinfo",
+    "proc_pidshortinfo",
+    "proc_regionfilename",
+    "restoreDefaultSigintAction",
+    "standardOutputIsTerminal",
+    "sysctl_argmax",
+    "sysctl_owned_vmobjects",
+    "sysctl_procargs2",
+    "sysctlbyname_read",
+    "sysctlbyname_write",
+    "task_generate_corpse",
+    "task_map_corpse_info_64",
+    "task_read_for_pid",
+    "task_take_notices",
+    "vm_deallocate",
+    "vm_kernel_page_size",
+};
+
+void requireCallName(std::string_view call) {
+    if (std::find(callNames.begin(), callNames.end(), call) == callNames.end()) {
+        throw std::invalid_argument("no platform call is named " + std::string(call));
+    }
+}
+
+} // namespace
+
+ScriptedKernel::ScriptedKernel() : state_(std::make_unique<State>()) {
+    tl_assert(currentKernel.exchange(this) == nullptr, "one scripted kernel at a time");
+}
+
+ScriptedKernel::~ScriptedKernel() { currentKernel = nullptr; }
+
+ScriptedKernel& ScriptedKernel::current() {
+    ScriptedKernel* kernel = currentKernel;
+    tl_assert(kernel != nullptr, "a scripted kernel answers");
+    return *kernel;
+}
+
+ScriptedTask& ScriptedKernel::addTask(TaskRecord record) {
+    if (ScriptedTask* before = findTask(record.pid)) {
+        before->exit();
+    }
+    const std::lock_guard lock(state_->mutex);
+    state_->tasks.push_back(std::make_unique<ScriptedTask>(*this, std::move(record)));
+    ScriptedTask& task = *state_->tasks.back();
+    state_->tasksByPid[task.pid] = &task;
+    return task;
+}
+
+ScriptedTask* ScriptedKernel::findTask(std::int32_t pid) const {
+    const std::lock_guard lock(state_->mutex);
+    const auto found = state_->tasksByPid.find(pid);
+    const bool exists = found != state_->tasksByPid.end() && found->second->state != TaskState::gone;
+    return exists ? found->second : nullptr;
+}
+
+std::uint64_t ScriptedKernel::makeObjectId() {
+    const std::lock_guard lock(state_->mutex);
+    return state_->lastObjectId += 0x100; // the low byte of an id says little
+}
+
+void ScriptedKernel::fail(std::string_view call, int error, CallSelector which) {
+    requireCallName(call);
+    tl_assert(error != 0, "a failing call has an error");
+    const std::lock_guard lock(state_->mutex);
+    state_->faults.push_back(std::make_unique<State::Fault>(std::string(call), which, error));
+}
+
+void ScriptedKernel::before(std::string_view call, std::function<void()> action, CallSelector which) {
+    requireCallName(call);
+    const std::lock_guard lock(state_->mutex);
+    state_->faults.push_back(std::make_unique<State::Fault>(std::string(call), which, 0, std::move(action)));
+}
+
+bool ScriptedKernel::interrupt() {
+    const std::lock_guard lock(state_->mutex);
+    const auto handlers = state_->interruptHandlers; // a handler may cancel its source
+    for (const auto& [source, handler] : handlers) {
+        handler();
+    }
+    return !handlers.empty();
+}
+
+const std::vector<CallRecord>& ScriptedKernel::calls() const { return state_->calls; }
+
+std::size_t ScriptedKernel::callCount(std::string_view name, std::optional<std::int32_t> pid) const {
+    const std::lock_guard lock(state_->mutex);
+    return std::count_if(state_->calls.begin(), state_->calls.end(), [&](const CallRecord& call) {
+        return call.name == name && (!pid || call.pid == *pid);
+    });
+}
+
+std::size_t ScriptedKernel::heldPortReferences() const {
+    const std::lock_guard lock(state_->mutex);
+    std::size_t references = 0;
+    for (const auto& [name, port] : state_->ports) {
+        references += port.references;
+    }
+    return references;
+}
+
+std::size_t ScriptedKernel::heldBuffers() const {
+    const std::lock_guard lock(state_->mutex);
+    return state_->buffers.size();
+}
+
+bool ScriptedKernel::State::Fault::meets(const CallRecord& record) {
+    if (record.name != call || (which.pid && record.pid != *which.pid)) {
+        return false;
+    }
+    ++seen;
+    return seen >= which.nth && seen - which.nth < which.times;
+}
+
+Answer::Answer(const char* call, std::int32_t pid, Numbers arguments, std::string_view text)
+    : kernel(ScriptedKernel::current()), state(kernel.state()), lock_(state.mutex) {
+    begin({call, pid, std::move(arguments), std::string(text)});
+}
+
+Answer::Answer(const char* call, PortName port, Numbers arguments, std::string_view text)
+    : kernel(ScriptedKernel::current()), state(kernel.state()), lock_(state.mutex) {
+    const auto found = state.ports.find(port.port);
+    const std::int32_t pid = found == state.ports.end() ? -1 : found->second.task->pid;
+    begin({call, pid, std::move(arguments), std::string(text)});
+}
+
+void Answer::begin(CallRecord record) {
+    requireCallName(record.name);
+    state.calls.push_back(record);
+    for (std::size_t i = 0; i < state.faults.size(); ++i) {
+        ScriptedKernel::State::Fault& candidate = *state.faults[i];
+        if (!candidate.meets(record)) {
+            continue;
+        }
+        if (candidate.action) {
+            candidate.action();
+        } else if (fault == 0) {
+            fault = candidate.error;
+        }
+    }
+}
+
+ScriptedTask* Answer::taskOfPort(mach_port_t port) const {
+    const auto found = state.ports.find(port);
+    const bool lives = found != state.ports.end() && found->second.task->state == TaskState::alive;
+    return lives ? found->second.task : nullptr;
+}
+
+ScriptedTask* Answer::runningTask(std::int32_t pid) const {
+    ScriptedTask* task = kernel.findTask(pid);
+    return task != nullptr && task->state == TaskState::alive ? task : nullptr;
+}
+
+} // namespace tally::platform
