@@ -1,0 +1,85 @@
+#include "platform/linux/gather/MachineState.h"
+
+#include "platform/gather.h"
+#include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/io/TextScan.h"
+#include "platform/linux/objects/Backing.h"
+#include "platform/linux/walk/Mapping.h"
+
+#include <algorithm>
+#include <mutex>
+#include <optional>
+
+namespace tally::platform {
+
+namespace {
+
+/// The number that stands behind `key` at the start of a line; 0 when there is none.
+std::int64_t numberOf(std::string_view text, std::string_view key) {
+    while (!text.empty()) {
+        std::string_view line = takeLine(text);
+        if (line.starts_with(key)) {
+            line.remove_prefix(key.size());
+            std::int64_t number = 0;
+            if (takeNumber(line, &number)) {
+                return number;
+            }
+        }
+    }
+    return 0;
+}
+
+// Counters lag by what processors keep to themselves: less than this is nothing.
+constexpr std::int64_t noisePages = 32;
+
+MachineState readMachineState() {
+    const std::string meminfo = readSystemFile(systemPath("/proc/meminfo")).value_or("");
+    const std::string vmstat = readSystemFile(systemPath("/proc/vmstat")).value_or("");
+    return {.swapInUse = decodeSwapInUse(meminfo), .lazyFree = decodeLazyFree(vmstat)};
+}
+
+struct CurrentGather {
+    std::mutex mutex;
+    std::optional<MachineState> state;
+};
+
+CurrentGather& currentGather() {
+    static CurrentGather gather;
+    return gather;
+}
+
+void setCurrent(std::optional<MachineState> state) {
+    CurrentGather& gather = currentGather();
+    const std::scoped_lock lock(gather.mutex);
+    gather.state = state;
+}
+
+} // namespace
+
+std::uint64_t decodeLazyFree(std::string_view vmstat) {
+    const std::int64_t onFileLists =
+        numberOf(vmstat, "nr_inactive_file ") + numberOf(vmstat, "nr_active_file ");
+    const std::int64_t filePages = numberOf(vmstat, "nr_file_pages ") - numberOf(vmstat, "nr_shmem ") -
+                                   numberOf(vmstat, "nr_swapcached ");
+    const std::int64_t surplus = onFileLists - filePages;
+    return surplus > noisePages ? static_cast<std::uint64_t>(surplus) * basePage : 0;
+}
+
+bool decodeSwapInUse(std::string_view meminfo) {
+    return numberOf(meminfo, "SwapTotal:") != numberOf(meminfo, "SwapFree:");
+}
+
+MachineState machineState() {
+    CurrentGather& gather = currentGather();
+    const std::scoped_lock lock(gather.mutex);
+    return gather.state ? *gather.state : readMachineState();
+}
+
+GatherScope::GatherScope() {
+    forgetFileSystems();
+    setCurrent(readMachineState());
+}
+
+GatherScope::~GatherScope() { setCurrent(std::nullopt); }
+
+} // namespace tally::platform

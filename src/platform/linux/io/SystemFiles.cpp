@@ -1,0 +1,76 @@
+#include "platform/linux/io/SystemFiles.h"
+
+#include <fcntl.h>
+
+#include <array>
+#include <cerrno>
+
+namespace tally::platform {
+
+namespace {
+
+std::string& systemRoot() {
+    static std::string root;
+    return root;
+}
+
+} // namespace
+
+void setSystemRoot(std::string root) { systemRoot() = std::move(root); }
+
+std::string systemPath(std::string_view path) {
+    std::string full = systemRoot();
+    full += path;
+    return full;
+}
+
+std::string processFolder(std::int32_t pid) { return systemPath("/proc/" + std::to_string(pid)); }
+
+Descriptor openForReading(const std::string& path) {
+    return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
+}
+
+bool readToEnd(const Descriptor& file, std::string& text) {
+    text.clear();
+    std::array<char, 16384> buffer; // the kernel's text files give a few KiB a read at most
+    for (;;) {
+        const ssize_t count = read(file.number(), buffer.data(), buffer.size());
+        if (count > 0) {
+            text.append(buffer.data(), static_cast<std::size_t>(count));
+        } else if (count == 0) {
+            return true;
+        } else if (errno != EINTR) {
+            return false;
+        }
+    }
+}
+
+std::optional<std::string> readSystemFile(const std::string& path) {
+    const Descriptor file = openForReading(path);
+    std::string text;
+    if (!file.isOpen() || !readToEnd(file, text)) {
+        return std::nullopt;
+    }
+    return text;
+}
+
+std::optional<std::string> readSystemLink(const std::string& path) {
+    std::string target(256, '\0');
+    for (;;) {
+        const ssize_t length = readlink(path.c_str(), target.data(), target.size());
+        if (length < 0) {
+            return std::nullopt;
+        }
+        if (static_cast<std::size_t>(length) < target.size()) {
+            target.resize(static_cast<std::size_t>(length));
+            return target;
+        }
+        if (target.size() >= 65536) {
+            errno = ENAMETOOLONG;
+            return std::nullopt;
+        }
+        target.resize(target.size() * 2);
+    }
+}
+
+} // namespace tally::platform

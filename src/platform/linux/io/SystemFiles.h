@@ -1,0 +1,40 @@
+// Reading the kernel's files below /proc and /sys.
+//
+// All paths are below one root, "/" but for tests that bring a tree of their own. Calls that fail leave
+// errno. Thread-safe.
+
+#pragma once
+
+#include "platform/linux/io/Descriptor.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace tally::platform {
+
+/// Sets the folder below which "/proc" and "/sys" are looked for; "" is the machine's own. Before any other
+/// call.
+void setSystemRoot(std::string root);
+
+/// `path` ("/proc/...") below the root.
+std::string systemPath(std::string_view path);
+
+/// The folder of process `pid`: "/proc/<pid>" below the root.
+std::string processFolder(std::int32_t pid);
+
+/// Opens the file at `path`, which the calls above made, for reading. Not open on failure, with errno.
+Descriptor openForReading(const std::string& path);
+
+/// Reads from `file` to its end into `text` (replaced). @return false on failure, with errno; `text` then
+/// holds what came before.
+bool readToEnd(const Descriptor& file, std::string& text);
+
+/// The whole file at `path`; absent on failure, with errno.
+std::optional<std::string> readSystemFile(const std::string& path);
+
+/// Where the symbolic link at `path` points, up to 64 KiB; absent on failure, with errno.
+std::optional<std::string> readSystemLink(const std::string& path);
+
+} // namespace tally::platform

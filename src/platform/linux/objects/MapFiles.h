@@ -1,0 +1,34 @@
+// The files behind mappings, opened, and what the page cache holds of them.
+//
+// A target's file is only ever asked for the state of its pages: its bytes are not read, it is not mapped,
+// and nothing but regular files is opened.
+
+#pragma once
+
+#include "platform/linux/io/Descriptor.h"
+#include "platform/linux/walk/Mapping.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+namespace tally::platform {
+
+/// The path by which the file behind a mapping of the process folder is reached, whatever its name is.
+std::string mapFilePath(const std::string& folder, const Mapping& mapping);
+
+/// Opens the file behind `mapping`. Not open when it is no regular file or may not be opened.
+Descriptor openMappedFile(const std::string& folder, const Mapping& mapping);
+
+/// Pages of a byte range of a file in the page cache.
+struct CachedPages {
+    std::uint64_t cached = 0;
+    std::uint64_t dirty = 0;   // or being written back
+    std::uint64_t evicted = 0; // for shared memory: swapped out
+};
+
+/// Asks for [offset, offset + length); a length of 0 is 0 pages. Absent on failure: before 6.5 the kernel has
+/// no such call, and it refuses hugetlb files.
+std::optional<CachedPages> cachedPages(const Descriptor& file, std::uint64_t offset, std::uint64_t length);
+
+} // namespace tally::platform

@@ -1,0 +1,31 @@
+// The tool's own process: standard streams, user, terminal.
+
+#include "platform/system.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <csignal>
+
+namespace tally::platform {
+
+void prepareStandardStreams() {
+    for (const int number : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) {
+        if (fcntl(number, F_GETFD) == -1) {
+            // The lowest free number is given, and all below this one are taken.
+            [[maybe_unused]] const int opened =
+                open("/dev/null", number == STDIN_FILENO ? O_RDONLY : O_WRONLY);
+        }
+    }
+    std::signal(SIGPIPE, SIG_IGN);
+}
+
+bool standardOutputIsTerminal() { return isatty(STDOUT_FILENO) == 1; }
+
+std::uint32_t effectiveUserId() { return geteuid(); }
+
+std::int32_t ownPid() { return getpid(); }
+
+bool hasInternalContent(const char* /*subsystem*/) { return false; }
+
+} // namespace tally::platform

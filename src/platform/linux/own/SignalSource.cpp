@@ -1,0 +1,90 @@
+// SIGINT as a source: the signal wakes a thread that calls the handler.
+
+#include "platform/dispatch.h"
+#include "platform/linux/io/Descriptor.h"
+
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <cstdint>
+#include <thread>
+#include <utility>
+
+namespace tally::platform {
+
+namespace {
+
+// Where the signal handler writes: one source exists at a time.
+std::atomic<int> signalEvent = -1;
+
+constexpr std::uint64_t signalled = 1;
+constexpr std::uint64_t cancelled = std::uint64_t{1} << 32;
+
+void post(int event, std::uint64_t what) {
+    [[maybe_unused]] const ssize_t written = write(event, &what, sizeof(what));
+}
+
+void onSignal(int /*signal*/) {
+    const int error = errno;
+    post(signalEvent, signalled);
+    errno = error;
+}
+
+class SigintSource final : public SignalSource {
+  public:
+    SigintSource(Descriptor event, std::function<void()> handler)
+        : event_(std::move(event)), handler_(std::move(handler)), thread_([this] { run(); }) {}
+    ~SigintSource() override { SigintSource::cancel(); }
+
+    void cancel() override {
+        if (thread_.joinable()) {
+            signalEvent = -1;
+            post(event_.number(), cancelled);
+            thread_.join();
+        }
+    }
+
+  private:
+    void run() {
+        for (;;) {
+            std::uint64_t events = 0;
+            const ssize_t count = read(event_.number(), &events, sizeof(events));
+            if (count != sizeof(events)) {
+                continue; // a signal that this thread got to handle itself
+            }
+            for (std::uint64_t i = 0; i < events % cancelled; ++i) {
+                handler_();
+            }
+            if (events >= cancelled) {
+                return;
+            }
+        }
+    }
+
+    Descriptor event_;
+    std::function<void()> handler_;
+    std::thread thread_;
+};
+
+} // namespace
+
+std::unique_ptr<SignalSource> dispatch_source_sigint(std::function<void()> handler) {
+    Descriptor event(eventfd(0, EFD_CLOEXEC));
+    if (!event.isOpen()) {
+        return nullptr;
+    }
+    signalEvent = event.number();
+    auto source = std::make_unique<SigintSource>(std::move(event), std::move(handler));
+    struct sigaction action {};
+    action.sa_handler = onSignal;
+    action.sa_flags = SA_RESTART;
+    sigaction(SIGINT, &action, nullptr);
+    return source;
+}
+
+void restoreDefaultSigintAction() { std::signal(SIGINT, SIG_DFL); }
+
+} // namespace tally::platform

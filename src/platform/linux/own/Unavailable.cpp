@@ -1,0 +1,66 @@
+// Calls that this system answers with "none".
+
+#include "platform/benchlog.h"
+#include "platform/bsd_process.h"
+#include "platform/dyld_inspection.h"
+#include "platform/mach_kernel_memory.h"
+#include "platform/mach_task.h"
+#include "platform/quarry.h"
+#include "platform/runekit.h"
+
+#include <cerrno>
+
+namespace tally::platform {
+
+// There is no shared library cache on this system.
+std::optional<dyld_shared_cache> dyld_shared_cache_for_task(mach_port_t /*task*/,
+                                                            kern_return_t* process_status,
+                                                            kern_return_t* snapshot_status) {
+    *process_status = KERN_SUCCESS;
+    *snapshot_status = KERN_SUCCESS;
+    return std::nullopt;
+}
+
+void RKForeachSymbolOwner(mach_port_t /*task*/,
+                          const std::function<void(const RKSymbolOwner&)>& /*handler*/) {}
+
+std::string RKResolvedPath(mach_port_t /*task*/, std::string_view path) { return std::string(path); }
+
+std::unique_ptr<RKKernelSymbolicator> RKCreateKernelSymbolicator() { return nullptr; }
+
+kern_return_t mach_memory_info(mach_memory_record* record) {
+    *record = mach_memory_record();
+    return KERN_NOT_SUPPORTED;
+}
+
+std::map<std::uint64_t, std::string> copyLoadedModuleIdentifiers() { return {}; }
+
+kern_return_t task_generate_corpse(mach_port_t /*task*/, mach_port_t* corpse) {
+    *corpse = MACH_PORT_NULL;
+    return KERN_NOT_SUPPORTED;
+}
+
+kern_return_t task_map_corpse_info_64(mach_port_t /*corpse*/, std::span<const std::byte>* buffer) {
+    *buffer = {};
+    return KERN_NOT_SUPPORTED;
+}
+
+kern_return_t vm_deallocate(std::span<const std::byte> /*buffer*/) { return KERN_SUCCESS; }
+
+int sysctl_owned_vmobjects(std::uint32_t /*task*/, std::span<std::byte> /*reply*/, std::size_t* /*length*/) {
+    errno = ENOENT;
+    return -1;
+}
+
+std::unique_ptr<QRYProcessObjectGraph> QRYDirectedGraphWithData(std::string_view /*contents*/,
+                                                                std::string* error) {
+    *error = "not a heapsnap file";
+    return nullptr;
+}
+
+std::unique_ptr<BenchlogWriter> blwriter_open(const char* /*path*/) {
+    errno = ENOTSUP;
+    return nullptr;
+}
+
+} // namespace tally::platform

@@ -1,0 +1,73 @@
+// PieceBuilder: from the mappings of one task and the states of their pages to the pieces that the walk
+// reports.
+//
+// Decides what each mapping counts: as charged to the task, or as the VM objects see it. One builder serves
+// one walk, mapping after mapping in rising order.
+
+#pragma once
+
+#include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/pieces/CountedPages.h"
+#include "platform/linux/pieces/Piece.h"
+#include "platform/linux/walk/PageStates.h"
+#include "platform/linux/walk/SmapsPages.h"
+
+#include <cstddef>
+#include <cstdint>
+#include <span>
+#include <string>
+#include <vector>
+
+namespace tally::platform {
+
+/// What holds for all mappings of a walk.
+struct WalkFacts {
+    std::int32_t pid = 0;
+    std::uint64_t startTicks = 0;
+    bool objectView = false; // as the VM objects see it
+    bool swapInUse = false;
+    bool asksLazyFree = false; // smaps must be asked for lazily freed pages
+    bool asksLocked = false;   // and for locked mappings
+};
+
+class PieceBuilder {
+  public:
+    PieceBuilder(const WalkFacts& facts, std::span<const Mapping> mappings, const PageStates& states,
+                 const std::string& folder, SmapsOfProcess& smaps);
+
+    /// Appends the pieces of mapping `index`.
+    void build(std::size_t index);
+
+    std::vector<Piece> takePieces() { return std::move(pieces_); }
+    std::vector<PageWords> takeWords() { return std::move(words_); }
+    /// Whether a figure had to be taken from a poorer source because rights or the kernel did not allow
+    /// better.
+    bool usedEstimates() const { return usedEstimates_; }
+
+  private:
+    struct ObjectPages; // the pages of the mapped object that a mapping counts
+
+    ObjectPages chargedObjectPages(std::size_t index);
+    ObjectPages seenObjectPages(std::size_t index);
+    void markSwapped(std::size_t index, const Descriptor& file, ObjectPages& pages);
+    void markDirty(std::size_t index, ObjectPages& pages);
+    void addObjectPiece(std::size_t index, ObjectPages pages, std::uint64_t length);
+    void addOwnPiece(std::size_t index, std::uint64_t length);
+    void addRest(std::size_t index, std::uint64_t length);
+    Piece& addPiece(std::size_t index, std::uint64_t length);
+
+    const WalkFacts& facts_;
+    std::span<const Mapping> mappings_;
+    const PageStates& states_;
+    const std::string& folder_;
+    SmapsOfProcess& smaps_;
+    std::vector<BackingObject> backings_;
+    CountedPages counted_;
+    std::vector<Piece> pieces_;
+    std::vector<PageWords> words_;
+    std::uint64_t nextStart_ = 0; // of the next piece in the mapping that is being built
+    bool usedEstimates_ = false;
+};
+
+} // namespace tally::platform

@@ -1,0 +1,93 @@
+// What a process is charged for, from its status file.
+
+#include "platform/bsd_process.h"
+#include "platform/linux/processes/ProcessStat.h"
+
+#include <algorithm>
+#include <array>
+#include <cstring>
+
+namespace tally::platform {
+
+namespace {
+
+constexpr std::array<const char*, 2> entryNames{"page_table", "phys_tally"};
+constexpr std::uint64_t topLevelTable = 4096; // one page, which VmPTE leaves out
+
+struct Charges {
+    std::uint64_t pageTable = 0;
+    std::uint64_t physTally = 0;
+    std::uint64_t peak = 0;
+    std::uint64_t residentAnonymous = 0;
+};
+
+/// The charges of the process that this thread read last: the usage record and the ledger that are asked one
+/// after the other come from one read, so that they agree.
+struct LastRead {
+    std::int32_t pid = -1;
+    Charges charges;
+};
+thread_local LastRead lastRead;
+
+std::optional<Charges> readCharges(std::int32_t pid) {
+    const std::optional<ProcessStatus> status = readProcessStatus(pid);
+    if (!status) {
+        return std::nullopt;
+    }
+    Charges charges;
+    if (status->hasAddressSpace) {
+        charges.pageTable = status->pageTables + topLevelTable;
+        charges.physTally = status->residentAnonymous + status->residentShared + status->hugetlb +
+                            status->swapped + charges.pageTable;
+        charges.peak = std::max(charges.physTally, status->peakResident);
+        charges.residentAnonymous = status->residentAnonymous;
+    }
+    return charges;
+}
+
+} // namespace
+
+int proc_pid_rusage(std::int32_t pid, rusage_info_v5* info) {
+    const std::optional<Charges> charges = readCharges(pid);
+    if (!charges) {
+        return -1;
+    }
+    lastRead = {pid, *charges};
+    info->ri_phys_tally = charges->physTally;
+    info->ri_lifetime_max_phys_tally = charges->peak;
+    info->ri_resident_anonymous = charges->residentAnonymous;
+    return 0;
+}
+
+int ledger_template(std::span<ledger_template_info> entries) {
+    const std::size_t count = std::min(entries.size(), entryNames.size());
+    for (std::size_t i = 0; i < count; ++i) {
+        entries[i] = ledger_template_info();
+        std::strcpy(entries[i].lti_name, entryNames[i]);
+        std::strcpy(entries[i].lti_group, "physmem");
+        std::strcpy(entries[i].lti_units, "bytes");
+    }
+    return static_cast<int>(count);
+}
+
+int ledger_entries(std::int32_t pid, std::span<ledger_entry_info> entries) {
+    std::optional<Charges> charges;
+    if (lastRead.pid == pid) {
+        charges = lastRead.charges;
+        lastRead.pid = -1;
+    } else {
+        charges = readCharges(pid);
+    }
+    if (!charges) {
+        return -1;
+    }
+    const std::array<std::uint64_t, entryNames.size()> balances{charges->pageTable, charges->physTally};
+    const std::size_t count = std::min(entries.size(), balances.size());
+    for (std::size_t i = 0; i < count; ++i) {
+        entries[i] = ledger_entry_info();
+        entries[i].lei_balance = static_cast<std::int64_t>(balances[i]);
+    }
+    return static_cast<int>(count);
+}
+
+} // namespace tally::platform

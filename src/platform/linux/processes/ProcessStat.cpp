@@ -1,0 +1,96 @@
+#include "platform/linux/processes/ProcessStat.h"
+
+#include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/io/TextScan.h"
+
+#include <array>
+#include <cerrno>
+#include <utility>
+
+namespace tally::platform {
+
+std::optional<ProcessStat> decodeStat(std::string_view text) {
+    ProcessStat stat;
+    // The command name stands in parentheses and may hold parentheses and blanks itself: it ends at the last
+    // one.
+    const std::size_t open = text.find('(');
+    const std::size_t close = text.rfind(')');
+    if (open == std::string_view::npos || close == std::string_view::npos || close < open) {
+        return std::nullopt;
+    }
+    std::string_view head = text.substr(0, open);
+    if (!takeNumber(head, &stat.pid)) {
+        return std::nullopt;
+    }
+    stat.comm = text.substr(open + 1, close - open - 1);
+    std::string_view rest = text.substr(close + 1);
+    const std::string_view state = takeWord(rest);
+    if (state.empty() || !takeNumber(rest, &stat.parent)) {
+        return std::nullopt;
+    }
+    stat.state = state[0];
+    for (int field = 5; field <= 22; ++field) {
+        bool valid = true;
+        if (field == 9) {
+            valid = takeNumber(rest, &stat.flags);
+        } else if (field == 20) {
+            valid = takeNumber(rest, &stat.threads);
+        } else if (field == 22) {
+            valid = takeNumber(rest, &stat.startTicks);
+        } else {
+            valid = !takeWord(rest).empty();
+        }
+        if (!valid) {
+            return std::nullopt;
+        }
+    }
+    return stat;
+}
+
+std::optional<ProcessStat> readProcessStat(std::int32_t pid) {
+    const std::optional<std::string> text = readSystemFile(processFolder(pid) + "/stat");
+    if (!text) {
+        return std::nullopt;
+    }
+    std::optional<ProcessStat> stat = decodeStat(*text);
+    if (!stat) {
+        errno = ESRCH; // an empty file: the process ended between open and read
+    }
+    return stat;
+}
+
+ProcessStatus decodeStatus(std::string_view text) {
+    using Field = std::pair<std::string_view, std::uint64_t ProcessStatus::*>;
+    static constexpr std::array<Field, 7> sizes{{
+        {"VmHWM", &ProcessStatus::peakResident},
+        {"VmLck", &ProcessStatus::locked},
+        {"RssAnon", &ProcessStatus::residentAnonymous},
+        {"RssShmem", &ProcessStatus::residentShared},
+        {"VmPTE", &ProcessStatus::pageTables},
+        {"VmSwap", &ProcessStatus::swapped},
+        {"HugetlbPages", &ProcessStatus::hugetlb},
+    }};
+    ProcessStatus status;
+    while (!text.empty()) {
+        std::string_view line = takeLine(text);
+        const std::string_view key = takeUntil(line, ':');
+        if (key == "Tgid") {
+            takeNumber(line, &status.threadGroup);
+        }
+        for (const auto& [name, member] : sizes) {
+            std::uint64_t kibibytes = 0;
+            if (key == name && takeNumber(line, &kibibytes)) {
+                status.*member = kibibytes * 1024;
+                status.hasAddressSpace = true;
+            }
+        }
+    }
+    return status;
+}
+
+std::optional<ProcessStatus> readProcessStatus(std::int32_t pid) {
+    const std::optional<std::string> text = readSystemFile(processFolder(pid) + "/status");
+    return text ? std::optional(decodeStatus(*text)) : std::nullopt;
+}
+
+} // namespace tally::platform

@@ -1,0 +1,51 @@
+// /proc/PID/stat and /proc/PID/status, decoded.
+
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace tally::platform {
+
+struct ProcessStat {
+    std::int32_t pid = 0;
+    std::string comm; // command name, any bytes
+    char state = '?';
+    std::int32_t parent = 0;
+    std::uint32_t flags = 0;
+    std::int64_t threads = 0;
+    std::uint64_t startTicks = 0; // clock ticks since boot
+
+    static constexpr std::uint32_t KernelThread = 0x00200000;
+    bool isKernelThread() const { return (flags & KernelThread) != 0; }
+    /// Ended, with no thread left that lives on without its leader.
+    bool isZombie() const { return (state == 'Z' || state == 'X') && threads <= 1; }
+};
+
+/// Decodes the text of a stat file; absent when it is none.
+std::optional<ProcessStat> decodeStat(std::string_view text);
+
+/// Reads /proc/PID/stat; absent when that fails, with errno.
+std::optional<ProcessStat> readProcessStat(std::int32_t pid);
+
+/// Figures of a status file; sizes in bytes, 0 where the kernel names none.
+struct ProcessStatus {
+    std::int32_t threadGroup = 0;
+    std::uint64_t peakResident = 0;      // VmHWM
+    std::uint64_t locked = 0;            // VmLck
+    std::uint64_t residentAnonymous = 0; // RssAnon
+    std::uint64_t residentShared = 0;    // RssShmem
+    std::uint64_t pageTables = 0;        // VmPTE
+    std::uint64_t swapped = 0;           // VmSwap
+    std::uint64_t hugetlb = 0;           // HugetlbPages
+    bool hasAddressSpace = false;        // the process has not ended
+};
+
+ProcessStatus decodeStatus(std::string_view text);
+
+/// Reads /proc/PID/status; absent when that fails, with errno.
+std::optional<ProcessStatus> readProcessStatus(std::int32_t pid);
+
+} // namespace tally::platform

@@ -1,0 +1,78 @@
+#include "platform/linux/walk/PageScan.h"
+
+#include "platform/linux/walk/Mapping.h"
+
+#include <sys/ioctl.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+
+namespace tally::platform {
+
+namespace {
+
+struct pm_scan_arg {
+    std::uint64_t size;
+    std::uint64_t flags;
+    std::uint64_t start;
+    std::uint64_t end;
+    std::uint64_t walk_end;
+    std::uint64_t vec;
+    std::uint64_t vec_len;
+    std::uint64_t max_pages;
+    std::uint64_t category_inverted;
+    std::uint64_t category_mask;
+    std::uint64_t category_anyof_mask;
+    std::uint64_t return_mask;
+};
+static_assert(sizeof(pm_scan_arg) == 96);
+
+constexpr unsigned long PAGEMAP_SCAN = _IOWR('f', 16, pm_scan_arg);
+constexpr std::uint64_t mostPages = (16 << 20) / basePage;
+constexpr std::uint64_t mostAddresses = 1 << 30;
+// Of a call that gives more regions than this, the kernel's own note of where it ended is stale (seen
+// on 6.18).
+constexpr std::size_t mostRegions = 512;
+
+} // namespace
+
+int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile, std::span<PageRegion> room,
+              PageScanStep* step) {
+    static std::atomic<bool> tellsGuards = true; // false once this kernel has refused the category
+    const std::span<PageRegion> used = room.first(std::min(room.size(), mostRegions));
+    for (;;) {
+        const bool withGuards = tellsGuards;
+        pm_scan_arg query{};
+        query.size = sizeof(query);
+        query.start = start;
+        query.end = std::min(end, start + mostAddresses);
+        query.vec = reinterpret_cast<std::uintptr_t>(used.data());
+        query.vec_len = used.size();
+        query.max_pages = mostPages;
+        query.category_anyof_mask = PageIsPresent | PageIsSwapped;
+        query.return_mask = PageIsPresent | PageIsSwapped | PageIsZero | (withFile ? PageIsFile : 0) |
+                            (withGuards ? PageIsGuard : 0);
+        const int count = ioctl(pagemap, PAGEMAP_SCAN, &query);
+        if (count < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            if (errno == EINVAL && withGuards) {
+                tellsGuards = false;
+                continue;
+            }
+            return errno;
+        }
+        step->regions = used.first(static_cast<std::size_t>(count));
+        std::uint64_t pages = 0;
+        for (const PageRegion& region : step->regions) {
+            pages += (region.end - region.start) / basePage;
+        }
+        const bool complete = step->regions.size() < used.size() && pages < mostPages;
+        step->resume = complete ? query.end : step->regions.back().end;
+        return 0;
+    }
+}
+
+} // namespace tally::platform

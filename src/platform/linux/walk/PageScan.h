@@ -1,0 +1,37 @@
+// PAGEMAP_SCAN, the kernel's query for runs of pages of one state (6.7 and later).
+
+#pragma once
+
+#include <cstdint>
+#include <span>
+
+namespace tally::platform {
+
+/// As the kernel lays it out (struct page_region of include/uapi/linux/fs.h); the installed headers are
+/// older.
+struct PageRegion {
+    std::uint64_t start = 0; // addresses
+    std::uint64_t end = 0;
+    std::uint64_t categories = 0;
+};
+
+inline constexpr std::uint64_t PageIsFile = 4;
+inline constexpr std::uint64_t PageIsPresent = 8;
+inline constexpr std::uint64_t PageIsSwapped = 16;
+inline constexpr std::uint64_t PageIsZero = 32; // the kernel's zero page: no memory of its own
+inline constexpr std::uint64_t PageIsGuard = 256;
+
+/// Which runs one call gave, and how far it came.
+struct PageScanStep {
+    std::span<const PageRegion> regions; // valid until the next call
+    std::uint64_t resume = 0;            // address at which to go on
+};
+
+/// Scans [start, end) for present and swapped pages, at most 16 MiB of them or 1 GiB of addresses a call: the
+/// target's own calls that change its address space wait for a scan.
+/// @param withFile whether to tell file pages from others, which costs the kernel twice the time.
+/// @return 0, or the error: ESRCH when the task has ended, ENOTTY when this kernel has no such query.
+int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile, std::span<PageRegion> room,
+              PageScanStep* step);
+
+} // namespace tally::platform

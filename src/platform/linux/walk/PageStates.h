@@ -1,0 +1,78 @@
+// The states of a process's pages: how many of each mapping are where, and for what is shared or of a file
+// which.
+//
+// Read by PAGEMAP_SCAN (6.7 and later), else from smaps and pagemap. Both give the same figures.
+
+#pragma once
+
+#include "platform/kern_return.h"
+#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/walk/ProcessMemoryFiles.h"
+
+#include <cstddef>
+#include <cstdint>
+#include <span>
+#include <vector>
+
+namespace tally::platform {
+
+class SmapsOfProcess;
+
+enum class PageKind : std::uint8_t {
+    object,    // a page of the file or shared memory that is mapped
+    anonymous, // the task's own: anonymous memory, or its copy of a file's page
+    swapped,   // the task's own, swapped out
+};
+
+/// Consecutive pages of one kind; page numbers count from the start of the mapping.
+struct PageRun {
+    std::uint64_t firstPage = 0;
+    std::uint64_t pages = 0;
+    PageKind kind = PageKind::object;
+
+    std::uint64_t endPage() const { return firstPage + pages; }
+};
+
+/// Pages of one mapping. `runs` is a slice of PageStates::runs, empty for private anonymous memory.
+struct MappingPages {
+    std::uint64_t object = 0;
+    std::uint64_t anonymous = 0;
+    std::uint64_t swapped = 0;
+    std::size_t firstRun = 0;
+    std::size_t runCount = 0;
+    bool unreadable = false;
+
+    std::uint64_t own() const { return anonymous + swapped; }
+};
+
+struct PageStates {
+    std::vector<MappingPages> mappings; // one per mapping, as far as the task lived
+    std::vector<PageRun> runs;
+
+    std::span<const PageRun> runsOf(const MappingPages& pages) const {
+        return std::span(runs).subspan(pages.firstRun, pages.runCount);
+    }
+};
+
+/// Enters runs of pages, in rising order, into the counts and runs of the mappings they lie in.
+class PageRecorder {
+  public:
+    PageRecorder(std::span<const Mapping> mappings, PageStates* states)
+        : mappings_(mappings), states_(states) {}
+
+    /// Records the part of the addresses [start, end) that lies in mapping `index`.
+    void record(std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind);
+
+  private:
+    std::span<const Mapping> mappings_;
+    PageStates* states_;
+};
+
+/// Reads the states of all `mappings`.
+/// @return KERN_SUCCESS; KERN_INVALID_ARGUMENT when the task ended on the way: `states->mappings` then holds
+/// the
+///         mappings that were read in full. A mapping whose states no source gives is marked unreadable.
+kern_return_t readPageStates(const ProcessMemoryFiles& files, std::span<const Mapping> mappings,
+                             SmapsOfProcess& smaps, PageStates* states);
+
+} // namespace tally::platform

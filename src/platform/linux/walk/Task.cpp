@@ -1,0 +1,126 @@
+#include "platform/linux/walk/Task.h"
+
+#include "platform/bsd_process.h"
+#include "platform/gather.h"
+#include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/walk/AccountingSwitch.h"
+#include "platform/linux/walk/ProcessMemoryFiles.h"
+#include "platform/mach_task.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <mutex>
+#include <unordered_map>
+#include <utility>
+
+namespace tally::platform {
+
+namespace {
+
+struct PortEntry {
+    std::shared_ptr<Task> task;
+    std::uint32_t references = 1;
+};
+
+class PortTable {
+  public:
+    mach_port_t add(std::shared_ptr<Task> task) {
+        const std::scoped_lock lock(mutex_);
+        const mach_port_t name = nextName_++;
+        ports_.emplace(name, PortEntry{std::move(task)});
+        byPid_[ports_[name].task->pid()] = name;
+        return name;
+    }
+
+    std::shared_ptr<Task> find(mach_port_t name) {
+        const std::scoped_lock lock(mutex_);
+        const auto found = ports_.find(name);
+        return found == ports_.end() ? nullptr : found->second.task;
+    }
+
+    std::shared_ptr<Task> findProcess(std::int32_t pid) {
+        const std::scoped_lock lock(mutex_);
+        const auto name = byPid_.find(pid);
+        return name == byPid_.end() ? nullptr : ports_[name->second].task;
+    }
+
+    kern_return_t changeReferences(mach_port_t name, int change) {
+        std::shared_ptr<Task> released; // destroyed after the lock is given back
+        const std::scoped_lock lock(mutex_);
+        const auto found = ports_.find(name);
+        if (found == ports_.end()) {
+            return KERN_INVALID_ARGUMENT;
+        }
+        found->second.references += static_cast<std::uint32_t>(change);
+        if (found->second.references == 0) {
+            released = std::move(found->second.task);
+            const auto byPid = byPid_.find(released->pid());
+            if (byPid != byPid_.end() && byPid->second == name) {
+                byPid_.erase(byPid);
+            }
+            ports_.erase(found);
+        }
+        return KERN_SUCCESS;
+    }
+
+  private:
+    std::mutex mutex_;
+    mach_port_t nextName_ = 0x103; // 0 is no port
+    std::unordered_map<mach_port_t, PortEntry> ports_;
+    std::unordered_map<std::int32_t, mach_port_t> byPid_; // the latest right to each process
+};
+
+PortTable& portTable() {
+    static PortTable table;
+    return table;
+}
+
+} // namespace
+
+const Walk* Task::walk(kern_return_t* status) {
+    *status = KERN_SUCCESS;
+    if (!walk_) {
+        Walk::Result result = Walk::read(pid_, startTicks_, !accountingSwitchIsOn());
+        *status = result.status;
+        walk_ = std::move(result.walk);
+        for (std::string& notice : result.notices) {
+            if (std::find(given_.begin(), given_.end(), notice) == given_.end()) {
+                given_.push_back(notice);
+                notices_.push_back(std::move(notice));
+            }
+        }
+    }
+    return walk_.get();
+}
+
+std::shared_ptr<Task> taskOfPort(mach_port_t port) { return portTable().find(port); }
+
+std::shared_ptr<Task> taskOfProcess(std::int32_t pid) { return portTable().findProcess(pid); }
+
+kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
+    *task = MACH_PORT_NULL;
+    const std::optional<ProcessStat> stat = readProcessStat(pid);
+    if (!stat || stat->isKernelThread()) {
+        return KERN_FAILURE;
+    }
+    // The right to read the mappings is what opening them tells. One that has ended has none to show: its
+    // walk says so.
+    const Descriptor maps = openForReading(processFolder(pid) + "/maps");
+    if (!maps.isOpen() && statusForErrno(errno) == KERN_NO_ACCESS) {
+        return KERN_NO_ACCESS;
+    }
+    *task = portTable().add(std::make_shared<Task>(pid, stat->startTicks));
+    return KERN_SUCCESS;
+}
+
+kern_return_t mach_port_retain(mach_port_t port) { return portTable().changeReferences(port, 1); }
+
+kern_return_t mach_port_deallocate(mach_port_t port) { return portTable().changeReferences(port, -1); }
+
+std::vector<std::string> task_take_notices(mach_port_t task) {
+    const std::shared_ptr<Task> found = taskOfPort(task);
+    return found ? found->takeNotices() : std::vector<std::string>();
+}
+
+} // namespace tally::platform

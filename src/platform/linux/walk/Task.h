@@ -1,0 +1,44 @@
+// Task: what a port right to a process stands for, and the table of such rights.
+
+#pragma once
+
+#include "platform/kern_return.h"
+#include "platform/linux/walk/Walk.h"
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace tally::platform {
+
+/// One process, by pid and start time: a pid that is used again is another task. Holds no descriptor. The
+/// walk that is under way is used by one thread at a time.
+class Task {
+  public:
+    Task(std::int32_t pid, std::uint64_t startTicks) : pid_(pid), startTicks_(startTicks) {}
+
+    std::int32_t pid() const { return pid_; }
+
+    /// The walk that is under way; starts one when there is none.
+    /// @return null with `*status` when the address space cannot be read.
+    const Walk* walk(kern_return_t* status);
+    void endWalk() { walk_.reset(); }
+    std::vector<std::string> takeNotices() { return std::exchange(notices_, {}); }
+
+  private:
+    std::int32_t pid_;
+    std::uint64_t startTicks_;
+    std::unique_ptr<const Walk> walk_;
+    std::vector<std::string> notices_;
+    std::vector<std::string> given_; // notices that were given once already
+};
+
+/// The task that `port` names; null when it names none.
+std::shared_ptr<Task> taskOfPort(mach_port_t port);
+
+/// A task of process `pid` to which a right exists; null when there is none.
+std::shared_ptr<Task> taskOfProcess(std::int32_t pid);
+
+} // namespace tally::platform

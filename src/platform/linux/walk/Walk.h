@@ -1,0 +1,51 @@
+// Walk: the address space of one task as it was read at the start of a walk.
+//
+// Reads the mappings and the states of their pages once and answers every region and page query from that, so
+// that counts and pages agree.
+
+#pragma once
+
+#include "platform/kern_return.h"
+#include "platform/linux/pieces/Piece.h"
+#include "platform/linux/walk/Mapping.h"
+
+#include <cstdint>
+#include <memory>
+#include <span>
+#include <string>
+#include <vector>
+
+namespace tally::platform {
+
+class Walk {
+  public:
+    struct Result {
+        std::unique_ptr<const Walk> walk; // null unless KERN_SUCCESS
+        kern_return_t status = KERN_SUCCESS;
+        std::vector<std::string> notices;
+    };
+
+    /// Reads the address space of process `pid`, which must be the one that started at `startTicks`.
+    /// @param objectView counts as the VM objects see it instead of as charged to the task.
+    static Result read(std::int32_t pid, std::uint64_t startTicks, bool objectView);
+
+    /// The first piece that ends above `address`; null when there is none.
+    const Piece* pieceAt(std::uint64_t address) const;
+    /// What a query above the last piece answers: KERN_INVALID_ADDRESS, or why the walk could not go on
+    /// there.
+    kern_return_t statusPastEnd() const { return statusPastEnd_; }
+    const Mapping& mappingOf(const Piece& piece) const { return mappings_[piece.mapping]; }
+
+    /// Fills one disposition word per page from `address` on.
+    void pageWords(std::uint64_t address, std::span<std::int32_t> words) const;
+
+  private:
+    void pageWordsOf(const Piece& piece, std::uint64_t firstPage, std::span<std::int32_t> words) const;
+
+    std::vector<Mapping> mappings_;
+    std::vector<Piece> pieces_; // in rising order
+    std::vector<PageWords> words_;
+    kern_return_t statusPastEnd_ = KERN_INVALID_ADDRESS;
+};
+
+} // namespace tally::platform
