@@ -1,0 +1,89 @@
+// What both platforms share: dates, error texts and the option scanner.
+
+#include "platform/clock.h"
+#include "platform/kern_return.h"
+#include "platform/system.h"
+
+#include <gtest/gtest.h>
+
+#include <array>
+#include <cstdlib>
+#include <ctime>
+#include <string>
+#include <vector>
+
+namespace tally::platform {
+namespace {
+
+TEST(LocalDate, GivesTheZonesOffsetAndCutsMilliseconds) {
+    struct Case {
+        const char* zone;
+        std::int64_t milliseconds;
+        const char* date;
+    };
+    const Case cases[] = {
+        {"UTC0", 1'714'571'112'345, "2024-05-01 13:45:12.345Z"},
+        {"CET-1CEST,M3.5.0,M10.5.0/3", 1'714'571'112'000, "2024-05-01 15:45:12.000+02:00"},
+        {"CET-1CEST,M3.5.0,M10.5.0/3", 1'705'000'000'999, "2024-01-11 20:06:40.999+01:00"},
+        {"NST3:30", 1'714'571'112'345, "2024-05-01 10:15:12.345-03:30"},
+        {"UTC0", -1, "1969-12-31 23:59:59.999Z"},
+    };
+    for (const Case& expected : cases) {
+        setenv("TZ", expected.zone, 1);
+        tzset();
+        const auto shortly = std::chrono::microseconds(999); // less than the date shows
+        EXPECT_EQ(iso8601LocalDate(std::chrono::system_clock::time_point(
+                      std::chrono::milliseconds(expected.milliseconds) + shortly)),
+                  expected.date);
+    }
+    unsetenv("TZ");
+    tzset();
+}
+
+TEST(ErrorTexts, SayWhatTheStatusMeans) {
+    testing::internal::CaptureStderr();
+    mach_error("mach_vm_region", KERN_INVALID_ARGUMENT);
+    mach_error("task_read_for_pid", 12345);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "mach_vm_region: invalid argument\ntask_read_for_pid: unknown error code\n");
+}
+
+struct Scan {
+    std::vector<int> options;
+    std::vector<std::string> arguments; // of the options, "-" where there is none
+    std::vector<std::string> rest;
+};
+
+Scan scan(std::vector<std::string> words) {
+    const std::array<LongOption, 2> known{{{"pid", true, 'p'}, {"wired", false, 1000}}};
+    std::vector<char*> argv;
+    words.insert(words.begin(), "tally");
+    for (std::string& word : words) {
+        argv.push_back(word.data());
+    }
+    argv.push_back(nullptr);
+    OptionScanner scanner(static_cast<int>(words.size()), argv.data(), "p:v", known);
+    Scan result;
+    for (int option = scanner.next(); option != OptionScanner::End; option = scanner.next()) {
+        result.options.push_back(option);
+        result.arguments.emplace_back(scanner.argument() == nullptr ? "-" : scanner.argument());
+    }
+    result.rest.assign(argv.begin() + scanner.index(), argv.end() - 1);
+    return result;
+}
+
+TEST(OptionScanner, ScansEachVectorFromItsStart) {
+    const Scan first = scan({"bash", "-p", "7", "-vp8", "--wired", "--pid=9", "--", "-x"});
+    EXPECT_EQ(first.options, (std::vector<int>{'p', 'v', 'p', 1000, 'p'}));
+    EXPECT_EQ(first.arguments, (std::vector<std::string>{"7", "-", "8", "-", "9"}));
+    EXPECT_EQ(first.rest, (std::vector<std::string>{"bash", "-x"}));
+    // A second scan in the same program, of a shorter vector, and again with diagnostics.
+    EXPECT_EQ(scan({"-v"}).options, std::vector<int>{'v'});
+    testing::internal::CaptureStderr();
+    EXPECT_EQ(scan({"-q", "--pid"}).options, (std::vector<int>(2, OptionScanner::Unknown)));
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "tally: invalid option -- 'q'\ntally: option '--pid' requires an argument\n");
+}
+
+} // namespace
+} // namespace tally::platform
