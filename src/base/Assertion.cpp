@@ -6,11 +6,11 @@
 
 namespace tally {
 
-void failAssertion(const char* expression, std::source_location where) {
-    std::string_view file = where.file_name();
-    file.remove_prefix(file.rfind('/') + 1);
-    std::fprintf(stderr, "Assertion failed: (%s), function %s, file %.*s, line %u.\n", expression,
-                 where.function_name(), static_cast<int>(file.size()), file.data(), where.line());
+void failAssertion(const char* expression, const char* function, const char* file, unsigned line) {
+    std::string_view name = file;
+    name.remove_prefix(name.rfind('/') + 1);
+    std::fprintf(stderr, "Assertion failed: (%s), function %s, file %.*s, line %u.\n", expression, function,
+                 static_cast<int>(name.size()), name.data(), line);
     std::abort();
 }
 

@@ -4,20 +4,18 @@
 
 #pragma once
 
-#include <source_location>
-
 namespace tally {
 
 /// Writes "Assertion failed: (<expression>), function <f>, file <file>, line <line>." to standard error and
-/// aborts.
-[[noreturn]] void failAssertion(const char* expression,
-                                std::source_location where = std::source_location::current());
+/// aborts. The place is the caller's. (std::source_location is not known to every compiler that reads this.)
+[[noreturn]] void failAssertion(const char* expression, const char* function = __builtin_FUNCTION(),
+                                const char* file = __builtin_FILE(), unsigned line = __builtin_LINE());
 
 /// Stops the program with `expression` as its message unless `holds`.
-inline void tl_assert(bool holds, const char* expression,
-                      std::source_location where = std::source_location::current()) {
+inline void tl_assert(bool holds, const char* expression, const char* function = __builtin_FUNCTION(),
+                      const char* file = __builtin_FILE(), unsigned line = __builtin_LINE()) {
     if (!holds) [[unlikely]] {
-        failAssertion(expression, where);
+        failAssertion(expression, function, file, line);
     }
 }
 
