@@ -21,6 +21,8 @@ void fillField(char (&field)[N], std::string_view text) {
 
 std::string_view commandName(const ScriptedTask& task) { return task.comm ? *task.comm : task.name; }
 
+std::uint32_t statusOf(const ScriptedTask& task) { return task.state == TaskState::zombie ? SZOMB : SRUN; }
+
 std::string argumentArea(const ScriptedTask& task) {
     if (task.argumentArea) {
         return *task.argumentArea;
@@ -75,14 +77,14 @@ int proc_listallpids(std::span<std::int32_t> pids) {
 
 int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
     const Answer answer("proc_pidinfo", pid);
-    const ScriptedTask* task = answer.runningTask(pid); // of a zombie there is only the short record
+    const ScriptedTask* task = answer.kernel.findTask(pid);
     if (answer.fault != 0 || task == nullptr) {
         Answer::refuse(answer.fault != 0 ? answer.fault : ESRCH);
         return 0;
     }
     *info = {};
     info->pbi_flags = task->flags;
-    info->pbi_status = SRUN;
+    info->pbi_status = statusOf(*task);
     info->pbi_pid = task->pid;
     info->pbi_ppid = task->parent;
     fillField(info->pbi_comm, commandName(*task));
@@ -101,7 +103,7 @@ int proc_pidinfo(std::int32_t pid, proc_bsdshortinfo* info) {
     *info = {};
     info->pbsi_pid = task->pid;
     info->pbsi_ppid = task->parent;
-    info->pbsi_status = task->state == TaskState::zombie ? SZOMB : SRUN;
+    info->pbsi_status = statusOf(*task);
     fillField(info->pbsi_comm, commandName(*task));
     return sizeof *info;
 }

@@ -13,7 +13,7 @@ namespace tally::platform {
 kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     const Answer answer("task_read_for_pid", pid);
     *task = MACH_PORT_NULL;
-    ScriptedTask* scripted = answer.runningTask(pid);
+    ScriptedTask* scripted = answer.kernel.findTask(pid); // a zombie has a port too, of a dead task
     if (answer.fault != 0 || scripted == nullptr) {
         return answer.fault != 0 ? answer.fault : KERN_FAILURE;
     }
