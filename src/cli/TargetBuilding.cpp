@@ -1,0 +1,278 @@
+#include "cli/TargetBuilding.h"
+
+#include "base/Format.h"
+#include "platform/mach_task.h"
+#include "platform/system.h"
+#include "process/TLCorpseProcess.h"
+#include "process/TLHeapsnapProcess.h"
+#include "process/TLUserProcess.h"
+
+#include <cinttypes>
+#include <cstdio>
+#include <filesystem>
+#include <functional>
+#include <system_error>
+#include <utility>
+
+namespace tally {
+
+using namespace platform;
+
+namespace {
+
+/// What `texts` describe; nothing where the process list cannot be had, which is then one of the `errors`.
+TLTargetPids resolved(const std::set<std::string>& texts, std::vector<std::string>* errors) {
+    if (texts.empty()) { // not worth a list of all processes
+        return {};
+    }
+    const std::vector<std::string> descriptions(texts.begin(), texts.end());
+    return pidsForStringDescriptions(descriptions, errors).value_or(TLTargetPids());
+}
+
+/// One building of the table. A step that returns false has ended it, with `error_` as the reason.
+class TargetBuilder {
+  public:
+    explicit TargetBuilder(TLTallyArgs& args) : args_(args) {}
+
+    bool build();
+
+    TLProcessTable takeTable() { return std::move(table_); }
+    const std::optional<TLError>& error() const { return error_; }
+
+  private:
+    bool openSnapshots();
+    bool openSnapshot(const std::string& path);
+    bool adoptModeOfSnapshot(const std::string& path, bool breakDownPhysTally);
+    bool targetOneProcess(const std::string& text);
+    TLPidSet exclusionSet() const;
+    bool targetEveryProcess(const TLPidSet& excluded);
+    bool targetNamedProcesses(const TLPidSet& excluded);
+    void resolveNames();
+    bool addChildren();
+    bool searchAllProcessesBut(TLPidSet excluded);
+    std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name) const;
+
+    bool fail(int code, std::string message) {
+        error_ = TLError{TLTallyErrorDomain, code, std::move(message)};
+        return false;
+    }
+
+    TLTallyArgs& args_;
+    TLProcessTable table_;
+    std::optional<TLError> error_;
+};
+
+bool TargetBuilder::build() {
+    if (!openSnapshots()) {
+        return false;
+    }
+    if (args_.targetPids.empty() && args_.potentialTargetProcesses.empty() && table_.empty() &&
+        !args_.targetAll) {
+        return fail(TLErrorNoTargets, "Must specify at least one process or heapsnap");
+    }
+    const TLPidSet excluded = exclusionSet();
+    if (!(args_.targetAll ? targetEveryProcess(excluded) : targetNamedProcesses(excluded))) {
+        return false;
+    }
+    if (args_.skipIdleExitClean) {
+        table_ = removeIdleExitCleanProcessesFrom(table_);
+    }
+    return true;
+}
+
+/// What names a file is a snapshot or, failing that, a process.
+bool TargetBuilder::openSnapshots() {
+    const std::set<std::string> texts = args_.potentialTargetProcesses;
+    for (const std::string& text : texts) {
+        std::error_code ignored;
+        if (std::filesystem::exists(text, ignored)) {
+            if (!openSnapshot(text)) {
+                return false;
+            }
+            args_.potentialTargetProcesses.erase(text);
+        }
+    }
+    return true;
+}
+
+bool TargetBuilder::openSnapshot(const std::string& path) {
+    std::optional<TLError> openError;
+    const std::shared_ptr<TLProcess> snapshot = processWithHeapsnap(path, &openError);
+    if (!snapshot) {
+        return targetOneProcess(path) ||
+               fail(TLErrorBadSnapshot,
+                    formatted("Error opening heapsnap %s: %s", printable(path).c_str(),
+                              openError ? printable(openError->message).c_str() : "unknown error"));
+    }
+    // A key that no pid has.
+    table_[std::hash<std::string>()(path) | std::uint64_t{1} << 63] = snapshot;
+    return adoptModeOfSnapshot(path, snapshot->breakDownPhysTally());
+}
+
+/// The first snapshot fixes the analysis mode, unless an option has; every other one must agree.
+bool TargetBuilder::adoptModeOfSnapshot(const std::string& path, bool breakDownPhysTally) {
+    if (args_.didSetShouldGetPhysTallyBreakdown && args_.shouldGetPhysTallyBreakdown != breakDownPhysTally) {
+        return fail(TLErrorSnapshotConflict,
+                    "Heapsnap was gathered with an analysis mode that conflicts with other heapsnaps or "
+                    "command line arguments: " +
+                        printable(path));
+    }
+    if (args_.searchForUnmapped) {
+        return fail(TLErrorSnapshotConflict,
+                    "--unmapped is not compatible with heapsnaps (" + printable(path) +
+                        ").\nRemove the flag for best effort 'unmapped' analysis (which may be more than "
+                        "other tools such as regionlist(1) but less than tally(1) analyzing a running "
+                        "process).");
+    }
+    args_.shouldGetPhysTallyBreakdown = breakDownPhysTally;
+    args_.didSetShouldGetPhysTallyBreakdown = true;
+    return true;
+}
+
+/// Targets one process that `text`, the name of a file as well, describes.
+bool TargetBuilder::targetOneProcess(const std::string& text) {
+    const TLTargetPids matches = resolved({text}, nullptr);
+    if (matches.empty()) {
+        return false;
+    }
+    const auto& [pid, name] = *matches.begin();
+    if (matches.size() > 1) {
+        std::fprintf(stderr,
+                     "NOTICE: '%s' is also a file here, so only process %d of the %zu that match is analyzed "
+                     "(use --pid for the others)\n",
+                     printable(text).c_str(), pid, matches.size());
+    }
+    args_.targetPids[pid] = name;
+    return true;
+}
+
+TLPidSet TargetBuilder::exclusionSet() const {
+    TLPidSet excluded;
+    if (args_.excludeSelf) {
+        excluded.insert(ownPid());
+    }
+    for (const auto& [pid, name] : resolved(args_.excludedPidsOrProcesses, nullptr)) {
+        excluded.insert(pid);
+    }
+    return excluded;
+}
+
+bool TargetBuilder::targetEveryProcess(const TLPidSet& excluded) {
+    TLUnreadableProcesses unreadable;
+    auto processes = allProcessesExcludingPids(excluded, &unreadable);
+    if (!processes) {
+        return false;
+    }
+    if (unreadable.count != 0) {
+        std::fprintf(stderr,
+                     "NOTICE: processes that could not be read and are left out: %zu (with %" PRIu64
+                     " bytes of resident anonymous memory)\n",
+                     unreadable.count, unreadable.residentAnonymous);
+    }
+    table_ = *std::move(processes);
+    return true;
+}
+
+bool TargetBuilder::targetNamedProcesses(const TLPidSet& excluded) {
+    resolveNames();
+    std::erase_if(args_.targetPids, [&](const auto& target) { return excluded.contains(target.first); });
+    // After the exclusions: an excluded process that descends from a target is one again.
+    if (args_.targetChildren && !addChildren()) {
+        return false;
+    }
+    if (args_.searchForUnmapped && !searchAllProcessesBut(excluded)) {
+        return false;
+    }
+    for (const auto& [pid, name] : args_.targetPids) {
+        if (auto process = liveTarget(pid, name)) {
+            table_[static_cast<std::uint64_t>(pid)] = std::move(process);
+        }
+    }
+    return true;
+}
+
+/// Targets what the remaining strings describe. Those that describe nothing are an error which ends nothing.
+void TargetBuilder::resolveNames() {
+    std::vector<std::string> errors;
+    for (const auto& [pid, name] : resolved(args_.potentialTargetProcesses, &errors)) {
+        args_.targetPids[pid] = name;
+    }
+    if (!errors.empty()) {
+        std::string message;
+        for (const std::string& error : errors) {
+            message += (message.empty() ? "" : "\n") + error;
+        }
+        error_ = TLError{TLTallyErrorDomain, TLErrorBadPid, std::move(message)};
+    }
+}
+
+bool TargetBuilder::addChildren() {
+    std::vector<std::int32_t> targets;
+    for (const auto& [pid, name] : args_.targetPids) {
+        targets.push_back(pid);
+    }
+    const auto family = childPidsForPids(targets);
+    if (!family) {
+        return false;
+    }
+    for (const std::int32_t pid : *family) {
+        args_.targetPids[pid] = std::nullopt;
+    }
+    return true;
+}
+
+/// Starts the table with all processes but the targets, `excluded` and the kernel: searched, not shown.
+bool TargetBuilder::searchAllProcessesBut(TLPidSet excluded) {
+    for (const auto& [pid, name] : args_.targetPids) {
+        excluded.insert(pid);
+    }
+    excluded.insert(0);
+    auto processes = allProcessesExcludingPids(excluded);
+    if (!processes) {
+        return false;
+    }
+    for (const auto& [pid, process] : *processes) {
+        process->setHiddenFromDisplay(true);
+    }
+    table_ = *std::move(processes);
+    return true;
+}
+
+/// The process of a targeted pid, or its corpse; null, with a message, when there is none.
+std::shared_ptr<TLProcess> TargetBuilder::liveTarget(std::int32_t pid, const TLTargetName& name) const {
+    std::shared_ptr<TLProcess> process = TLProcess::processWithPid(pid);
+    if (!process) {
+        if (name) {
+            std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n",
+                         printable(*name).c_str(), long{pid});
+        } else {
+            std::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", long{pid});
+        }
+        return nullptr;
+    }
+    const auto* live = dynamic_cast<const TLUserProcess*>(process.get());
+    if (!args_.forkCorpse || live == nullptr) {
+        return process;
+    }
+    mach_port_t corpse = MACH_PORT_NULL;
+    if (const kern_return_t status = task_generate_corpse(live->task(), &corpse); status != KERN_SUCCESS) {
+        std::fprintf(stderr, "Unable to fork a corpse of process %s [%d]: %s\n",
+                     printable(process->name()).c_str(), pid, mach_error_string(status));
+        return nullptr;
+    }
+    const PortRight ours(corpse); // the corpse process takes a right of its own
+    return TLCorpseProcess::initWithCorpse(corpse);
+}
+
+} // namespace
+
+std::optional<TLProcessTable> targetProcessesForArgs(TLTallyArgs& args, std::optional<TLError>* error) {
+    TargetBuilder builder(args);
+    const bool built = builder.build();
+    if (error != nullptr) {
+        *error = builder.error();
+    }
+    return built ? std::optional(builder.takeTable()) : std::nullopt;
+}
+
+} // namespace tally
