@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <array>
 #include <cstring>
+#include <optional>
 
 namespace tally::platform {
 
@@ -24,10 +25,10 @@ struct Charges {
 /// The charges of the process that this thread read last: the usage record and the ledger that are asked one
 /// after the other come from one read, so that they agree.
 struct LastRead {
-    std::int32_t pid = -1;
+    std::int32_t pid = 0;
     Charges charges;
 };
-thread_local LastRead lastRead;
+thread_local std::optional<LastRead> lastRead;
 
 std::optional<Charges> readCharges(std::int32_t pid) {
     const std::optional<ProcessStatus> status = readProcessStatus(pid);
@@ -52,7 +53,7 @@ int proc_pid_rusage(std::int32_t pid, rusage_info_v5* info) {
     if (!charges) {
         return -1;
     }
-    lastRead = {pid, *charges};
+    lastRead = LastRead{pid, *charges};
     info->ri_phys_tally = charges->physTally;
     info->ri_lifetime_max_phys_tally = charges->peak;
     info->ri_resident_anonymous = charges->residentAnonymous;
@@ -72,9 +73,9 @@ int ledger_template(std::span<ledger_template_info> entries) {
 
 int ledger_entries(std::int32_t pid, std::span<ledger_entry_info> entries) {
     std::optional<Charges> charges;
-    if (lastRead.pid == pid) {
-        charges = lastRead.charges;
-        lastRead.pid = -1;
+    if (lastRead && lastRead->pid == pid) {
+        charges = lastRead->charges;
+        lastRead.reset();
     } else {
         charges = readCharges(pid);
     }

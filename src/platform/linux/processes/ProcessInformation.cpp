@@ -118,9 +118,6 @@ int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
 int proc_pidinfo(std::int32_t pid, proc_bsdshortinfo* info) {
     const std::optional<ProcessStat> stat = readUserProcess(pid);
     if (!stat) {
-        if (errno == ENOENT) {
-            errno = ESRCH;
-        }
         return 0;
     }
     *info = proc_bsdshortinfo();
@@ -149,6 +146,7 @@ std::ptrdiff_t sysctl_procargs2(std::int32_t pid, std::span<char> area) {
     std::optional<std::string> path = readSystemLink(processFolder(pid) + "/exe");
     const std::optional<std::string> arguments = readSystemFile(processFolder(pid) + "/cmdline");
     if (!path || !arguments) {
+        errno = errno == ENOENT ? ESRCH : errno;
         return -1;
     }
     constexpr std::string_view deleted = " (deleted)";

@@ -47,8 +47,21 @@ std::optional<ProcessStat> decodeStat(std::string_view text) {
     return stat;
 }
 
+namespace {
+
+/// Reads a file of the folder of process `pid`; a folder that is not there is a process that does not exist.
+std::optional<std::string> readProcessFile(std::int32_t pid, const char* name) {
+    std::optional<std::string> text = readSystemFile(processFolder(pid) + name);
+    if (!text && errno == ENOENT) {
+        errno = ESRCH;
+    }
+    return text;
+}
+
+} // namespace
+
 std::optional<ProcessStat> readProcessStat(std::int32_t pid) {
-    const std::optional<std::string> text = readSystemFile(processFolder(pid) + "/stat");
+    const std::optional<std::string> text = readProcessFile(pid, "/stat");
     if (!text) {
         return std::nullopt;
     }
@@ -89,7 +102,7 @@ ProcessStatus decodeStatus(std::string_view text) {
 }
 
 std::optional<ProcessStatus> readProcessStatus(std::int32_t pid) {
-    const std::optional<std::string> text = readSystemFile(processFolder(pid) + "/status");
+    const std::optional<std::string> text = readProcessFile(pid, "/status");
     return text ? std::optional(decodeStatus(*text)) : std::nullopt;
 }
 

@@ -1,0 +1,75 @@
+// Puppet: a child that holds memory as a test asked for, and the ledger it told.
+
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <string>
+#include <vector>
+
+namespace tally::test {
+
+/// A program started with pipes on its input and output; ended by pid when the holder goes away.
+class Puppet {
+  public:
+    /// What one mapping of the puppet must show.
+    struct Entry {
+        std::string name;
+        std::uint64_t address = 0;
+        std::uint64_t size = 0;                     // bytes
+        std::map<std::string, std::string> figures; // "dirty" and so on: bytes, or "any"
+    };
+
+    /// Starts the puppet program with `arguments` and waits until it is ready.
+    explicit Puppet(std::vector<std::string> arguments);
+    ~Puppet();
+    Puppet(const Puppet&) = delete;
+    Puppet& operator=(const Puppet&) = delete;
+
+    int pid() const { return pid_; }
+    const std::vector<Entry>& ledger() const { return ledger_; }
+    /// Sends SIGKILL and, unless it is to stay a zombie, waits for the end.
+    void end(bool leaveZombie = false);
+
+  private:
+    int pid_ = -1;
+    int input_ = -1;
+    std::vector<Entry> ledger_;
+};
+
+/// What a program wrote and how it ended.
+struct Outcome {
+    int status = -1; // exit status, or 128 + the signal
+    std::string output;
+    std::string errors;
+};
+
+/// Runs a program to its end. `folder` is its current folder, empty for the test's own.
+Outcome run(const std::vector<std::string>& command, const std::string& folder = "");
+
+/// A folder of the test's own, removed with what is in it.
+class TemporaryFolder {
+  public:
+    TemporaryFolder();
+    ~TemporaryFolder();
+    const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+/// Raises the machine's pool of huge pages, alone among tests, and puts it back. `granted` is how many pages
+/// there were to be had.
+class HugePagePool {
+  public:
+    explicit HugePagePool(int pages);
+    ~HugePagePool();
+    int granted() const { return granted_; }
+
+  private:
+    int lock_ = -1;
+    int before_ = 0;
+    int granted_ = 0;
+};
+
+} // namespace tally::test
