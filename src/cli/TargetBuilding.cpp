@@ -200,7 +200,7 @@ void TargetBuilder::resolveNames() {
     if (!errors.empty()) {
         std::string message;
         for (const std::string& error : errors) {
-            message += (message.empty() ? "" : "\n") + error;
+            message += (message.empty() ? "" : "\n") + printable(error);
         }
         error_ = TLError{TLTallyErrorDomain, TLErrorBadPid, std::move(message)};
     }

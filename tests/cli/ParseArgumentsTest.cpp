@@ -1,0 +1,138 @@
+#include "cli/ParseArguments.h"
+#include "cli/CommandLine.h"
+#include "cli/Usage.h"
+#include "platform/scripted/ScriptedKernel.h"
+
+namespace tally {
+namespace {
+
+struct Parse {
+    std::variant<TLTallyArgs, TLError> result;
+    std::string messages;
+};
+
+Parse parse(const std::string& words) {
+    CommandLine line(words);
+    Parse parse;
+    parse.messages = written([&] { parse.result = parseArguments(line.argc(), line.argv()); }).second;
+    return parse;
+}
+
+TEST(ParseArguments, OptionsSetTheirFields) {
+    using Args = TLTallyArgs;
+    using Strings = std::set<std::string>;
+    const auto lettered = [](const Args& a) {
+        return a.targetAll && a.targetChildren && a.skipIdleExitClean && a.textOptions == 7 &&
+               a.JSONOutputFile == "j" && a.excludedPidsOrProcesses == Strings{"x"} &&
+               a.potentialTargetProcesses == Strings{"7", "a", "b"} && a.targetPids.empty() &&
+               a.summaryFormat == TLSummaryFormat::pages;
+    };
+    const struct {
+        std::string words;
+        bool (*hold)(const Args&);
+    } cases[] = {
+        {"-atsw --swapped -ji -jj -xx -pa b -p a -fpages 7", lettered}, // later ones replace or add
+        {"--all --targetChildren --skip --wide --json j --exclude x --proc a --format=pages b 7", lettered},
+        {"-- -a", [](const Args& a) { return a.potentialTargetProcesses == Strings{"-a"} && !a.targetAll; }},
+        {"-v", [](const Args& a) { return a.regionlistLikeOutput && !a.summarize; }},
+        {"-f bytes", [](const Args& a) { return a.summaryFormat == TLSummaryFormat::bytes; }},
+        {"-f bytes -f formatted",
+         [](const Args& a) { return a.summaryFormat == TLSummaryFormat::formatted; }},
+        {"--sort REGIONS", [](const Args& a) { return a.textSort == "Regions"; }},
+        {"--swapped", [](const Args& a) { return a.textOptions == TLTextOptionSwapped; }},
+        {"--wired", [](const Args& a) { return a.textOptions == TLTextOptionWired; }},
+        {"--benchlog x", [](const Args& a) { return a.benchlogOutputFile == "x" && !a.JSONOutputFile; }},
+        {"--unmapped --forkCorpse", [](const Args& a) { return a.searchForUnmapped && a.forkCorpse; }},
+        {"--vmObjectDirty",
+         [](const Args& a) { return !a.shouldGetPhysTallyBreakdown && a.didSetShouldGetPhysTallyBreakdown; }},
+        {"--pid \t12abc --pid -5 --pid 4294967303", // the last one has 33 bits
+         [](const Args& a) {
+             return a.targetPids == TLTargetPids{{-5, {}}, {7, {}}, {12, {}}};
+         }},
+        {"--sample 0.5s", [](const Args& a) { return a.sampleInterval == 0.5; }},
+        {"--sample \t+2", [](const Args& a) { return a.sampleInterval == 2; }},
+        {"--sample 2.2250738585072014e-308", [](const Args& a) { return a.sampleInterval > 0; }},
+    };
+    for (const auto& [words, hold] : cases) {
+        const Parse got = parse(words);
+        const auto* args = std::get_if<TLTallyArgs>(&got.result);
+        EXPECT_TRUE(args != nullptr && hold(*args)) << words;
+        EXPECT_EQ(got.messages, "");
+    }
+}
+
+TEST(ParseArguments, TheFirstFailureEndsIt) {
+    const std::string badFormat =
+        "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.";
+    const std::string badSort =
+        "Unrecognized argument 'Siz?e' to --sort.\nAccepted arguments: dirty, swapped, "
+        "clean, reclaimable, wired, regions, category";
+    const std::string badPid = "'abc' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
+                               "specify a process name.";
+    const std::string corpse = "--forkCorpse is not compatible with -a/--all due to corpse resource limits";
+    struct Case {
+        std::string words;
+        int code;
+        std::string message;
+    };
+    std::vector<Case> cases = {{"-h", TLErrorHelp, ""},
+                               {"--help -f x", TLErrorHelp, ""},
+                               {"-f Bytes -h", TLErrorBadFormat, badFormat},
+                               {"--sort Siz\033e", TLErrorBadSort, badSort},
+                               {"--pid abc", TLErrorBadPid, badPid},
+                               {"--forkCorpse -a --unmapped", TLErrorCorpseOfAll, corpse}};
+    for (const std::string seconds : {"0", "-1", "abc", "inf", "nan", "1e999", "1e-310", "0x10"}) {
+        cases.push_back(
+            {"--sample " + seconds, TLErrorBadInterval, "Invalid sampling interval '" + seconds + "'"});
+    }
+    for (const auto& [words, code, message] : cases) {
+        const Parse got = parse(words);
+        const auto* error = std::get_if<TLError>(&got.result);
+        ASSERT_NE(error, nullptr) << words;
+        EXPECT_EQ(error->code, code) << words;
+        EXPECT_EQ(error->message, message);
+        EXPECT_EQ(got.messages, "");
+    }
+    for (const char* words : {"--nonsense", "-p"}) { // the scanner says what is wrong
+        const Parse got = parse(words);
+        EXPECT_EQ(std::get<TLError>(got.result).code, TLErrorBadOption);
+        EXPECT_NE(got.messages, "");
+    }
+}
+
+TEST(ParseArguments, WarningsStopNothing) {
+    const std::string summary =
+        "WARNING: -y/--summary options are deprecated because summary is the default mode\n";
+    const std::string ignored = "WARNING: ignoring '--unmapped' because the requested analysis mode "
+                                "'--vmObjectDirty' does not support unmapped owned VM objects\n";
+    const std::pair<std::string, std::string> cases[] = {
+        {"-y", summary},
+        {"--summary", summary},
+        {"--physTally", "WARNING: --physTally option is deprecated because it is the default mode\n"},
+        {"--unmapped -a", "NOTICE: '--unmapped' is redundant when using -a/--all\n"},
+        {"--unmapped --vmObjectDirty", ignored},
+        {"--unmapped --vmObjectDirty -a", ignored},
+    };
+    for (const auto& [words, messages] : cases) {
+        const Parse got = parse(words);
+        EXPECT_EQ(got.messages, messages);
+        EXPECT_FALSE(std::get<TLTallyArgs>(got.result).searchForUnmapped);
+    }
+}
+
+TEST(Usage, DescriptionsStandInOneColumn) {
+    platform::ScriptedKernel kernel;
+    kernel.internalContent.insert(subsystemIdentifier);
+    std::istringstream lines(written(printUsage).first);
+    int options = 0;
+    for (std::string line; std::getline(lines, line);) {
+        if (line.starts_with("    ")) {
+            ++options;
+            EXPECT_EQ(line.find_last_of(' ', 42), 41) << line;
+        }
+    }
+    EXPECT_EQ(options, 17);
+}
+
+} // namespace
+} // namespace tally
