@@ -2,11 +2,16 @@
 
 #pragma once
 
+#include "platform/clock.h"
+
 #include <chrono>
 #include <cstdint>
 #include <optional>
 
 namespace tally {
+
+/// `ticks` in nanoseconds. The product wraps modulo 2^64; a timebase without a denominator gives 0.
+std::uint64_t nanosecondsForTicks(std::uint64_t ticks, platform::mach_timebase timebase);
 
 class TLTime {
   public:
