@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace tally {
@@ -17,14 +18,16 @@ namespace tally {
 /// filled in the order of one process list.
 class TLProcessGroupMinimal {
   public:
+    TLProcessGroupMinimal() = default;
+    TLProcessGroupMinimal(TLProcessGroupMinimal&&) = default;
+    TLProcessGroupMinimal& operator=(TLProcessGroupMinimal&&) = default;
     virtual ~TLProcessGroupMinimal() = default;
 
-    /// Adds a process; nothing happens when it is a member already.
+    /// Adds a process; nothing happens when it is a member already. Cheap when pids rise.
     virtual void addProcess(const std::shared_ptr<TLProcess>& process);
 
-    /// The members, in the order of adding.
+    /// The members, ascending by pid.
     const std::vector<std::shared_ptr<TLProcess>>& processes() const { return processes_; }
-    bool contains(const TLProcess& process) const;
     std::uint64_t hash() const { return hashValue_; }
     virtual bool isEqual(const TLProcessGroupMinimal& other) const;
     std::string description() const;
@@ -32,6 +35,7 @@ class TLProcessGroupMinimal {
   protected:
     bool hasSameMembers(const TLProcessGroupMinimal& other) const;
 
+  private:
     std::vector<std::shared_ptr<TLProcess>> processes_;
     std::uint64_t hashValue_ = 19;
 };
@@ -41,6 +45,7 @@ class TLProcessGroupMinimal {
 class TLProcessGroup final : public TLProcessGroupMinimal {
   public:
     static std::shared_ptr<TLProcessGroup> makeImmutableGroup(TLProcessGroupMinimal minimal);
+    explicit TLProcessGroup(TLProcessGroupMinimal minimal) : TLProcessGroupMinimal(std::move(minimal)) {}
 
     /// A programming error: stops the program.
     void addProcess(const std::shared_ptr<TLProcess>& process) override;

@@ -74,8 +74,16 @@ class TLTally {
         std::map<platform::uuid_t, ObjectTable> sharedCacheMemoryObjects;
         ObjectTable textMemoryObjects;
         ObjectTable linkeditMemoryObjects;
-        std::vector<std::shared_ptr<TLMemoryObject>> uniqueMemoryObjects;
+        std::vector<std::shared_ptr<TLMemoryObject>> uniqueMemoryObjects; // no two regions share one of them
+
+        /// The object that `region` shows, made when it is the first to show it.
+        TLMemoryObject& objectForRegion(const TLMemoryRegion& region, const TLProcess& process,
+                                        ObjectTable* sharedCacheTable);
+        void finalizeSizes();
     };
+
+    /// The process's entry of pidToTally.
+    std::optional<std::uint64_t> totalOf(const TLProcess& process) const;
 
     ProcessList processes_;                            // never changes
     std::map<std::int32_t, std::uint64_t> pidToTally_; // bytes, of the displayed processes

@@ -1,0 +1,51 @@
+// TLMemoryCategory: folding objects into rows, rows into totals.
+
+#include "analysis/TLMemoryCategory.h"
+
+#include <utility>
+
+namespace tally {
+
+void TLMemoryCategory::addMemoryObject(std::shared_ptr<const TLMemoryObject> object) {
+    if (!object) {
+        return;
+    }
+    totalDirtySize += object->totalDirtySize;
+    totalSwappedSize += object->totalSwappedSize;
+    totalCleanSize += object->totalCleanSize;
+    totalReclaimableSize += object->totalReclaimableSize;
+    totalWiredSize += object->totalWiredSize;
+    totalRegions += static_cast<std::int32_t>(object->memoryRegions().size());
+    if (!firstMemoryObject_) {
+        firstMemoryObject_ = std::move(object);
+    }
+}
+
+Name TLMemoryCategory::name() const { return firstMemoryObject_ ? firstMemoryObject_->name() : Name(); }
+
+Name TLMemoryCategory::detailedName() const {
+    return isSummary_ || !firstMemoryObject_ ? Name() : firstMemoryObject_->detailedName();
+}
+
+std::string TLMemoryCategory::fullName() const {
+    return firstMemoryObject_ ? categoryKey(*firstMemoryObject_, isSummary_) : std::string();
+}
+
+std::string categoryKey(const TLMemoryObject& object, bool summarize) {
+    return summarize ? std::string(object.name().view()) : object.fullName();
+}
+
+TLMemoryTotals totalsForCategories(const TLCategoryDictionary& categories) {
+    TLMemoryTotals totals;
+    for (const auto& [key, category] : categories) {
+        totals.dirty += category.totalDirtySize;
+        totals.swapped += category.totalSwappedSize;
+        totals.clean += category.totalCleanSize;
+        totals.reclaimable += category.totalReclaimableSize;
+        totals.wired += category.totalWiredSize;
+        totals.regions += static_cast<std::uint32_t>(category.totalRegions);
+    }
+    return totals;
+}
+
+} // namespace tally
