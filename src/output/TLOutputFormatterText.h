@@ -4,6 +4,7 @@
 
 #pragma once
 
+#include "output/ValueFormat.h"
 #include "output/protocol/TLOutputFormatter.h"
 
 #include <cstdint>
@@ -14,14 +15,6 @@
 #include <string_view>
 
 namespace tally {
-
-/// How byte counts are shown.
-enum class TLSummaryFormat : std::int64_t { bytes = 0, formatted = 1, pages = 2 };
-
-// Bits of the text options.
-inline constexpr std::int64_t TLTextOptionWired = 1;   // show the wired column
-inline constexpr std::int64_t TLTextOptionSwapped = 2; // show the swapped column
-inline constexpr std::int64_t TLTextOptionWide = 4;    // print paths in full
 
 class TLOutputFormatterText final : public TLOutputFormatter {
   public:
@@ -57,14 +50,15 @@ class TLOutputFormatterText final : public TLOutputFormatter {
                                              std::span<const TLMemoryRegion> regions) override;
 
   private:
+    /// A report on a single process needs no sums over all.
     bool isSummaryShown() const { return processCount_ != 1; }
+    void printSeparator() const;
+    void printTable(const Categories& categories, const TLMemoryTotals& total) const;
 
     std::uint8_t processCount_ = 0; // headers in this report: 0, 1, or 2 for more
-    std::uint64_t pageSize_ = 0;    // of the last process, bytes
     bool multipleOutputs_ = false;
     bool verbose_ = false; // set by a region listing, never cleared
-    TLSummaryFormat summaryFormat_;
-    std::int64_t options_;
+    ValueFormat format_;   // its page size is that of the last process
     std::string sort_;
     std::FILE* output_; // not owned
 };

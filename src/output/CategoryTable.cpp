@@ -1,0 +1,135 @@
+#include "output/CategoryTable.h"
+
+#include "base/Assertion.h"
+#include "base/BatchEnumeration.h"
+
+#include <algorithm>
+#include <array>
+#include <span>
+#include <string>
+#include <vector>
+
+namespace tally {
+
+namespace {
+
+struct Column {
+    const char* title;
+    int widthFormatted;
+    int widthOtherwise;
+    std::int64_t option; // the option that shows it; 0: always shown
+    std::uint64_t (*value)(const TLMemoryTotals& row);
+};
+
+constexpr std::array<Column, 5> columns = {{
+    {"Dirty", 7, 11, 0, [](const TLMemoryTotals& row) { return row.dirty + row.swapped; }},
+    {"(Swapped)", 11, 14, TLTextOptionSwapped, [](const TLMemoryTotals& row) { return row.swapped; }},
+    {"Clean", 11, 14, 0, [](const TLMemoryTotals& row) { return row.clean; }},
+    {"Reclaimable", 13, 14, 0, [](const TLMemoryTotals& row) { return row.reclaimable; }},
+    {"(Wired)", 11, 14, TLTextOptionWired, [](const TLMemoryTotals& row) { return row.wired; }},
+}};
+
+/// Prints one line; `cellOf(column)` gives the text of a sized column.
+template <typename CellOf>
+void printLine(std::FILE* output, const ValueFormat& format, CellOf cellOf, const std::string& regions,
+               const std::string& category) {
+    for (const Column& column : columns) {
+        if (column.option == 0 || format.shows(column.option)) {
+            const bool isFormatted = format.summaryFormat == TLSummaryFormat::formatted;
+            std::fprintf(output, "%*s", isFormatted ? column.widthFormatted : column.widthOtherwise,
+                         std::string(cellOf(column)).c_str());
+        }
+    }
+    std::fprintf(output, " %10s    %s\n", regions.c_str(), category.c_str());
+}
+
+void printDashLine(std::FILE* output, const ValueFormat& format) {
+    printLine(
+        output, format, [](const Column&) { return "---"; }, "---", "---");
+}
+
+void printRow(std::FILE* output, const ValueFormat& format, const TLMemoryTotals& row,
+              const std::string& category) {
+    printLine(
+        output, format,
+        [&](const Column& column) {
+            return format.formatValue(static_cast<std::int64_t>(column.value(row)));
+        },
+        std::to_string(static_cast<std::int32_t>(row.regions)), category);
+}
+
+TLMemoryTotals totalsOf(const TLMemoryCategory& category) {
+    return {category.totalDirtySize, category.totalSwappedSize,
+            category.totalCleanSize, category.totalReclaimableSize,
+            category.totalWiredSize, static_cast<std::uint32_t>(category.totalRegions)};
+}
+
+/// What rows are sorted by, the largest first; what is equal stays in the order of keys.
+using SortKey = std::array<std::uint64_t, 3>;
+
+SortKey sortKey(const TLMemoryTotals& row, std::string_view sort) {
+    if (sort == "Dirty") {
+        return {row.dirty + row.swapped, row.reclaimable, row.clean};
+    }
+    if (sort == "Swapped") {
+        return {row.swapped};
+    }
+    if (sort == "Clean") {
+        return {row.clean};
+    }
+    if (sort == "Reclaimable") {
+        return {row.reclaimable};
+    }
+    if (sort == "Wired") {
+        return {row.wired};
+    }
+    if (sort == "Regions") {
+        return {row.regions};
+    }
+    tl_assert(sort == "Category", "Unhandled text sort column");
+    return {};
+}
+
+struct Row {
+    SortKey sortKey;
+    const TLCategoryDictionary::value_type* entry;
+};
+
+std::vector<Row> sortedRows(const TLCategoryDictionary& categories, std::string_view sort) {
+    std::vector<Row> rows;
+    rows.reserve(categories.size());
+    for (const auto& entry : categories) {
+        rows.push_back({sortKey(totalsOf(entry.second), sort), &entry});
+    }
+    std::ranges::stable_sort(rows, std::ranges::greater(), &Row::sortKey);
+    return rows;
+}
+
+} // namespace
+
+void printCategoryTable(std::FILE* output, const ValueFormat& format, const TLCategoryDictionary& categories,
+                        std::string_view sort, bool verbose) {
+    printLine(
+        output, format, [](const Column& column) { return column.title; }, "Regions", "Category");
+    printDashLine(output, format);
+    const std::vector<Row> rows = sortedRows(categories, sort);
+    tl_enumerateObjectsWithBatchSize(std::span(rows), 32, [&](std::span<const Row> batch) {
+        for (const Row& row : batch) {
+            const auto& [key, category] = *row.entry;
+            const auto& object = category.firstMemoryObject();
+            if (!verbose && object && object->verbose()) {
+                continue;
+            }
+            const Name name = category.name();
+            printRow(output, format, totalsOf(category),
+                     format.displayName(name.isNull() ? key : name.view(), category.detailedName()));
+        }
+    });
+}
+
+void printTotalRow(std::FILE* output, const ValueFormat& format, const TLMemoryTotals& total) {
+    printDashLine(output, format);
+    printRow(output, format, total, "TOTAL");
+}
+
+} // namespace tally
