@@ -33,7 +33,7 @@ TEST(Printable, ReplacesWhatCouldDriveATerminalAndNothingElse) {
     }
 }
 
-TEST(Name, IsOnePointerPerTextOnEveryThread) {
+TEST(ThreadName, IsOnePointerPerTextOnEveryThread) {
     const std::size_t texts = 500;
     std::vector<std::vector<Name>> byThread(4, std::vector<Name>(texts));
     {
