@@ -39,6 +39,8 @@ std::uint64_t identityOf(std::initializer_list<std::uint64_t> facts) {
 // The first fact keeps kinds of objects apart.
 constexpr std::uint64_t ofFile = 1;
 constexpr std::uint64_t ofTask = 2;
+constexpr std::uint64_t ofSharedSet = 3;
+constexpr std::uint64_t ofFoldedSets = 4;
 
 } // namespace
 
@@ -48,6 +50,18 @@ std::uint64_t objectIdOfFile(const BackingObject& object) {
 
 std::uint64_t objectIdOfTaskMemory(std::int32_t pid, std::uint64_t startTicks, std::uint64_t start) {
     return identityOf({ofTask, static_cast<std::uint64_t>(pid), startTicks, start});
+}
+
+std::uint64_t combinedIdentity(std::uint64_t first, std::uint64_t second, std::uint64_t third) {
+    return identityOf({first, second, third});
+}
+
+std::uint64_t objectIdOfSharedSet(std::uint64_t set, std::uint64_t cluster) {
+    return identityOf({ofSharedSet, set, cluster});
+}
+
+std::uint64_t objectIdOfFoldedSets(std::uint64_t firstHolder, std::uint64_t cluster, bool resident) {
+    return identityOf({ofFoldedSets, firstHolder, cluster, resident ? 1U : 0U});
 }
 
 } // namespace tally::platform

@@ -16,4 +16,14 @@ std::uint64_t objectIdOfFile(const BackingObject& object);
 /// Memory that only the task (pid, start time) has, behind the mapping that starts at `start`.
 std::uint64_t objectIdOfTaskMemory(std::int32_t pid, std::uint64_t startTicks, std::uint64_t start);
 
+/// One identity made of three facts; building block of the ones below.
+std::uint64_t combinedIdentity(std::uint64_t first, std::uint64_t second, std::uint64_t third);
+
+/// Anonymous memory that exactly the processes of the identity `set` share after a fork, in the mappings of
+/// `cluster`, which overlap one another.
+std::uint64_t objectIdOfSharedSet(std::uint64_t set, std::uint64_t cluster);
+
+/// The resident, or the swapped, pages that `firstHolder` shares with changing sets of relatives.
+std::uint64_t objectIdOfFoldedSets(std::uint64_t firstHolder, std::uint64_t cluster, bool resident);
+
 } // namespace tally::platform

@@ -11,7 +11,7 @@
 #include "platform/linux/pieces/CountedPages.h"
 #include "platform/linux/pieces/Piece.h"
 #include "platform/linux/walk/PageStates.h"
-#include "platform/linux/walk/SmapsPages.h"
+#include "platform/linux/walk/SmapsOfProcess.h"
 
 #include <cstddef>
 #include <cstdint>

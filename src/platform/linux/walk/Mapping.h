@@ -9,6 +9,12 @@ namespace tally::platform {
 
 inline constexpr std::uint64_t basePage = 4096; // bytes; page states and counts are in these
 
+/// [start, end) of addresses.
+struct AddressRange {
+    std::uint64_t start = 0;
+    std::uint64_t end = 0;
+};
+
 struct Mapping {
     std::uint64_t start = 0;
     std::uint64_t end = 0;

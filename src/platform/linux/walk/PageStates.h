@@ -1,13 +1,10 @@
 // The states of a process's pages: how many of each mapping are where, and for what is shared or of a file
 // which.
-//
-// Read by PAGEMAP_SCAN (6.7 and later), else from smaps and pagemap. Both give the same figures.
 
 #pragma once
 
 #include "platform/kern_return.h"
 #include "platform/linux/walk/Mapping.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -16,6 +13,7 @@
 
 namespace tally::platform {
 
+class PageSource;
 class SmapsOfProcess;
 
 enum class PageKind : std::uint8_t {
@@ -33,7 +31,7 @@ struct PageRun {
     std::uint64_t endPage() const { return firstPage + pages; }
 };
 
-/// Pages of one mapping. `runs` is a slice of PageStates::runs, empty for private anonymous memory.
+/// Pages of one mapping. Its runs are a slice of PageStates::runs, empty for private anonymous memory.
 struct MappingPages {
     std::uint64_t object = 0;
     std::uint64_t anonymous = 0;
@@ -54,13 +52,15 @@ struct PageStates {
     }
 };
 
-/// Enters runs of pages, in rising order, into the counts and runs of the mappings they lie in.
+/// Enters runs of pages, in rising order within a mapping, into its counts and runs.
 class PageRecorder {
   public:
     PageRecorder(std::span<const Mapping> mappings, PageStates* states)
-        : mappings_(mappings), states_(states) {}
+        : mappings_(mappings), states_(states) {
+        states->mappings.assign(mappings.size(), MappingPages());
+    }
 
-    /// Records the part of the addresses [start, end) that lies in mapping `index`.
+    /// Records the addresses [start, end), which lie in mapping `index`.
     void record(std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind);
 
   private:
@@ -72,7 +72,7 @@ class PageRecorder {
 /// @return KERN_SUCCESS; KERN_INVALID_ARGUMENT when the task ended on the way: `states->mappings` then holds
 /// the
 ///         mappings that were read in full. A mapping whose states no source gives is marked unreadable.
-kern_return_t readPageStates(const ProcessMemoryFiles& files, std::span<const Mapping> mappings,
-                             SmapsOfProcess& smaps, PageStates* states);
+kern_return_t readPageStates(PageSource& source, SmapsOfProcess& smaps, std::span<const Mapping> mappings,
+                             PageStates* states);
 
 } // namespace tally::platform

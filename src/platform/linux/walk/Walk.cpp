@@ -4,9 +4,9 @@
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/pieces/PieceBuilder.h"
 #include "platform/linux/processes/ProcessStat.h"
-#include "platform/linux/walk/PageStates.h"
+#include "platform/linux/walk/PageSource.h"
 #include "platform/linux/walk/ProcessMemoryFiles.h"
-#include "platform/linux/walk/SmapsPages.h"
+#include "platform/linux/walk/SmapsOfProcess.h"
 
 #include <algorithm>
 #include <array>
@@ -44,7 +44,8 @@ Walk::Result Walk::read(std::int32_t pid, std::uint64_t startTicks, bool objectV
     const WalkFacts facts = gatherFacts(pid, startTicks, objectView, files.folder);
     SmapsOfProcess smaps(files);
     PageStates states;
-    const kern_return_t status = readPageStates(files, walk->mappings_, smaps, &states);
+    PageSource source(files, walk->mappings_, smaps, PageDetail::counts);
+    const kern_return_t status = readPageStates(source, smaps, walk->mappings_, &states);
     if (status != KERN_SUCCESS) {
         walk->statusPastEnd_ = status;
         walk->mappings_.resize(states.mappings.size());

@@ -1,14 +1,12 @@
-// Page counts from smaps, for what cheaper sources cannot tell and for kernels that have none.
+// SmapsOfProcess: page counts from smaps, for what cheaper sources cannot tell and for kernels that have
+// none.
 
 #pragma once
 
-#include "platform/kern_return.h"
 #include "platform/linux/walk/DecodeMaps.h"
-#include "platform/linux/walk/PageStates.h"
 #include "platform/linux/walk/ProcessMemoryFiles.h"
 
 #include <optional>
-#include <span>
 #include <vector>
 
 namespace tally::platform {
@@ -28,11 +26,5 @@ class SmapsOfProcess {
     const ProcessMemoryFiles* files_;
     std::optional<std::vector<SmapsEntry>> entries_;
 };
-
-/// Fills the states of the mappings that have none yet or are marked unreadable: private anonymous memory
-/// from smaps alone, the rest, where smaps finds pages, from pagemap.
-/// @return KERN_SUCCESS; KERN_INVALID_ARGUMENT when the task has ended.
-kern_return_t readPagesBySmaps(const ProcessMemoryFiles& files, std::span<const Mapping> mappings,
-                               SmapsOfProcess& smaps, PageStates* states);
 
 } // namespace tally::platform

@@ -1,0 +1,26 @@
+#include "platform/linux/walk/SmapsOfProcess.h"
+
+#include "platform/linux/io/SystemFiles.h"
+
+#include <algorithm>
+
+namespace tally::platform {
+
+bool SmapsOfProcess::isReadable() {
+    if (!entries_) {
+        entries_ = decodeSmaps(readSystemFile(files_->folder + "/smaps").value_or(""));
+    }
+    return !entries_->empty();
+}
+
+const SmapsEntry* SmapsOfProcess::entryFor(const Mapping& mapping) {
+    if (!isReadable()) {
+        return nullptr;
+    }
+    const auto found = std::lower_bound(
+        entries_->begin(), entries_->end(), mapping.start,
+        [](const SmapsEntry& entry, std::uint64_t start) { return entry.mapping.start < start; });
+    return found != entries_->end() && found->mapping.start == mapping.start ? &*found : nullptr;
+}
+
+} // namespace tally::platform
