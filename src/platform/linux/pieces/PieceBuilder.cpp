@@ -98,6 +98,7 @@ PieceBuilder::PieceBuilder(const WalkFacts& facts, std::span<const Mapping> mapp
         }
     }
     counted_.prepare();
+    tags_ = tagsOf(folder, mappings, backings_, states);
 }
 
 PieceBuilder::ObjectPages PieceBuilder::chargedObjectPages(std::size_t index) {
@@ -233,7 +234,7 @@ Piece& PieceBuilder::addPiece(std::size_t index, std::uint64_t length) {
     piece.start = nextStart_;
     piece.size = length * basePage;
     piece.protection = (mapping.readable ? 1 : 0) | (mapping.writable ? 2 : 0) | (mapping.executable ? 4 : 0);
-    piece.tag = tagOf(mapping, backings_[index]);
+    piece.tag = tags_[index];
     piece.externalPager = backings_[index].hasName;
     piece.mapping = index;
     nextStart_ += piece.size;
@@ -270,25 +271,57 @@ void PieceBuilder::addObjectPiece(std::size_t index, ObjectPages pages, std::uin
     }
 }
 
-void PieceBuilder::addOwnPiece(std::size_t index, std::uint64_t length) {
+std::span<const SharedPart> PieceBuilder::partsOf(std::size_t index) {
+    std::size_t count = 0;
+    while (count < parts_.size() && parts_[count].mapping == index) {
+        ++count;
+    }
+    const std::span<const SharedPart> parts = parts_.first(count);
+    parts_ = parts_.subspan(count);
+    return parts;
+}
+
+void PieceBuilder::addSharedPieces(std::size_t index, std::span<const SharedPart> parts) {
+    for (const SharedPart& part : parts) {
+        Piece& piece = addPiece(index, part.resident + part.swapped);
+        piece.offset = part.pagesBelow * basePage;
+        piece.objectId = part.objectId;
+        piece.resident = static_cast<std::uint32_t>(part.resident);
+        piece.swapped = static_cast<std::uint32_t>(part.swapped);
+        piece.dirty = piece.resident;
+        piece.shareMode = SM_COW;
+    }
+}
+
+/// What the task shares with no relative.
+void PieceBuilder::addOwnPiece(std::size_t index, const MappingPages& own, std::uint64_t length) {
     if (length == 0) {
         return;
     }
-    const Mapping& mapping = mappings_[index];
-    const MappingPages& pages = states_.mappings[index];
     Piece& piece = addPiece(index, length);
-    piece.resident = static_cast<std::uint32_t>(pages.anonymous);
-    piece.swapped = static_cast<std::uint32_t>(pages.swapped);
-    if (facts_.asksLazyFree && pages.anonymous != 0) {
-        if (const SmapsEntry* entry = smaps_.entryFor(mapping)) {
-            piece.reusable =
-                static_cast<std::uint32_t>(std::min(entry->lazyFree / basePage, pages.anonymous));
-        }
-    }
-    piece.dirty = piece.resident - piece.reusable;
-    if (pages.own() != 0) {
-        piece.objectId = objectIdOfTaskMemory(facts_.pid, facts_.startTicks, mapping.start);
+    piece.resident = static_cast<std::uint32_t>(own.anonymous);
+    piece.swapped = static_cast<std::uint32_t>(own.swapped);
+    piece.dirty = piece.resident;
+    if (own.own() != 0) {
+        piece.objectId =
+            objectIdOfTaskMemory(facts_.owner.pid, facts_.owner.startTicks, mappings_[index].start);
         piece.shareMode = SM_PRIVATE;
+    }
+}
+
+/// smaps tells lazily freed pages by mapping only: they are taken to be the task's own first.
+void PieceBuilder::markLazilyFreed(std::size_t index, std::size_t firstPiece) {
+    const SmapsEntry* entry = smaps_.entryFor(mappings_[index]);
+    std::uint64_t left = entry == nullptr ? 0 : entry->lazyFree / basePage;
+    for (std::size_t i = pieces_.size(); i-- > firstPiece && left != 0;) { // the task's own piece is the last
+        Piece& piece = pieces_[i];
+        const bool isObject =
+            piece.objectId == objectIdOfFile(backings_[index]) && mappings_[index].isFileBacked();
+        if (!isObject) {
+            piece.reusable = static_cast<std::uint32_t>(std::min<std::uint64_t>(left, piece.dirty));
+            piece.dirty -= piece.reusable;
+            left -= piece.reusable;
+        }
     }
 }
 
@@ -296,7 +329,13 @@ void PieceBuilder::build(std::size_t index) {
     const Mapping& mapping = mappings_[index];
     const BackingObject& backing = backings_[index];
     const MappingPages& states = states_.mappings[index];
-    const std::uint64_t own = states.own();
+    const std::span<const SharedPart> parts = partsOf(index);
+    MappingPages own = states; // what no relative shares
+    for (const SharedPart& part : parts) {
+        own.anonymous -= std::min(part.resident, own.anonymous);
+        own.swapped -= std::min(part.swapped, own.swapped);
+    }
+    const std::uint64_t shared = states.own() - own.own();
     const std::size_t firstPiece = pieces_.size();
     nextStart_ = mapping.start;
 
@@ -310,22 +349,27 @@ void PieceBuilder::build(std::size_t index) {
         Piece& piece = addPiece(index, mapping.pages());
         piece.resident = facts_.objectView ? 0 : static_cast<std::uint32_t>(states.object);
     } else if (backing.backing == Backing::anonymous) {
-        addOwnPiece(index, restIsApart ? own : mapping.pages());
+        addSharedPieces(index, parts);
+        addOwnPiece(index, own, restIsApart ? own.own() : mapping.pages() - shared);
     } else {
         ObjectPages object = facts_.objectView ? seenObjectPages(index) : chargedObjectPages(index);
-        const std::uint64_t room = mapping.pages() - own;
+        const std::uint64_t room = mapping.pages() - states.own();
         const bool packed = restIsApart || object.restIsApart;
         // The object's piece takes what is untouched, and without one the task's own.
-        const std::uint64_t objectLength = packed                           ? std::min(object.held(), room)
-                                           : own != 0 && object.held() == 0 ? 0
-                                                                            : room;
+        const std::uint64_t objectLength = packed ? std::min(object.held(), room)
+                                           : states.own() != 0 && object.held() == 0 ? 0
+                                                                                     : room;
         if (packed && restIsApart) {
             pack(object.words);
-        } else if (own != 0) {
+        } else if (states.own() != 0) {
             closeGaps(states_.runsOf(states), object.words);
         }
         addObjectPiece(index, std::move(object), objectLength);
-        addOwnPiece(index, packed || objectLength != 0 ? own : mapping.pages());
+        addSharedPieces(index, parts);
+        addOwnPiece(index, own, packed || objectLength != 0 ? own.own() : mapping.pages() - shared);
+    }
+    if (facts_.asksLazyFree && states.anonymous != 0) {
+        markLazilyFreed(index, firstPiece);
     }
     for (std::size_t i = firstPiece; i < pieces_.size(); ++i) {
         pieces_[i].isWired = wired && pieces_[i].resident + pieces_[i].swapped != 0;

@@ -6,6 +6,7 @@
 
 #pragma once
 
+#include "platform/linux/families/FamilyScan.h"
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/objects/MapFiles.h"
 #include "platform/linux/pieces/CountedPages.h"
@@ -23,8 +24,7 @@ namespace tally::platform {
 
 /// What holds for all mappings of a walk.
 struct WalkFacts {
-    std::int32_t pid = 0;
-    std::uint64_t startTicks = 0;
+    MemberIdentity owner;    // who stands for the address space
     bool objectView = false; // as the VM objects see it
     bool swapInUse = false;
     bool asksLazyFree = false; // smaps must be asked for lazily freed pages
@@ -33,8 +33,7 @@ struct WalkFacts {
 
 class PieceBuilder {
   public:
-    PieceBuilder(const WalkFacts& facts, std::span<const Mapping> mappings, const PageStates& states,
-                 const std::string& folder, SmapsOfProcess& smaps);
+    PieceBuilder(const WalkFacts& facts, const AddressSpace& space, SmapsOfProcess& smaps);
 
     /// Appends the pieces of mapping `index`.
     void build(std::size_t index);
@@ -53,16 +52,21 @@ class PieceBuilder {
     void markSwapped(std::size_t index, const Descriptor& file, ObjectPages& pages);
     void markDirty(std::size_t index, ObjectPages& pages);
     void addObjectPiece(std::size_t index, ObjectPages pages, std::uint64_t length);
-    void addOwnPiece(std::size_t index, std::uint64_t length);
+    void addSharedPieces(std::size_t index, std::span<const SharedPart> parts);
+    void addOwnPiece(std::size_t index, const MappingPages& own, std::uint64_t length);
+    void markLazilyFreed(std::size_t index, std::size_t firstPiece);
+    std::span<const SharedPart> partsOf(std::size_t index);
     void addRest(std::size_t index, std::uint64_t length);
     Piece& addPiece(std::size_t index, std::uint64_t length);
 
     const WalkFacts& facts_;
     std::span<const Mapping> mappings_;
     const PageStates& states_;
+    std::span<const SharedPart> parts_; // not built yet
     const std::string& folder_;
     SmapsOfProcess& smaps_;
     std::vector<BackingObject> backings_;
+    std::vector<std::uint32_t> tags_; // by mapping
     CountedPages counted_;
     std::vector<Piece> pieces_;
     std::vector<PageWords> words_;

@@ -34,8 +34,6 @@ std::uint32_t tagOfNamelessFile(const Mapping& mapping, const BackingObject& obj
                                                      : untagged;
 }
 
-} // namespace
-
 std::uint32_t tagOf(const Mapping& mapping, const BackingObject& object) {
     if (object.backing == Backing::special) {
         return kernelPages.tag;
@@ -50,6 +48,18 @@ std::uint32_t tagOf(const Mapping& mapping, const BackingObject& object) {
         return stack;
     }
     return mapping.readable || mapping.writable || mapping.executable ? untagged : guard;
+}
+
+} // namespace
+
+std::vector<std::uint32_t> tagsOf(const std::string& /*folder*/, std::span<const Mapping> mappings,
+                                  std::span<const BackingObject> objects, const PageStates& /*states*/) {
+    std::vector<std::uint32_t> tags;
+    tags.reserve(mappings.size());
+    for (std::size_t i = 0; i < mappings.size(); ++i) {
+        tags.push_back(tagOf(mappings[i], objects[i]));
+    }
+    return tags;
 }
 
 std::optional<std::string> QRYRegionTypeDescriptionForTag(std::uint32_t tag) {

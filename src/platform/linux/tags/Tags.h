@@ -5,11 +5,18 @@
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/walk/Mapping.h"
 
+#include "platform/linux/walk/PageStates.h"
+
 #include <cstdint>
+#include <span>
+#include <string>
+#include <vector>
 
 namespace tally::platform {
 
-/// The tag of a mapping; 0 where nothing tells. An honest "untagged" is better than a guess.
-std::uint32_t tagOf(const Mapping& mapping, const BackingObject& object);
+/// The tags of the mappings of the process folder `folder`, one each; 0 where nothing tells. An honest
+/// "untagged" is better than a guess.
+std::vector<std::uint32_t> tagsOf(const std::string& folder, std::span<const Mapping> mappings,
+                                  std::span<const BackingObject> objects, const PageStates& states);
 
 } // namespace tally::platform

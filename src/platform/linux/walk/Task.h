@@ -17,9 +17,15 @@ namespace tally::platform {
 /// walk that is under way is used by one thread at a time.
 class Task {
   public:
-    Task(std::int32_t pid, std::uint64_t startTicks) : pid_(pid), startTicks_(startTicks) {}
+    Task(MemberIdentity identity, const FamilyKey& key);
+    ~Task();
+    Task(const Task&) = delete;
+    Task& operator=(const Task&) = delete;
 
-    std::int32_t pid() const { return pid_; }
+    std::int32_t pid() const { return identity_.pid; }
+    /// Whether a task with a lower pid has the very same address space, and so its page tables too.
+    bool isSecondTenant() const { return owner_.pid != identity_.pid; }
+    std::uint64_t startTicks() const { return startTicks_; }
 
     /// The walk that is under way; starts one when there is none.
     /// @return null with `*status` when the address space cannot be read.
@@ -28,8 +34,9 @@ class Task {
     std::vector<std::string> takeNotices() { return std::exchange(notices_, {}); }
 
   private:
-    std::int32_t pid_;
-    std::uint64_t startTicks_;
+    MemberIdentity identity_;
+    FamilyKey key_;
+    MemberIdentity owner_; // of the address space
     std::unique_ptr<const Walk> walk_;
     std::vector<std::string> notices_;
     std::vector<std::string> given_; // notices that were given once already

@@ -1,5 +1,6 @@
 #include "platform/linux/walk/Walk.h"
 
+#include "platform/linux/families/Families.h"
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/pieces/PieceBuilder.h"
@@ -16,43 +17,54 @@ namespace tally::platform {
 namespace {
 
 /// Finds out which figures that only smaps tells the process can have at all.
-WalkFacts gatherFacts(std::int32_t pid, std::uint64_t startTicks, bool objectView,
-                      const std::string& folder) {
+WalkFacts gatherFacts(MemberIdentity owner, bool objectView, const std::string& folder) {
     const ProcessStatus status = decodeStatus(readSystemFile(folder + "/status").value_or(""));
     const MachineState machine = machineState();
-    WalkFacts facts{
-        .pid = pid, .startTicks = startTicks, .objectView = objectView, .swapInUse = machine.swapInUse};
+    WalkFacts facts{.owner = owner, .objectView = objectView, .swapInUse = machine.swapInUse};
     facts.asksLocked = status.locked != 0;
     facts.asksLazyFree = machine.lazyFree != 0 && status.residentAnonymous != 0 &&
                          decodeRollupLazyFree(readSystemFile(folder + "/smaps_rollup").value_or("")) != 0;
     return facts;
 }
 
-constexpr const char* estimateNotice =
+AddressSpace readAlone(MemberIdentity task) {
+    AddressSpace space;
+    ProcessMemoryFiles files;
+    space.status = files.open(task.pid, task.startTicks, &space.mappings);
+    space.folder = files.folder;
+    if (space.status == KERN_SUCCESS) {
+        SmapsOfProcess smaps(files.folder);
+        PageSource source(files, space.mappings, smaps, PageDetail::counts);
+        space.status = readPageStates(source, smaps, space.mappings, &space.states);
+    }
+    return space;
+}
+
+constexpr const char* pageCacheNotice =
     "The page cache could not be asked: shared memory and files are counted by the process's own page tables";
+constexpr const char* sharingNotice =
+    "Frame numbers are hidden: what is shared with forked relatives is estimated from addresses";
 
 } // namespace
 
-Walk::Result Walk::read(std::int32_t pid, std::uint64_t startTicks, bool objectView) {
-    auto walk = std::make_unique<Walk>();
-    ProcessMemoryFiles files;
+Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView) {
+    std::optional<AddressSpace> withRelatives = takeFamilySpace(key, owner);
+    AddressSpace space = withRelatives ? std::move(*withRelatives) : readAlone(task);
     Result result;
-    result.status = files.open(pid, startTicks, &walk->mappings_);
-    if (result.status != KERN_SUCCESS) {
+    if (space.status != KERN_SUCCESS && space.states.mappings.empty()) {
+        result.status = space.status;
         return result;
     }
-    const WalkFacts facts = gatherFacts(pid, startTicks, objectView, files.folder);
-    SmapsOfProcess smaps(files);
-    PageStates states;
-    PageSource source(files, walk->mappings_, smaps, PageDetail::counts);
-    const kern_return_t status = readPageStates(source, smaps, walk->mappings_, &states);
-    if (status != KERN_SUCCESS) {
-        walk->statusPastEnd_ = status;
-        walk->mappings_.resize(states.mappings.size());
+    auto walk = std::make_unique<Walk>();
+    if (space.status != KERN_SUCCESS) {
+        walk->statusPastEnd_ = space.status;
+        space.mappings.resize(space.states.mappings.size());
     }
-    PieceBuilder builder(facts, walk->mappings_, states, files.folder, smaps);
-    for (std::size_t i = 0; i < states.mappings.size(); ++i) {
-        if (states.mappings[i].unreadable) {
+    const WalkFacts facts = gatherFacts(owner, objectView, space.folder);
+    SmapsOfProcess smaps(space.folder);
+    PieceBuilder builder(facts, space, smaps);
+    for (std::size_t i = 0; i < space.mappings.size(); ++i) {
+        if (space.states.mappings[i].unreadable) {
             walk->statusPastEnd_ = KERN_FAILURE;
             break;
         }
@@ -61,8 +73,12 @@ Walk::Result Walk::read(std::int32_t pid, std::uint64_t startTicks, bool objectV
     walk->pieces_ = builder.takePieces();
     walk->words_ = builder.takeWords();
     if (builder.usedEstimates()) {
-        result.notices.emplace_back(estimateNotice);
+        result.notices.emplace_back(pageCacheNotice);
     }
+    if (space.isEstimated && !space.parts.empty()) {
+        result.notices.emplace_back(sharingNotice);
+    }
+    walk->mappings_ = std::move(space.mappings);
     result.walk = std::move(walk);
     return result;
 }

@@ -6,6 +6,8 @@
 #pragma once
 
 #include "platform/kern_return.h"
+#include "platform/linux/families/FamilyKey.h"
+#include "platform/linux/families/SharedParts.h"
 #include "platform/linux/pieces/Piece.h"
 #include "platform/linux/walk/Mapping.h"
 
@@ -25,9 +27,10 @@ class Walk {
         std::vector<std::string> notices;
     };
 
-    /// Reads the address space of process `pid`, which must be the one that started at `startTicks`.
+    /// Reads the address space of `task`, with its relatives when a gather measures some.
+    /// @param owner who stands for the address space: the task, or one that shares it whole.
     /// @param objectView counts as the VM objects see it instead of as charged to the task.
-    static Result read(std::int32_t pid, std::uint64_t startTicks, bool objectView);
+    static Result read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView);
 
     /// The first piece that ends above `address`; null when there is none.
     const Piece* pieceAt(std::uint64_t address) const;
@@ -35,6 +38,10 @@ class Walk {
     /// there.
     kern_return_t statusPastEnd() const { return statusPastEnd_; }
     const Mapping& mappingOf(const Piece& piece) const { return mappings_[piece.mapping]; }
+    /// All mappings, in rising order.
+    std::span<const Mapping> mappings() const { return mappings_; }
+    /// The process folder that the mappings were read in.
+    const std::string& folder() const { return folder_; }
 
     /// Fills one disposition word per page from `address` on.
     void pageWords(std::uint64_t address, std::span<std::int32_t> words) const;
@@ -42,6 +49,7 @@ class Walk {
   private:
     void pageWordsOf(const Piece& piece, std::uint64_t firstPage, std::span<std::int32_t> words) const;
 
+    std::string folder_;
     std::vector<Mapping> mappings_;
     std::vector<Piece> pieces_; // in rising order
     std::vector<PageWords> words_;
