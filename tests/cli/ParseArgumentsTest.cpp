@@ -61,77 +61,48 @@ TEST(ParseArguments, OptionsSetTheirFields) {
     }
 }
 
-TEST(ParseArguments, TheFirstFailureEndsIt) {
-    const std::string badFormat =
-        "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.";
-    const std::string badSort =
-        "Unrecognized argument 'Siz?e' to --sort.\nAccepted arguments: dirty, swapped, "
-        "clean, reclaimable, wired, regions, category";
-    const std::string badPid = "'abc' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
-                               "specify a process name.";
-    const std::string corpse = "--forkCorpse is not compatible with -a/--all due to corpse resource limits";
+TEST(ParseArguments, TheFirstFailureEndsItAndWarningsDoNot) {
+    constexpr int none = -1;
     struct Case {
         std::string words;
         int code;
-        std::string message;
+        std::string text; // on standard error, or of the error
     };
-    std::vector<Case> cases = {{"-h", TLErrorHelp, ""},
-                               {"--help -f x", TLErrorHelp, ""},
-                               {"-f Bytes -h", TLErrorBadFormat, badFormat},
-                               {"--sort Siz\033e", TLErrorBadSort, badSort},
-                               {"--pid abc", TLErrorBadPid, badPid},
-                               {"--forkCorpse -a --unmapped", TLErrorCorpseOfAll, corpse}};
+    std::vector<Case> cases = {
+        {"-h", TLErrorHelp, ""},
+        {"--help -f x", TLErrorHelp, ""},
+        {"-f Bytes -h", TLErrorBadFormat,
+         "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'."},
+        {"--pid \033", TLErrorBadPid,
+         "'?' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process name."},
+        {"--forkCorpse -a --unmapped", TLErrorCorpseOfAll,
+         "--forkCorpse is not compatible with -a/--all due to corpse resource limits"},
+        {"-y", none, "WARNING: -y/--summary options are deprecated because summary is the default mode\n"},
+        {"-a --unmapped", none, "NOTICE: '--unmapped' is redundant when using -a/--all\n"},
+        {"-a --unmapped --vmObjectDirty", none,
+         "WARNING: ignoring '--unmapped' because the requested analysis mode '--vmObjectDirty' does not "
+         "support "
+         "unmapped owned VM objects\n"},
+    };
     for (const std::string seconds : {"0", "-1", "abc", "inf", "nan", "1e999", "1e-310", "0x10"}) {
         cases.push_back(
             {"--sample " + seconds, TLErrorBadInterval, "Invalid sampling interval '" + seconds + "'"});
     }
-    for (const auto& [words, code, message] : cases) {
+    for (const auto& [words, code, text] : cases) {
         const Parse got = parse(words);
         const auto* error = std::get_if<TLError>(&got.result);
-        ASSERT_NE(error, nullptr) << words;
-        EXPECT_EQ(error->code, code) << words;
-        EXPECT_EQ(error->message, message);
-        EXPECT_EQ(got.messages, "");
-    }
-    for (const char* words : {"--nonsense", "-p"}) { // the scanner says what is wrong
-        const Parse got = parse(words);
-        EXPECT_EQ(std::get<TLError>(got.result).code, TLErrorBadOption);
-        EXPECT_NE(got.messages, "");
+        EXPECT_EQ(error == nullptr ? none : error->code, code) << words;
+        EXPECT_EQ(got.messages + (error == nullptr ? "" : error->message), text);
+        EXPECT_TRUE(error != nullptr || !std::get<TLTallyArgs>(got.result).searchForUnmapped);
     }
 }
 
-TEST(ParseArguments, WarningsStopNothing) {
-    const std::string summary =
-        "WARNING: -y/--summary options are deprecated because summary is the default mode\n";
-    const std::string ignored = "WARNING: ignoring '--unmapped' because the requested analysis mode "
-                                "'--vmObjectDirty' does not support unmapped owned VM objects\n";
-    const std::pair<std::string, std::string> cases[] = {
-        {"-y", summary},
-        {"--summary", summary},
-        {"--physTally", "WARNING: --physTally option is deprecated because it is the default mode\n"},
-        {"--unmapped -a", "NOTICE: '--unmapped' is redundant when using -a/--all\n"},
-        {"--unmapped --vmObjectDirty", ignored},
-        {"--unmapped --vmObjectDirty -a", ignored},
-    };
-    for (const auto& [words, messages] : cases) {
-        const Parse got = parse(words);
-        EXPECT_EQ(got.messages, messages);
-        EXPECT_FALSE(std::get<TLTallyArgs>(got.result).searchForUnmapped);
-    }
-}
-
-TEST(Usage, DescriptionsStandInOneColumn) {
+TEST(Usage, ShowsInternalOptionsWhereTheirContentIs) {
     platform::ScriptedKernel kernel;
     kernel.internalContent.insert(subsystemIdentifier);
-    std::istringstream lines(written(printUsage).first);
-    int options = 0;
-    for (std::string line; std::getline(lines, line);) {
-        if (line.starts_with("    ")) {
-            ++options;
-            EXPECT_EQ(line.find_last_of(' ', 42), 41) << line;
-        }
-    }
-    EXPECT_EQ(options, 17);
+    EXPECT_TRUE(written(printUsage)
+                    .first.ends_with(". 0.5)\n\nKestrelInternal:\n    --benchlog <file.blj>                 "
+                                     "print benchlog(1) output to a file\n"));
 }
 
 } // namespace

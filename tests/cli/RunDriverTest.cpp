@@ -29,50 +29,35 @@ class RunDriver : public testing::Test {
     std::string output, messages;
 };
 
-TEST_F(RunDriver, EndsWithItsStatusAndMessages) {
-    const std::string none =
-        "Unable to find any processes matching the supplied process names or pids (try as root?)\n";
-    const std::string unknown = "Unable to find pid for process matching 'nobody'\n";
-    const std::string interval = "Invalid sampling interval '0'\n";
-    enum Output { nothing, usage, report };
+TEST_F(RunDriver, EndsWithItsStatusAndMessage) {
     const struct {
-        std::string words;
-        int status;
-        Output output;
-        std::string messages;
-        std::uint32_t user = 0;
+        std::string words, message;
     } cases[] = {
-        {"-h", 0, usage, ""},
-        {"--sample 0", 1, usage, interval},
-        {"", 1, usage, "Must specify at least one process or heapsnap\n"},
-        {"nobody", 1, nothing, none},
-        {"nobody server", 0, report, unknown},
-        {"server", 0, report, "", 1000},
-        {"-a -j x", 1, nothing, "Must run as root.\n", 1000},
-        {"--unmapped server", 1, nothing, "Must run as root.\n", 1000},
-        {"--vmObjectDirty -a", 0, report, ""},
-        {"-j x --benchlog y server", 1, nothing, "Unable to create JSON output\n"},
-        {"--benchlog x server", 1, nothing, "Unable to create benchlog output\n"},
-        {"--sample 1 nobody", 1, nothing, none},
-        {"--sample 1 server", 1, nothing, "Sampling is not available in this build\n"},
+        {"--unmapped server", "Must run as root.\n"},
+        {"-j x --benchlog y server", "Unable to create JSON output\n"},
+        {"--benchlog x server", "Unable to create benchlog output\n"},
+        {"--sample 1 nobody",
+         "Unable to find any processes matching the supplied process names or pids (try as root?)\n"},
+        {"--sample 1 server", "Sampling is not available in this build\n"},
     };
-    for (const auto& [words, status, wanted, text, user] : cases) {
-        kernel.effectiveUserId = user;
-        kernel.selfRegionTally = 0;
-        EXPECT_EQ(run(words), status) << words;
-        EXPECT_EQ(messages, text) << words;
-        EXPECT_EQ(output.starts_with("Gather memory information"), wanted == usage);
-        EXPECT_EQ(output.find("server [8]: 64-bit\tTally: 8192 B") != output.npos, wanted == report)
-            << output;
-        EXPECT_EQ(output.empty(), wanted == nothing) << output;
-        if (wanted == report) { // the switch is for the default mode only
-            EXPECT_EQ(kernel.selfRegionTally, words.starts_with("--vmObjectDirty") ? 0 : 1) << words;
-        }
+    kernel.effectiveUserId = 1000;
+    for (const auto& [words, message] : cases) {
+        EXPECT_EQ(run(words), 1) << words;
+        EXPECT_EQ(messages, message);
+        EXPECT_EQ(output, "") << words;
     }
     kernel.fail("proc_listallpids", 1, {.times = platform::Always});
-    EXPECT_EQ(run("-a"), 1); // a failure that has no message
-    EXPECT_EQ(messages, "");
+    EXPECT_EQ(run("server -t"), 1);
+    EXPECT_EQ(messages, "Unable to obtain system process list\n");
     EXPECT_TRUE(output.starts_with("Gather memory information"));
+}
+
+TEST_F(RunDriver, TurnsTheSwitchOnInTheDefaultModeAndNeverOff) {
+    for (const auto& [words, value] :
+         {std::pair("--vmObjectDirty server", 0), {"server", 1}, {"--vmObjectDirty server", 1}}) {
+        EXPECT_EQ(run(words), 0);
+        EXPECT_EQ(kernel.selfRegionTally, value);
+    }
 }
 
 TEST_F(RunDriver, ReportsWhatAnInterruptLeft) {
