@@ -39,7 +39,7 @@ struct FamilySharing {
     std::span<const AddressSlot> slots;
     std::span<const std::vector<std::uint32_t>> sets; // member indices, rising
     std::span<const SetPages> counts;                 // in rising order of slots
-    std::span<const bool> keepsAllSets;               // per cluster: image segments
+    std::span<const char> keepsAllSets;               // per cluster, 1 for image segments
 };
 
 /// The parts of every member, sorted by mapping. `mappings[m]` are the private mappings of member m: their

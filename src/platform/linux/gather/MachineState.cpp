@@ -1,9 +1,7 @@
 #include "platform/linux/gather/MachineState.h"
 
-#include "platform/gather.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
-#include "platform/linux/objects/Backing.h"
 #include "platform/linux/walk/Mapping.h"
 
 #include <algorithm>
@@ -75,11 +73,8 @@ MachineState machineState() {
     return gather.state ? *gather.state : readMachineState();
 }
 
-GatherScope::GatherScope() {
-    forgetFileSystems();
-    setCurrent(readMachineState());
-}
+void beginMachineState() { setCurrent(readMachineState()); }
 
-GatherScope::~GatherScope() { setCurrent(std::nullopt); }
+void endMachineState() { setCurrent(std::nullopt); }
 
 } // namespace tally::platform

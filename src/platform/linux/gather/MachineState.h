@@ -20,6 +20,10 @@ std::uint64_t decodeLazyFree(std::string_view vmstat);
 /// Whether any swap is in use, by a meminfo text.
 bool decodeSwapInUse(std::string_view meminfo);
 
+/// Reads the state for the gather that begins, and forgets it when it ends.
+void beginMachineState();
+void endMachineState();
+
 /// The state: that of the gather that is under way, else read now.
 MachineState machineState();
 

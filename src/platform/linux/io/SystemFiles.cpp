@@ -1,7 +1,9 @@
 #include "platform/linux/io/SystemFiles.h"
 
 #include <fcntl.h>
+#include <sys/resource.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 
@@ -52,6 +54,15 @@ std::optional<std::string> readSystemFile(const std::string& path) {
         return std::nullopt;
     }
     return text;
+}
+
+void allowDescriptors(std::size_t count) {
+    constexpr rlim_t usual = 128;
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) == 0 && limit.rlim_cur < count + usual) {
+        limit.rlim_cur = std::min<rlim_t>(count + usual, limit.rlim_max);
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
 }
 
 std::optional<std::string> readSystemLink(const std::string& path) {

@@ -7,6 +7,7 @@
 
 #include "platform/linux/io/Descriptor.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -33,6 +34,9 @@ bool readToEnd(const Descriptor& file, std::string& text);
 
 /// The whole file at `path`; absent on failure, with errno.
 std::optional<std::string> readSystemFile(const std::string& path);
+
+/// Makes room for `count` more descriptors than are usual, as far as the hard limit goes.
+void allowDescriptors(std::size_t count);
 
 /// Where the symbolic link at `path` points, up to 64 KiB; absent on failure, with errno.
 std::optional<std::string> readSystemLink(const std::string& path);

@@ -86,19 +86,19 @@ struct PieceBuilder::ObjectPages {
     std::uint64_t held() const { return resident + swapped; }
 };
 
-PieceBuilder::PieceBuilder(const WalkFacts& facts, std::span<const Mapping> mappings,
-                           const PageStates& states, const std::string& folder, SmapsOfProcess& smaps)
-    : facts_(facts), mappings_(mappings), states_(states), folder_(folder), smaps_(smaps) {
-    backings_.reserve(mappings.size());
-    for (const Mapping& mapping : mappings) {
-        backings_.push_back(backingOf(mapping, folder));
+PieceBuilder::PieceBuilder(const WalkFacts& facts, const AddressSpace& space, SmapsOfProcess& smaps)
+    : facts_(facts), mappings_(space.mappings), states_(space.states), parts_(space.parts),
+      folder_(space.folder), smaps_(smaps) {
+    backings_.reserve(mappings_.size());
+    for (const Mapping& mapping : mappings_) {
+        backings_.push_back(backingOf(mapping, folder_));
         if (mapping.isFileBacked() && !facts.objectView) {
             const std::uint64_t first = filePage(mapping);
             counted_.expect(objectIdOfFile(backings_.back()), {first, first + mapping.pages()});
         }
     }
     counted_.prepare();
-    tags_ = tagsOf(folder, mappings, backings_, states);
+    tags_ = tagsOf(folder_, mappings_, backings_, states_);
 }
 
 PieceBuilder::ObjectPages PieceBuilder::chargedObjectPages(std::size_t index) {

@@ -2,6 +2,7 @@
 
 #include "platform/bsd_process.h"
 #include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/walk/Task.h"
 
 #include <algorithm>
 #include <array>
@@ -37,7 +38,9 @@ std::optional<Charges> readCharges(std::int32_t pid) {
     }
     Charges charges;
     if (status->hasAddressSpace) {
-        charges.pageTable = status->pageTables + topLevelTable;
+        // Of tasks that share one address space only the first is charged for its page tables.
+        const std::shared_ptr<Task> task = taskOfProcess(pid);
+        charges.pageTable = task && task->isSecondTenant() ? 0 : status->pageTables + topLevelTable;
         charges.physTally = status->residentAnonymous + status->residentShared + status->hugetlb +
                             status->swapped + charges.pageTable;
         charges.peak = std::max(charges.physTally, status->peakResident);

@@ -8,7 +8,7 @@ namespace tally::platform {
 
 bool SmapsOfProcess::isReadable() {
     if (!entries_) {
-        entries_ = decodeSmaps(readSystemFile(files_->folder + "/smaps").value_or(""));
+        entries_ = decodeSmaps(readSystemFile(folder_ + "/smaps").value_or(""));
     }
     return !entries_->empty();
 }

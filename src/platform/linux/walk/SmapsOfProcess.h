@@ -4,9 +4,10 @@
 #pragma once
 
 #include "platform/linux/walk/DecodeMaps.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
 
 #include <optional>
+#include <string>
+#include <utility>
 #include <vector>
 
 namespace tally::platform {
@@ -14,7 +15,8 @@ namespace tally::platform {
 /// The smaps of one process, read when first asked for.
 class SmapsOfProcess {
   public:
-    explicit SmapsOfProcess(const ProcessMemoryFiles& files) : files_(&files) {}
+    /// @param folder of the process.
+    explicit SmapsOfProcess(std::string folder) : folder_(std::move(folder)) {}
 
     /// The entry of the mapping that starts where `mapping` does; null when there is none or smaps cannot be
     /// read.
@@ -23,7 +25,7 @@ class SmapsOfProcess {
     bool isReadable();
 
   private:
-    const ProcessMemoryFiles* files_;
+    std::string folder_;
     std::optional<std::vector<SmapsEntry>> entries_;
 };
 

@@ -2,6 +2,7 @@
 
 #include "platform/bsd_process.h"
 #include "platform/gather.h"
+#include "platform/linux/families/Families.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/AccountingSwitch.h"
@@ -78,10 +79,15 @@ PortTable& portTable() {
 
 } // namespace
 
+Task::Task(MemberIdentity identity, const FamilyKey& key)
+    : identity_(identity), key_(key), owner_(enterAddressSpace(key, identity)) {}
+
+Task::~Task() { leaveAddressSpace(key_, identity_); }
+
 const Walk* Task::walk(kern_return_t* status) {
     *status = KERN_SUCCESS;
     if (!walk_) {
-        Walk::Result result = Walk::read(pid_, startTicks_, !accountingSwitchIsOn());
+        Walk::Result result = Walk::read(identity_, key_, owner_, !accountingSwitchIsOn());
         *status = result.status;
         walk_ = std::move(result.walk);
         for (std::string& notice : result.notices) {
@@ -100,7 +106,8 @@ std::shared_ptr<Task> taskOfProcess(std::int32_t pid) { return portTable().findP
 
 kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     *task = MACH_PORT_NULL;
-    const std::optional<ProcessStat> stat = readProcessStat(pid);
+    const std::optional<std::string> text = readSystemFile(processFolder(pid) + "/stat");
+    const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
     if (!stat || stat->isKernelThread()) {
         return KERN_FAILURE;
     }
@@ -110,7 +117,8 @@ kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     if (!maps.isOpen() && statusForErrno(errno) == KERN_NO_ACCESS) {
         return KERN_NO_ACCESS;
     }
-    *task = portTable().add(std::make_shared<Task>(pid, stat->startTicks));
+    *task = portTable().add(
+        std::make_shared<Task>(MemberIdentity{pid, stat->startTicks}, decodeFamilyKey(*text)));
     return KERN_SUCCESS;
 }
 

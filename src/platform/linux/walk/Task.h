@@ -25,7 +25,7 @@ class Task {
     std::int32_t pid() const { return identity_.pid; }
     /// Whether a task with a lower pid has the very same address space, and so its page tables too.
     bool isSecondTenant() const { return owner_.pid != identity_.pid; }
-    std::uint64_t startTicks() const { return startTicks_; }
+    std::uint64_t startTicks() const { return identity_.startTicks; }
 
     /// The walk that is under way; starts one when there is none.
     /// @return null with `*status` when the address space cannot be read.

@@ -78,6 +78,7 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
     if (space.isEstimated && !space.parts.empty()) {
         result.notices.emplace_back(sharingNotice);
     }
+    walk->folder_ = std::move(space.folder);
     walk->mappings_ = std::move(space.mappings);
     result.walk = std::move(walk);
     return result;

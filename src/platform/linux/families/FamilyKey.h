@@ -1,0 +1,39 @@
+// FamilyKey: what processes that descend from one exec by forking have in common.
+//
+// The addresses at which the kernel laid the program out are drawn anew at every exec and inherited by every
+// fork. Where they are not drawn, because randomisation is off, the 16 random bytes that every exec gets tell
+// programs apart.
+
+#pragma once
+
+#include <array>
+#include <compare>
+#include <cstdint>
+#include <string_view>
+
+namespace tally::platform {
+
+struct FamilyKey {
+    // Start and end of code, stack, start and end of data, break: addresses.
+    std::array<std::uint64_t, 6> layout{};
+
+    /// Whether the kernel told the addresses at all: it does not where tracing is not permitted.
+    bool isKnown() const { return layout[0] > 1; }
+    friend auto operator<=>(const FamilyKey&, const FamilyKey&) = default;
+};
+
+/// Takes the key from the text of /proc/PID/stat; unknown when it holds none.
+FamilyKey decodeFamilyKey(std::string_view stat);
+
+/// The random bytes that process `pid` got at its exec; zeros when they cannot be read.
+std::array<std::uint64_t, 2> readExecRandom(std::int32_t pid);
+
+/// Whether the kernel lays process `pid` out without drawing addresses.
+bool isLayoutFixed(std::int32_t pid);
+
+/// Compares the address spaces of two processes: 0 the same, negative or positive in an order that stays; 3
+/// when they cannot be compared.
+int compareAddressSpaces(std::int32_t a, std::int32_t b);
+inline constexpr int incomparableAddressSpaces = 3;
+
+} // namespace tally::platform
