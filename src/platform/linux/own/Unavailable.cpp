@@ -21,11 +21,6 @@ std::optional<dyld_shared_cache> dyld_shared_cache_for_task(mach_port_t /*task*/
     return std::nullopt;
 }
 
-void RKForeachSymbolOwner(mach_port_t /*task*/,
-                          const std::function<void(const RKSymbolOwner&)>& /*handler*/) {}
-
-std::string RKResolvedPath(mach_port_t /*task*/, std::string_view path) { return std::string(path); }
-
 std::unique_ptr<RKKernelSymbolicator> RKCreateKernelSymbolicator() { return nullptr; }
 
 kern_return_t mach_memory_info(mach_memory_record* record) {

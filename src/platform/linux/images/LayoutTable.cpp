@@ -1,0 +1,96 @@
+#include "platform/linux/images/LayoutTable.h"
+
+#include "platform/linux/objects/MapFiles.h"
+
+#include <sys/stat.h>
+
+#include <cstdint>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <tuple>
+#include <utility>
+
+namespace tally::platform {
+
+namespace {
+
+/// What changes when a file does.
+struct FileVersion {
+    std::int64_t size = -1;
+    std::int64_t seconds = 0; // of its last change
+    std::int64_t nanoseconds = 0;
+
+    bool operator==(const FileVersion&) const = default;
+};
+
+FileVersion versionOf(const Descriptor& file) {
+    struct stat status {};
+    if (fstat(file.number(), &status) != 0) {
+        return {};
+    }
+    return {status.st_size, status.st_mtim.tv_sec, status.st_mtim.tv_nsec};
+}
+
+/// One file. Its own lock is held while it is read, so that one slow file holds up no other.
+struct FileEntry {
+    std::mutex mutex;
+    std::uint64_t gather = 0; // in which it was looked at last
+    FileVersion version;
+    std::shared_ptr<const ElfLayout> layout;
+};
+
+class LayoutTable {
+  public:
+    std::pair<std::shared_ptr<FileEntry>, std::uint64_t> entryFor(const BackingObject& object) {
+        const std::scoped_lock lock(mutex_);
+        std::shared_ptr<FileEntry>& entry = entries_[{object.device, object.inode}];
+        if (!entry) {
+            entry = std::make_shared<FileEntry>();
+        }
+        return {entry, gather_};
+    }
+
+    /// Files that the last gather met none of are forgotten.
+    void beginGather() {
+        const std::scoped_lock lock(mutex_);
+        std::erase_if(entries_, [this](const auto& entry) { return entry.second->gather != gather_; });
+        ++gather_;
+    }
+
+  private:
+    std::mutex mutex_;
+    std::uint64_t gather_ = 1;
+    std::map<std::pair<std::uint64_t, std::uint64_t>, std::shared_ptr<FileEntry>> entries_; // device, inode
+};
+
+LayoutTable& layoutTable() {
+    static LayoutTable table;
+    return table;
+}
+
+} // namespace
+
+std::shared_ptr<const ElfLayout> layoutOfFile(const BackingObject& object, const std::string& folder,
+                                              const Mapping& mapping) {
+    const auto [entry, gather] = layoutTable().entryFor(object);
+    const std::scoped_lock lock(entry->mutex);
+    if (entry->gather == gather) {
+        return entry->layout;
+    }
+    const Descriptor file = openMappedFile(folder, mapping);
+    if (!file.isOpen()) {
+        return nullptr; // another process may show it
+    }
+    entry->gather = gather;
+    if (const FileVersion version = versionOf(file); version != entry->version) {
+        std::optional<ElfLayout> layout = readElfLayout(file);
+        entry->layout = layout ? std::make_shared<const ElfLayout>(*std::move(layout)) : nullptr;
+        entry->version = version;
+    }
+    return entry->layout;
+}
+
+void beginLayouts() { layoutTable().beginGather(); }
+
+} // namespace tally::platform
