@@ -1,3 +1,8 @@
+// Process grouping: every object collects the processes that map it; objects with equal sets of them then
+// find one group through a hash table of sets.
+//
+// Cost: a table look-up per region, and a comparison of members per object.
+
 #include "analysis/ProcessGrouping.h"
 
 #include "base/BatchEnumeration.h"

@@ -1,3 +1,5 @@
+// CategoryTable: one description of the columns serves titles, rows and totals.
+
 #include "output/CategoryTable.h"
 
 #include "base/Assertion.h"

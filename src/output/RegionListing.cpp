@@ -1,3 +1,5 @@
+// RegionListing: pseudo-regions, which are not mapped, have no addresses to show.
+
 #include "output/RegionListing.h"
 
 #include "base/BatchEnumeration.h"

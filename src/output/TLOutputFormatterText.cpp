@@ -1,3 +1,5 @@
+// The text report, call by call. Its wording and spacing are read by scripts.
+
 #include "output/TLOutputFormatterText.h"
 
 #include "analysis/TLProcessGroup.h"

@@ -1,3 +1,5 @@
+// ValueFormat: byte counts in the three formats, paths and names.
+
 #include "output/ValueFormat.h"
 
 #include "base/Format.h"
