@@ -7,8 +7,17 @@
 //   puppet big MIB                 private memory, every page written
 //   puppet maps COUNT              COUNT mappings of one page each, every second one written
 //   puppet churn                   maps and unmaps without end
+//   puppet family KIDS PAGES HOW   forks KIDS children that share PAGES pages and then change them: HOW is
+//   "same", "half"
+//                                  (every second page written), "random" (three pages in ten, drawn by the
+//                                  child's number), "drop" (the second half unmapped), "huge" (huge pages,
+//                                  the first 4 KiB of each written) or "grow" (the parent's and the
+//                                  children's mappings grow apart)
+//   puppet twins                   a second process in the same address space
 //   puppet leaderless              the first thread ends, another lives on
-//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY
+//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY;
+//   "fixed" in place
+//                                  of a number runs it without randomised addresses
 //
 // Every line of output is "name address bytes key=bytes ...", what the mapping must show; "ready" ends the
 // ledger.
@@ -18,8 +27,10 @@
 #include <linux/filter.h>
 #include <linux/seccomp.h>
 #include <pthread.h>
+#include <sched.h>
 #include <sys/ipc.h>
 #include <sys/mman.h>
+#include <sys/personality.h>
 #include <sys/prctl.h>
 #include <sys/shm.h>
 #include <sys/syscall.h>
@@ -293,6 +304,78 @@ void manyMappings(std::size_t count) {
     }
 }
 
+/// Whether child `child` of a "random" family writes page `at` of its memory.
+bool isDrawn(std::size_t child, std::size_t at) {
+    std::uint64_t x = (child * 1'000'003 + at) * 0x9e3779b97f4a7c15U;
+    x = (x ^ x >> 30) * 0xbf58476d1ce4e5b9U;
+    return (x ^ x >> 31) % 10 < 3;
+}
+
+void change(char* m, std::size_t pages, const std::string& how, std::size_t child) {
+    for (std::size_t i = 0; i < pages; ++i) {
+        const bool writes = how == "half"     ? i % 2 == 0
+                            : how == "random" ? isDrawn(child, i)
+                                              : how == "huge" && i % 512 == 0;
+        if (writes) {
+            write(m, i, 1);
+        }
+    }
+    if (how == "drop") {
+        munmap(m + pages / 2 * page, pages / 2 * page);
+    } else if (how == "grow") {
+        write(map(64 * page, readWrite, privateAnonymous), 0,
+              64); // lies next to what is there, or is merged with it
+    }
+}
+
+void family(std::size_t kids, std::size_t pages, const std::string& how) {
+    char* m = how == "huge" ? map((pages + 512) * page, readWrite, privateAnonymous) : anonymous(pages);
+    if (how == "huge") {
+        m += (512 * page - reinterpret_cast<std::uintptr_t>(m) % (512 * page)) % (512 * page);
+        madvise(m, pages * page, MADV_HUGEPAGE);
+    }
+    write(m, 0, pages);
+    int ready[2];
+    if (pipe(ready) != 0) {
+        fail("pipe");
+    }
+    tell("family", m, pages, "");
+    for (std::size_t child = 0; child < kids; ++child) {
+        const int pid = fork();
+        if (pid == 0) {
+            prctl(PR_SET_PDEATHSIG, SIGKILL);
+            alarm(600);
+            change(m, pages, how, child);
+            static_cast<void>(::write(ready[1], "x", 1));
+            for (;;) {
+                pause();
+            }
+        }
+        std::printf("child 0 %d\n", pid);
+    }
+    for (std::size_t child = 0; child < kids; ++child) {
+        char byte = 0;
+        static_cast<void>(read(ready[0], &byte, 1));
+    }
+    if (how == "grow") {
+        change(m, pages, how, kids);
+    }
+}
+
+void twins() {
+    char* m = anonymous(64);
+    write(m, 0, 64);
+    tell("twins", m, 64, figure("dirty", 64));
+    static char stack[65536];
+    const auto wait = [](void*) -> int {
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        for (;;) {
+            pause();
+        }
+    };
+    std::printf("child 0 %d\n", clone(wait, stack + sizeof(stack), CLONE_VM | SIGCHLD, nullptr));
+}
+
 void leaderless() {
     const auto rest = [](void*) -> void* {
         char* m = anonymous(32);
@@ -330,7 +413,11 @@ int main(int argc, char** argv) {
     const std::string what = argc > 1 ? argv[1] : "";
     const auto number = [&](int at) { return at < argc ? std::strtoul(argv[at], nullptr, 0) : 0UL; };
     if (what == "refuse" && argc > 3) {
-        refuse(static_cast<std::uint32_t>(number(2)));
+        if (std::string(argv[2]) == "fixed") {
+            personality(ADDR_NO_RANDOMIZE);
+        } else {
+            refuse(static_cast<std::uint32_t>(number(2)));
+        }
         execv(argv[3], argv + 3);
         fail(argv[3]);
     }
@@ -348,6 +435,10 @@ int main(int argc, char** argv) {
         manyMappings(number(2));
     } else if (what == "churn") {
         churn();
+    } else if (what == "family" && argc > 4) {
+        family(number(2), number(3), argv[4]);
+    } else if (what == "twins") {
+        twins();
     } else if (what == "leaderless") {
         leaderless();
     } else if (what != "idle") {
