@@ -87,7 +87,8 @@ class ScriptedKernel {
     // Faults. `call` is the name of a platform call; the short identity record's is "proc_pidshortinfo".
 
     /// Makes the selected calls fail: with a status code where they return one, else with an errno value.
-    /// Those that can only answer "none" do so.
+    /// Those that can only answer "none" do so. Throws std::invalid_argument for a call that does not exist
+    /// or cannot fail.
     void fail(std::string_view call, int error, CallSelector which = {});
     /// Runs `action` before the selected calls are answered.
     void before(std::string_view call, std::function<void()> action, CallSelector which = {});

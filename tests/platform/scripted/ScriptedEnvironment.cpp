@@ -9,7 +9,7 @@ namespace {
 class ScriptedEnvironment final : public Environment {
   public:
     ScriptedEnvironment() : task_(addSubject()) {
-        kernel_.addTask({.pid = kernel_.ownPid, .name = "contract_tests"});
+        kernel_.addTask({.pid = kernel_.ownPid, .name = "contract_tests"}).map({.pages = "D"});
         kernel_.addTask({.pid = 1, .parent = 0, .name = "init"});
         const auto& anonymous =
             task_.map({.start = 0x10'0000, .size = 64 * page, .tag = 1, .pages = "DDRSS"});
