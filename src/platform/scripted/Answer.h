@@ -76,7 +76,7 @@ class Answer {
     }
 
   private:
-    void begin(CallRecord record);
+    void begin(const CallRecord& record);
 
     std::lock_guard<std::recursive_mutex> lock_;
 };

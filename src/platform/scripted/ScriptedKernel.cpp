@@ -13,7 +13,11 @@ namespace tally::platform {
 
 namespace {
 
-std::atomic<ScriptedKernel*> currentKernel = nullptr;
+// The calls are free functions: where they find their kernel is a variable of the run.
+std::atomic<ScriptedKernel*>& currentKernel() {
+    static std::atomic<ScriptedKernel*> kernel = nullptr;
+    return kernel;
+}
 
 // A fault for a call that is in neither list would never happen, and its test would prove nothing.
 constexpr std::array<std::string_view, 35> callsThatCanFail{
@@ -78,13 +82,13 @@ void requireCallName(std::string_view call, bool canFail) {
 } // namespace
 
 ScriptedKernel::ScriptedKernel() : state_(std::make_unique<State>()) {
-    tl_assert(currentKernel.exchange(this) == nullptr, "one scripted kernel at a time");
+    tl_assert(currentKernel().exchange(this) == nullptr, "one scripted kernel at a time");
 }
 
-ScriptedKernel::~ScriptedKernel() { currentKernel = nullptr; }
+ScriptedKernel::~ScriptedKernel() { currentKernel() = nullptr; }
 
 ScriptedKernel& ScriptedKernel::current() {
-    ScriptedKernel* kernel = currentKernel;
+    ScriptedKernel* kernel = currentKernel();
     tl_assert(kernel != nullptr, "a scripted kernel answers");
     return *kernel;
 }
@@ -116,13 +120,15 @@ void ScriptedKernel::fail(std::string_view call, int error, CallSelector which) 
     requireCallName(call, true);
     tl_assert(error != 0, "a failing call has an error");
     const std::lock_guard lock(state_->mutex);
-    state_->faults.push_back(std::make_unique<State::Fault>(std::string(call), which, error));
+    state_->faults.push_back(std::make_unique<State::Fault>(
+        State::Fault{.call = std::string(call), .which = which, .error = error, .action = {}}));
 }
 
 void ScriptedKernel::before(std::string_view call, std::function<void()> action, CallSelector which) {
     requireCallName(call, false);
     const std::lock_guard lock(state_->mutex);
-    state_->faults.push_back(std::make_unique<State::Fault>(std::string(call), which, 0, std::move(action)));
+    state_->faults.push_back(std::make_unique<State::Fault>(
+        State::Fault{.call = std::string(call), .which = which, .error = 0, .action = std::move(action)}));
 }
 
 bool ScriptedKernel::interrupt() {
@@ -177,7 +183,7 @@ Answer::Answer(const char* call, PortName port, Numbers arguments, std::string_v
     begin({call, pid, std::move(arguments), std::string(text)});
 }
 
-void Answer::begin(CallRecord record) {
+void Answer::begin(const CallRecord& record) {
     requireCallName(record.name, false);
     state.calls.push_back(record);
     for (std::size_t i = 0; i < state.faults.size(); ++i) {
