@@ -4,18 +4,21 @@
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/images/LayoutTable.h"
 #include "platform/linux/objects/Backing.h"
+#include "platform/linux/owned/OwnedGather.h"
 
 namespace tally::platform {
 
 GatherScope::GatherScope() {
     forgetFileSystems();
     beginLayouts();
+    beginOwned();
     beginMachineState();
     beginFamilies();
 }
 
 GatherScope::~GatherScope() {
     endFamilies();
+    endOwned();
     endMachineState();
 }
 

@@ -31,6 +31,11 @@ std::optional<FileSystem> fileSystemOfType(std::string_view type) {
                                                  : FileSystem::ordinary;
 }
 
+/// A path that leads to the file, whatever its name is.
+std::string pathOf(const Mapping& mapping, const std::string& folder, const std::string& descriptor) {
+    return descriptor.empty() ? mapFilePath(folder, mapping) : descriptor;
+}
+
 /// Looks the device up among the mounts that the process sees.
 std::optional<FileSystem> fileSystemFromMounts(const Mapping& mapping, const std::string& folder) {
     const std::optional<std::string> mounts = readSystemFile(folder + "/mountinfo");
@@ -53,13 +58,13 @@ std::optional<FileSystem> fileSystemFromMounts(const Mapping& mapping, const std
     return std::nullopt;
 }
 
-FileSystem inspectFileSystem(const Mapping& mapping, const std::string& folder) {
+FileSystem inspectFileSystem(const Mapping& mapping, const std::string& folder, const std::string& path) {
     // The list of mounts never waits for a server, as a question to the file system could.
     if (const std::optional<FileSystem> mounted = fileSystemFromMounts(mapping, folder)) {
         return *mounted;
     }
     struct statfs status {};
-    if (statfs(mapFilePath(folder, mapping).c_str(), &status) == 0) {
+    if (statfs(path.c_str(), &status) == 0) {
         switch (static_cast<std::uint64_t>(status.f_type)) {
         case TMPFS_MAGIC:
             return FileSystem::sharedMemory;
@@ -87,7 +92,7 @@ FileSystemTable& fileSystemTable() {
     return table;
 }
 
-FileSystem fileSystemOf(const Mapping& mapping, const std::string& folder) {
+FileSystem fileSystemOf(const Mapping& mapping, const std::string& folder, const std::string& descriptor) {
     if (mapping.deviceMajor != 0) {
         return FileSystem::ordinary; // on a disk
     }
@@ -97,12 +102,13 @@ FileSystem fileSystemOf(const Mapping& mapping, const std::string& folder) {
     if (found != table.byMinor.end()) {
         return found->second;
     }
-    return table.byMinor[mapping.deviceMinor] = inspectFileSystem(mapping, folder);
+    return table.byMinor[mapping.deviceMinor] =
+               inspectFileSystem(mapping, folder, pathOf(mapping, folder, descriptor));
 }
 
-bool isRegularFile(const Mapping& mapping, const std::string& folder) {
+bool isRegularFile(const Mapping& mapping, const std::string& folder, const std::string& descriptor) {
     struct stat status {};
-    const bool known = stat(mapFilePath(folder, mapping).c_str(), &status) == 0 ||
+    const bool known = stat(pathOf(mapping, folder, descriptor).c_str(), &status) == 0 ||
                        stat((folder + "/root" + mapping.name).c_str(), &status) == 0;
     return !known || S_ISREG(status.st_mode);
 }
@@ -110,7 +116,7 @@ bool isRegularFile(const Mapping& mapping, const std::string& folder) {
 /// Whether a mapping of the kernel's internal mounts has no name that a user gave it a path by.
 bool isNameless(std::string_view name) {
     return name.starts_with("/memfd:") || name.starts_with("/SYSV") || name == "/dev/zero (deleted)" ||
-           name.starts_with("/anon_hugepage") || name.empty();
+           name.starts_with("/anon_hugepage") || name.starts_with("[anon_shmem:") || name.empty();
 }
 
 } // namespace
@@ -121,7 +127,7 @@ void forgetFileSystems() {
     table.byMinor.clear();
 }
 
-BackingObject backingOf(const Mapping& mapping, const std::string& folder) {
+BackingObject backingOf(const Mapping& mapping, const std::string& folder, const std::string& descriptor) {
     BackingObject object;
     if (!mapping.isFileBacked()) {
         object.backing = mapping.isKernelSpecial() ? Backing::special : Backing::anonymous;
@@ -129,14 +135,15 @@ BackingObject backingOf(const Mapping& mapping, const std::string& folder) {
     }
     object.device = std::uint64_t{mapping.deviceMajor} << 32 | mapping.deviceMinor;
     object.inode = mapping.inode;
-    const FileSystem system = fileSystemOf(mapping, folder);
+    const FileSystem system = fileSystemOf(mapping, folder, descriptor);
     const bool internal =
         mapping.deviceMajor == 0 && (mapping.deviceMinor == internalMount || system == FileSystem::hugetlb);
     object.hasName = !(internal && isNameless(mapping.name));
     object.isSysV = internal && mapping.name.starts_with("/SYSV");
     if (system == FileSystem::hugetlb || mapping.pageSize > basePage) {
         object.backing = Backing::hugetlb;
-    } else if (mapping.name.starts_with("/dev/") && !internal && !isRegularFile(mapping, folder)) {
+    } else if (mapping.name.starts_with("/dev/") && !internal &&
+               !isRegularFile(mapping, folder, descriptor)) {
         object.backing = Backing::device; // device files live on a tmpfs too
     } else {
         object.backing = system == FileSystem::sharedMemory ? Backing::sharedMemory : Backing::file;
@@ -145,7 +152,7 @@ BackingObject backingOf(const Mapping& mapping, const std::string& folder) {
         // Files of two subvolumes can have one (device, inode) in the list of mappings; the file itself knows
         // better.
         struct stat status {};
-        if (stat(mapFilePath(folder, mapping).c_str(), &status) == 0) {
+        if (stat(pathOf(mapping, folder, descriptor).c_str(), &status) == 0) {
             object.device = std::uint64_t{major(status.st_dev)} << 32 | minor(status.st_dev);
         }
     }

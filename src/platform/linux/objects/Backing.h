@@ -28,7 +28,9 @@ struct BackingObject {
     bool isSysV = false; // SysV segments and memfds share one numbering
 };
 
-BackingObject backingOf(const Mapping& mapping, const std::string& folder);
+/// @param descriptor for a file that the process has open instead of mapped: the path of its descriptor.
+BackingObject backingOf(const Mapping& mapping, const std::string& folder,
+                        const std::string& descriptor = "");
 
 /// Forgets what is known of file systems: their device numbers can be used again.
 void forgetFileSystems();

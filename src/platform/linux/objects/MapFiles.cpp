@@ -29,15 +29,6 @@ struct cachestat_counts {
 };
 constexpr long cachestatCall = 451;
 
-/// Opens `path` if a regular file is there. Opening anything else can wait, or act on a device.
-Descriptor openRegularFile(const std::string& path) {
-    struct stat status {};
-    if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
-        return Descriptor();
-    }
-    return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-}
-
 bool isFileOf(const Descriptor& file, const Mapping& mapping) {
     struct stat status {};
     return fstat(file.number(), &status) == 0 && S_ISREG(status.st_mode) && status.st_ino == mapping.inode &&
@@ -49,6 +40,14 @@ bool isFileOf(const Descriptor& file, const Mapping& mapping) {
 std::string mapFilePath(const std::string& folder, const Mapping& mapping) {
     return formatted("%s/map_files/%llx-%llx", folder.c_str(), static_cast<unsigned long long>(mapping.start),
                      static_cast<unsigned long long>(mapping.end));
+}
+
+Descriptor openRegularFile(const std::string& path) {
+    struct stat status {};
+    if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
+        return Descriptor();
+    }
+    return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
 }
 
 Descriptor openMappedFile(const std::string& folder, const Mapping& mapping) {

@@ -17,6 +17,9 @@ namespace tally::platform {
 /// The path by which the file behind a mapping of the process folder is reached, whatever its name is.
 std::string mapFilePath(const std::string& folder, const Mapping& mapping);
 
+/// Opens `path` for reading if a regular file is there: opening anything else can wait, or act on a device.
+Descriptor openRegularFile(const std::string& path);
+
 /// Opens the file behind `mapping`. Not open when it is no regular file or may not be opened.
 Descriptor openMappedFile(const std::string& folder, const Mapping& mapping);
 

@@ -41,6 +41,7 @@ constexpr std::uint64_t ofFile = 1;
 constexpr std::uint64_t ofTask = 2;
 constexpr std::uint64_t ofSharedSet = 3;
 constexpr std::uint64_t ofFoldedSets = 4;
+constexpr std::uint64_t ofKernelBuffer = 5;
 
 } // namespace
 
@@ -62,6 +63,10 @@ std::uint64_t objectIdOfSharedSet(std::uint64_t set, std::uint64_t cluster) {
 
 std::uint64_t objectIdOfFoldedSets(std::uint64_t firstHolder, std::uint64_t cluster, bool resident) {
     return identityOf({ofFoldedSets, firstHolder, cluster, resident ? 1U : 0U});
+}
+
+std::uint64_t objectIdOfKernelBuffer(KernelBuffer kind, std::uint64_t number) {
+    return identityOf({ofKernelBuffer, static_cast<std::uint64_t>(kind), number});
 }
 
 } // namespace tally::platform

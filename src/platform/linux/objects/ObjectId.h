@@ -26,4 +26,9 @@ std::uint64_t objectIdOfSharedSet(std::uint64_t set, std::uint64_t cluster);
 /// The resident, or the swapped, pages that `firstHolder` shares with changing sets of relatives.
 std::uint64_t objectIdOfFoldedSets(std::uint64_t firstHolder, std::uint64_t cluster, bool resident);
 
+/// Memory that a driver or the kernel itself keeps for whoever holds a descriptor, by the number that the
+/// kernel gives it.
+enum class KernelBuffer : std::uint8_t { dmaBuffer, graphicsClient, bpfMap };
+std::uint64_t objectIdOfKernelBuffer(KernelBuffer kind, std::uint64_t number);
+
 } // namespace tally::platform

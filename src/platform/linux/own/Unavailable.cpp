@@ -1,7 +1,6 @@
 // Calls that this system answers with "none".
 
 #include "platform/benchlog.h"
-#include "platform/bsd_process.h"
 #include "platform/dyld_inspection.h"
 #include "platform/mach_kernel_memory.h"
 #include "platform/mach_task.h"
@@ -41,11 +40,6 @@ kern_return_t task_map_corpse_info_64(mach_port_t /*corpse*/, std::span<const st
 }
 
 kern_return_t vm_deallocate(std::span<const std::byte> /*buffer*/) { return KERN_SUCCESS; }
-
-int sysctl_owned_vmobjects(std::uint32_t /*task*/, std::span<std::byte> /*reply*/, std::size_t* /*length*/) {
-    errno = ENOENT;
-    return -1;
-}
 
 std::unique_ptr<QRYProcessObjectGraph> QRYDirectedGraphWithData(std::string_view /*contents*/,
                                                                 std::string* error) {

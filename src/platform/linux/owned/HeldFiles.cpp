@@ -1,0 +1,97 @@
+#include "platform/linux/owned/HeldFiles.h"
+
+#include "platform/linux/gather/MachineState.h"
+#include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/objects/ObjectId.h"
+#include "platform/linux/owned/DescriptorInfo.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <climits>
+#include <memory>
+#include <optional>
+#include <string_view>
+
+namespace tally::platform {
+
+namespace {
+
+constexpr std::uint64_t blockSize = 512;
+
+std::uint64_t wholePages(std::uint64_t size) { return (size + basePage - 1) / basePage * basePage; }
+
+/// A file without a name that only its descriptors, or mappings, keep: absent when it is none in memory.
+std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::string& descriptor,
+                                      std::string_view link) {
+    struct statx status {};
+    // What is known of it will do: asking a server could take long.
+    if (statx(AT_FDCWD, descriptor.c_str(), AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &status) != 0 ||
+        !S_ISREG(status.stx_mode) || status.stx_nlink != 0 || status.stx_dev_major != 0) {
+        return std::nullopt;
+    }
+    Mapping file;
+    file.deviceMajor = status.stx_dev_major;
+    file.deviceMinor = status.stx_dev_minor;
+    file.inode = status.stx_ino;
+    file.name = link;
+    const BackingObject object = backingOf(file, folder, descriptor);
+    const bool isHuge = object.backing == Backing::hugetlb;
+    if (!isHuge && object.backing != Backing::sharedMemory) {
+        return std::nullopt;
+    }
+    OwnedRecord record;
+    record.objectId = objectIdOfFile(object);
+    record.residentSize = status.stx_blocks * blockSize; // what is swapped out included
+    record.virtualSize = std::max(wholePages(status.stx_size), record.residentSize);
+    if (isHuge) {
+        record.wiredSize = record.residentSize;
+    } else if (record.residentSize != 0 && machineState().swapInUse) {
+        const auto pages = cachedPages(openRegularFile(descriptor), 0, record.virtualSize);
+        record.compressedSize = std::min(pages ? pages->evicted * basePage : 0, record.residentSize);
+        record.residentSize -= record.compressedSize;
+    }
+    return record;
+}
+
+std::optional<OwnedRecord> recordOf(const std::string& folder, const char* number, std::string_view link) {
+    if (link.starts_with('/') && link.ends_with(" (deleted)")) {
+        return memoryFile(folder, folder + "/fd/" + number, link);
+    }
+    const auto decode = link.starts_with("/dmabuf") || link == "anon_inode:dmabuf" ? decodeDmaBuffer
+                        : link.starts_with("/dev/dri/")                            ? decodeGraphicsClient
+                        : link == "anon_inode:bpf-map"                             ? decodeBpfMap
+                                                                                   : nullptr;
+    return decode == nullptr ? std::nullopt
+                             : decode(readSystemFile(folder + "/fdinfo/" + number).value_or(""));
+}
+
+} // namespace
+
+bool forEachHeldObject(const std::string& folder, const std::function<void(const OwnedRecord&)>& found) {
+    const std::unique_ptr<DIR, int (*)(DIR*)> descriptors(opendir((folder + "/fd").c_str()), closedir);
+    if (!descriptors) {
+        return false;
+    }
+    std::array<char, PATH_MAX> link; // the kernel shows no longer one
+    while (const dirent* entry = readdir(descriptors.get())) {
+        const char* const number = entry->d_name;
+        const ssize_t length = readlinkat(dirfd(descriptors.get()), number, link.data(), link.size());
+        if (length <= 0) {
+            continue; // closed meanwhile, or no descriptor
+        }
+        const auto record = recordOf(folder, number, {link.data(), static_cast<std::size_t>(length)});
+        if (record && record->holdsMemory()) {
+            found(*record);
+        }
+    }
+    return true;
+}
+
+} // namespace tally::platform
