@@ -33,7 +33,7 @@ quietly() {
     shift
     mkdir -p "$root/build"
     "$@" > "$log" 2>&1 || {
-        cat "$log" >&2
+        grep -v "^\[[0-9]*/[0-9]*\] " "$log" >&2 || true # without ninja's progress
         echo "failed: $*" >&2
         exit 1
     }
