@@ -33,8 +33,9 @@ class TLImageEnumerator {
   public:
     explicit TLImageEnumerator(const std::vector<TLImage>& images) : images_(&images) {}
 
-    /// The first image at or after the cursor that overlaps [start, end); null when there is none. The cursor
-    /// stays on an image that was returned. The pointer is valid until the list changes.
+    /// The first image at or after the cursor that overlaps [start, end), or contains `start` when that is
+    /// the end; null when there is none. The cursor stays on an image that was returned. The pointer is valid
+    /// until the list changes.
     const TLImage* nextImageOverlapping(std::uint64_t start, std::uint64_t end);
 
   private:

@@ -12,16 +12,35 @@
 #include "vm/TLMemoryRegion.h"
 #include "vm/TLRangeList.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace tally {
 
+/// A list of regions that it does not own. Most lists hold one region, and that one is held in place.
+class TLRegionPointers {
+  public:
+    void push_back(TLMemoryRegion* region);
+    std::size_t size() const { return more_.empty() ? (first_ == nullptr ? 0 : 1) : more_.size(); }
+    bool empty() const { return first_ == nullptr; }
+    TLMemoryRegion* front() const { return first_; }
+    TLMemoryRegion* const* begin() const { return more_.empty() ? &first_ : more_.data(); }
+    TLMemoryRegion* const* end() const { return begin() + size(); }
+
+  private:
+    TLMemoryRegion* first_ = nullptr;
+    std::vector<TLMemoryRegion*> more_; // all of them, when there is more than one
+};
+
 class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
   public:
-    using RegionList = std::vector<TLMemoryRegion*>;
+    using RegionList = TLRegionPointers;
+    using ProcessRegionList = std::pair<std::int32_t, RegionList>; // of the pid
 
     TLMemoryObject() = default;
     TLMemoryObject(const TLMemoryObject&) = delete;
@@ -33,7 +52,7 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     /// Computes the totals, once. `breakDown`: as the plain sums of what the regions are charged.
     void finalizeSizes(bool breakDown);
 
-    bool hasUnmappedOwnedRegion() const;
+    bool hasUnmappedOwnedRegion() const { return hasUnmappedOwnedRegion_; }
     bool hasProcessSpecificSizes() const;
     /// The region whose names the object bears; null when it has none.
     const TLMemoryRegion* representativeRegion() const;
@@ -57,21 +76,25 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     std::uint64_t totalWiredSize = 0;
 
     bool accurateSizes() const { return accurateSizes_; }
-    const RegionList& memoryRegions() const { return *memoryRegions_; }
-    const TLRangeList* rangeList() const { return rangeList_.get(); }
-    /// Lists of regions by pid; empty unless they add information.
-    const std::vector<std::pair<std::int32_t, RegionList>>& processMemoryRegions() const {
-        return processMemoryRegions_;
+    const RegionList& memoryRegions() const {
+        return original_ == nullptr ? memoryRegions_ : original_->memoryRegions();
     }
+    const TLRangeList* rangeList() const { return rangeList_ ? &*rangeList_ : nullptr; }
+    /// Lists of regions by rising pid; empty unless they add information.
+    const std::vector<ProcessRegionList>& processMemoryRegions() const { return processMemoryRegions_; }
 
   private:
     const RegionList* regionsOf(std::int32_t pid) const;
+    RegionList& makeRegionsOf(std::int32_t pid);
     bool processListsAddInformation() const;
+    void nameUnmappedRegions();
 
     bool accurateSizes_ = false;
-    std::shared_ptr<RegionList> memoryRegions_ = std::make_shared<RegionList>();
-    std::vector<std::pair<std::int32_t, RegionList>> processMemoryRegions_;
-    std::unique_ptr<TLRangeList> rangeList_;
+    bool hasUnmappedOwnedRegion_ = false;
+    RegionList memoryRegions_;                       // in order of adding
+    std::shared_ptr<const TLMemoryObject> original_; // of a copy: the object whose regions it has
+    std::vector<ProcessRegionList> processMemoryRegions_;
+    std::optional<TLRangeList> rangeList_; // dropped when sizes are final
 };
 
 } // namespace tally

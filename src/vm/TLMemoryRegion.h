@@ -73,5 +73,6 @@ struct TLMemoryRegion {
     void addSubrange(std::uint64_t start, std::uint64_t size, const TLRangeSizes& sizes,
                      std::uint64_t pageSize);
 };
+static_assert(sizeof(TLMemoryRegion) <= 160);
 
 } // namespace tally

@@ -1,0 +1,213 @@
+#include "vm/TLMemoryObject.h"
+
+#include "base/Assertion.h"
+#include "vm/PhysTallyCollection.h"
+
+#include <algorithm>
+#include <functional>
+
+namespace tally {
+
+namespace {
+
+std::uint64_t wiredBytes(const TLMemoryRegion& region) { return region.wired ? region.size : 0; }
+
+/// What the regions' processes are charged; bytes.
+struct Charges {
+    std::uint64_t dirty = 0;
+    std::uint64_t swapped = 0;
+};
+
+Charges sumOfCharges(const TLRegionPointers& regions) {
+    Charges sum;
+    for (const TLMemoryRegion* region : regions) {
+        sum.dirty += region->dirtySize;
+        sum.swapped += region->swappedSize;
+    }
+    return sum;
+}
+
+/// The first region that is wanted, else the first one.
+const TLMemoryRegion* firstRegionOrHead(const TLRegionPointers& regions, auto&& isWanted) {
+    const auto* const found = std::find_if(regions.begin(), regions.end(), isWanted);
+    return found == regions.end() ? regions.front() : *found;
+}
+
+} // namespace
+
+void TLRegionPointers::push_back(TLMemoryRegion* region) {
+    if (first_ == nullptr) {
+        first_ = region;
+        return;
+    }
+    if (more_.empty()) {
+        more_.push_back(first_);
+    }
+    more_.push_back(region);
+}
+
+void TLMemoryObject::addRegionForProcess(TLMemoryRegion& region, const MemoryHolder* process) {
+    tl_assert(process != nullptr, "process");
+    addRegionWithPageSize(region, process->pageSize(), process);
+}
+
+void TLMemoryObject::addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t pageSize,
+                                           const MemoryHolder* process) {
+    tl_assert(!accurateSizes_, "!self.accurateSizes");
+    memoryRegions_.push_back(&region);
+    hasUnmappedOwnedRegion_ = hasUnmappedOwnedRegion_ || region.user_tag == TLUnmappedTag;
+    if (region.object_id == 0) {
+        return;
+    }
+    if (process != nullptr && (!processMemoryRegions_.empty() || region.isSharedMapping())) {
+        makeRegionsOf(process->pid()).push_back(&region);
+    }
+    if (!rangeList_) {
+        rangeList_.emplace();
+    }
+    rangeList_->addRegionRange(region, pageSize);
+    region.subrangeList.reset();
+}
+
+void TLMemoryObject::finalizeSizes(bool breakDown) {
+    tl_assert(!accurateSizes_, "!self.accurateSizes");
+    const TLRangeSizes united = rangeList_ ? rangeList_->sumSizes() : TLRangeSizes();
+    if (breakDown) {
+        const Charges charged = sumOfCharges(memoryRegions_);
+        totalDirtySize = charged.dirty;
+        totalSwappedSize = charged.swapped;
+    } else {
+        totalDirtySize = united.dirty;
+        totalSwappedSize = united.swapped;
+        if (!processMemoryRegions_.empty() && physTallyCollectionEnabled()) {
+            for (const auto& [pid, regions] : processMemoryRegions_) {
+                const Charges charged = sumOfCharges(regions);
+                totalDirtySize = std::max(totalDirtySize, charged.dirty);
+                totalSwappedSize = std::max(totalSwappedSize, charged.swapped);
+            }
+        }
+    }
+    totalCleanSize = united.clean;
+    totalReclaimableSize = united.reclaimable;
+    totalWiredSize = united.wired;
+    rangeList_.reset();
+    if (!processListsAddInformation()) {
+        processMemoryRegions_ = {};
+    }
+    if (hasUnmappedOwnedRegion_) {
+        nameUnmappedRegions();
+    }
+    accurateSizes_ = true;
+}
+
+/// Memory that its owner does not map bears the name under which somebody else maps it.
+void TLMemoryObject::nameUnmappedRegions() {
+    const TLMemoryRegion& representative = *representativeRegion();
+    if (representative.user_tag == TLUnmappedTag) {
+        return;
+    }
+    for (TLMemoryRegion* region : memoryRegions_) {
+        if (region->user_tag == TLUnmappedTag) {
+            region->name = representative.name;
+            region->detailedName = representative.detailedName;
+        }
+    }
+}
+
+/// Whether some process sees the object otherwise than its totals say.
+bool TLMemoryObject::processListsAddInformation() const {
+    if (processMemoryRegions_.size() < 2) {
+        return false;
+    }
+    return std::ranges::any_of(processMemoryRegions_, [this](const ProcessRegionList& list) {
+        const TLMemoryRegion& region = *list.second.front();
+        return list.second.size() > 1 || region.dirtySize != totalDirtySize ||
+               region.swappedSize != totalSwappedSize || region.cleanNonSpecSize != totalCleanSize ||
+               region.reclaimableSize != totalReclaimableSize || wiredBytes(region) != totalWiredSize;
+    });
+}
+
+const TLMemoryObject::RegionList* TLMemoryObject::regionsOf(std::int32_t pid) const {
+    const auto found =
+        std::ranges::lower_bound(processMemoryRegions_, pid, std::less(), &ProcessRegionList::first);
+    return found != processMemoryRegions_.end() && found->first == pid ? &found->second : nullptr;
+}
+
+TLMemoryObject::RegionList& TLMemoryObject::makeRegionsOf(std::int32_t pid) {
+    auto found = std::ranges::lower_bound(processMemoryRegions_, pid, std::less(), &ProcessRegionList::first);
+    if (found == processMemoryRegions_.end() || found->first != pid) {
+        found = processMemoryRegions_.emplace(found, pid, RegionList());
+    }
+    return found->second;
+}
+
+bool TLMemoryObject::hasProcessSpecificSizes() const {
+    return !processMemoryRegions_.empty() || ownerPid != -1;
+}
+
+const TLMemoryRegion* TLMemoryObject::representativeRegion() const {
+    const RegionList& regions = memoryRegions();
+    if (!regions.empty() && regions.front()->inSharedCache) {
+        return firstRegionOrHead(
+            regions, [](const TLMemoryRegion* region) { return !region->unusedSharedCacheRegion; });
+    }
+    if (ownerPid != -1) {
+        return firstRegionOrHead(
+            regions, [](const TLMemoryRegion* region) { return region->user_tag != TLUnmappedTag; });
+    }
+    return regions.front();
+}
+
+Name TLMemoryObject::name() const {
+    const TLMemoryRegion* const region = representativeRegion();
+    return region == nullptr ? Name() : region->name;
+}
+
+Name TLMemoryObject::detailedName() const {
+    const TLMemoryRegion* const region = representativeRegion();
+    return region == nullptr ? Name() : region->detailedName;
+}
+
+std::string TLMemoryObject::fullName() const {
+    const TLMemoryRegion* const region = representativeRegion();
+    return region == nullptr ? std::string() : region->fullName();
+}
+
+bool TLMemoryObject::verbose() const { return !memoryRegions().empty() && memoryRegions().front()->verbose; }
+
+std::shared_ptr<const TLMemoryObject> TLMemoryObject::viewForProcess(const MemoryHolder& process) const {
+    std::shared_ptr<const TLMemoryObject> view = shared_from_this();
+    if (const RegionList* const regions = regionsOf(process.pid())) {
+        const auto own = std::make_shared<TLMemoryObject>();
+        own->ownerPid = ownerPid;
+        for (TLMemoryRegion* region : *regions) {
+            own->addRegionWithPageSize(*region, process.pageSize(), nullptr);
+        }
+        own->finalizeSizes(process.breakDownPhysTally());
+        view = own;
+    }
+    if (ownerPid != -1 && ownerPid != process.pid()) { // another process pays for it
+        const auto paidByOwner = view->copy();
+        paidByOwner->totalDirtySize = 0;
+        paidByOwner->totalSwappedSize = 0;
+        paidByOwner->totalCleanSize = view->totalCleanSize + totalDirtySize + totalSwappedSize;
+        view = paidByOwner;
+    }
+    return view;
+}
+
+std::shared_ptr<TLMemoryObject> TLMemoryObject::copy() const {
+    tl_assert(accurateSizes_ && !rangeList_, "self.accurateSizes && !self.rangeList");
+    const auto copied = std::make_shared<TLMemoryObject>();
+    copied->totalDirtySize = totalDirtySize;
+    copied->totalSwappedSize = totalSwappedSize;
+    copied->totalCleanSize = totalCleanSize;
+    copied->totalWiredSize = totalWiredSize;
+    copied->original_ = shared_from_this();
+    copied->hasUnmappedOwnedRegion_ = hasUnmappedOwnedRegion_;
+    copied->accurateSizes_ = true;
+    copied->ownerPid = ownerPid;
+    return copied;
+}
+
+} // namespace tally

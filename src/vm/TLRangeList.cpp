@@ -1,0 +1,102 @@
+#include "vm/TLRangeList.h"
+
+#include "vm/PageRounding.h"
+#include "vm/TLMemoryRegion.h"
+
+#include <algorithm>
+#include <utility>
+
+namespace tally {
+
+namespace {
+
+/// What two ranges hold together: never less than either, and what may lie in the overlap of both is counted
+/// once.
+std::uint64_t mergedBytes(std::uint64_t a, std::uint64_t b, std::uint64_t overlap) {
+    const std::uint64_t sum = a + b;
+    return std::max({a, b, sum < overlap ? 0 : sum - overlap});
+}
+
+TLRangeSizes mergedSizes(const TLRangeSizes& a, const TLRangeSizes& b, std::uint64_t overlap) {
+    return {
+        .dirty = mergedBytes(a.dirty, b.dirty, overlap),
+        .swapped = mergedBytes(a.swapped, b.swapped, overlap),
+        .clean = mergedBytes(a.clean, b.clean, overlap),
+        .reclaimable = mergedBytes(a.reclaimable, b.reclaimable, overlap),
+        .wired = mergedBytes(a.wired, b.wired, overlap),
+    };
+}
+
+} // namespace
+
+TLRangeList::~TLRangeList() {
+    while (head_) { // one by one: a chain of nodes that free each other would use up the stack
+        head_ = std::move(head_->next);
+    }
+}
+
+void TLRangeList::addSubrange(std::uint64_t start, std::uint64_t size, std::uint64_t pageSize,
+                              const TLRangeSizes& sizes) {
+    const std::uint64_t firstPage = roundDownToPage(start, pageSize);
+    const std::uint64_t pagesEnd = roundUpToPage(start + size, pageSize);
+    const auto isBefore = [&](const TLRangeListNode& node) {
+        return roundUpToPage(node.end(), pageSize) < firstPage;
+    };
+    auto node = std::make_unique<TLRangeListNode>();
+    node->start = start;
+    node->size = size;
+    node->sizes = sizes;
+
+    std::unique_ptr<TLRangeListNode>* link =
+        lastInserted_ != nullptr && isBefore(*lastInserted_) ? &lastInserted_->next : &head_;
+    while (*link && isBefore(**link)) {
+        link = &(*link)->next;
+    }
+    while (*link && roundDownToPage((*link)->start, pageSize) <= pagesEnd) {
+        const TLRangeListNode& other = **link;
+        const std::uint64_t overlapStart = std::max(roundDownToPage(other.start, pageSize), firstPage);
+        const std::uint64_t overlapEnd = std::min(roundUpToPage(other.end(), pageSize), pagesEnd);
+        node->sizes =
+            mergedSizes(other.sizes, node->sizes, overlapEnd > overlapStart ? overlapEnd - overlapStart : 0);
+        const std::uint64_t end = std::max(other.end(), node->end());
+        node->start = std::min(other.start, node->start);
+        node->size = end - node->start;
+        *link = std::move((*link)->next);
+    }
+    node->next = std::move(*link);
+    *link = std::move(node);
+    lastInserted_ = link->get();
+}
+
+void TLRangeList::addRegionRange(const TLMemoryRegion& region, std::uint64_t pageSize) {
+    if (region.subrangeList) {
+        mergeRangeList(*region.subrangeList, pageSize);
+        return;
+    }
+    addSubrange(region.offset, region.size, pageSize,
+                {.dirty = region.dirtySize,
+                 .swapped = region.swappedSize,
+                 .clean = region.cleanNonSpecSize,
+                 .reclaimable = region.reclaimableSize,
+                 .wired = region.wired ? region.size : 0});
+}
+
+void TLRangeList::mergeRangeList(const TLRangeList& other, std::uint64_t pageSize) {
+    for (const TLRangeListNode* node = other.rangeListHead(); node != nullptr; node = node->next.get()) {
+        addSubrange(node->start, node->size, pageSize, node->sizes);
+    }
+}
+
+TLRangeSizes TLRangeList::sumSizes() const {
+    TLRangeSizes sum;
+    for (const TLRangeListNode* node = rangeListHead(); node != nullptr; node = node->next.get()) {
+        sum.dirty += node->sizes.dirty;
+        sum.swapped += node->sizes.swapped;
+        sum.clean += node->sizes.clean;
+        sum.reclaimable += node->sizes.reclaimable;
+        sum.wired += node->sizes.wired;
+    }
+    return sum;
+}
+
+} // namespace tally
