@@ -7,16 +7,18 @@
 #pragma once
 
 #include "platform/bsd_process.h"
+#include "platform/kern_return.h"
 #include "process/TLAuxData.h"
 #include "vm/MemoryHolder.h"
 #include "vm/TLMemoryRegion.h"
 #include "vm/TLSharedCache.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
-#include <string_view>
+#include <utility>
 #include <vector>
 
 namespace tally {
@@ -24,7 +26,7 @@ namespace tally {
 /// What is known of a process's readiness to be ended when idle.
 enum class TLIdleExitStatus : std::int32_t { unknown = 0, notTracked = 1, clean = 2, dirty = 3 };
 
-class TLProcess : public MemoryHolder {
+class TLProcess : public virtual MemoryHolder {
   public:
     using RegionList = std::vector<TLMemoryRegion>;
 
@@ -34,10 +36,10 @@ class TLProcess : public MemoryHolder {
 
     /// The process of `pid`; null when it does not exist or cannot be read.
     static std::shared_ptr<TLProcess> processWithPid(std::int32_t pid);
-    /// The right kind of process for `info`; null when it cannot be read. With `announceRefusal` the reason
-    /// goes to standard error.
+    /// The right kind of process for `info`; null when it cannot be read. The kernel's refusal goes to
+    /// `refusal` where that is given (KERN_SUCCESS: there was none), else to standard error.
     static std::shared_ptr<TLProcess> processWithBsdInfo(const platform::proc_bsdinfo& info,
-                                                         bool announceRefusal = true);
+                                                         platform::kern_return_t* refusal = nullptr);
     /// The last component of the executable's path, else a name from the record, else "Unknown". Thread-safe.
     static std::string nameForBsdInfo(const platform::proc_bsdinfo& info);
 
@@ -73,13 +75,14 @@ class TLProcess : public MemoryHolder {
     void setPageSize(std::uint64_t pageSize) { pageSize_ = pageSize; }
 
     /// Whether gatherData has left regions.
-    bool hasMemoryRegions() const { return memoryRegions_.has_value(); }
-    /// The regions; an empty list when there are none.
-    RegionList& memoryRegions();
-    const RegionList& memoryRegions() const;
-    void setMemoryRegions(RegionList regions) { memoryRegions_ = std::move(regions); }
+    bool hasMemoryRegions() const { return hasMemoryRegions_; }
+    /// The regions, which stay where they are; an empty list when there are none.
+    RegionList& memoryRegions() { return memoryRegions_; }
+    const RegionList& memoryRegions() const { return memoryRegions_; }
+    void setMemoryRegions(RegionList regions);
 
     std::int64_t asNumber() const { return pid_; }
+    std::size_t hash() const { return static_cast<std::size_t>(pid_); }
     std::string description() const;
 
     void addWarning(std::string text) { warnings_.push_back(std::move(text)); }
@@ -96,21 +99,23 @@ class TLProcess : public MemoryHolder {
 
   protected:
     void setIdleExitStatus(TLIdleExitStatus status) { idleExitStatus_ = status; }
-    bool announcesRefusal() const { return announcesRefusal_; }
+    /// Records that the kernel refused what the kind needs to read the target.
+    void recordRefusal(const char* label, platform::kern_return_t status);
 
   private:
     std::int32_t pid_ = 0;
     bool is64bit_ = false;
     bool isTranslated_ = false;
     bool hiddenFromDisplay_ = false;
-    bool announcesRefusal_ = true;
+    bool hasMemoryRegions_ = false;
+    platform::kern_return_t* refusal_ = nullptr; // who wants to know; only while the process is made
     TLIdleExitStatus idleExitStatus_ = TLIdleExitStatus::unknown;
     std::shared_ptr<const TLSharedCache> sharedCache_;
     std::vector<std::string> errors_;
     std::vector<std::string> warnings_;
     std::vector<std::string> globalErrors_;
     std::string name_;
-    std::optional<RegionList> memoryRegions_;
+    RegionList memoryRegions_;
     std::string displayString_;
     std::uint64_t pageSize_ = 0;
 };

@@ -1,0 +1,82 @@
+#include "process/CorpseKcdata.h"
+
+#include "platform/mach_task.h"
+
+#include <cstring>
+#include <optional>
+
+namespace tally {
+
+using namespace platform;
+
+namespace {
+
+constexpr std::uint32_t BeginMarker = 0xDEADF157;
+constexpr std::uint32_t EndMarker = 0xF19158ED;
+
+struct ItemHeader {
+    std::uint32_t type;
+    std::uint32_t payloadSize;
+    std::uint64_t flags;
+};
+static_assert(sizeof(ItemHeader) == 16);
+
+/// Takes the first item off `rest`; absent when it does not fit.
+std::optional<KcdataItem> takeItem(std::span<const std::byte>& rest) {
+    ItemHeader header;
+    if (rest.size() < sizeof header) {
+        return std::nullopt;
+    }
+    std::memcpy(&header, rest.data(), sizeof header);
+    const auto payload = rest.subspan(sizeof header);
+    if (payload.size() < header.payloadSize) {
+        return std::nullopt;
+    }
+    rest = payload.subspan(header.payloadSize);
+    return KcdataItem{header.type, payload.first(header.payloadSize)};
+}
+
+/// Crash information that is mapped into the tool for as long as this lives.
+class MappedCrashInformation {
+  public:
+    explicit MappedCrashInformation(mach_port_t corpse)
+        : isMapped_(task_map_corpse_info_64(corpse, &buffer_) == KERN_SUCCESS) {}
+    MappedCrashInformation(const MappedCrashInformation&) = delete;
+    MappedCrashInformation& operator=(const MappedCrashInformation&) = delete;
+    ~MappedCrashInformation() {
+        if (isMapped_) {
+            vm_deallocate(buffer_);
+        }
+    }
+
+    bool isMapped() const { return isMapped_; }
+    std::span<const std::byte> buffer() const { return buffer_; }
+
+  private:
+    std::span<const std::byte> buffer_;
+    bool isMapped_;
+};
+
+} // namespace
+
+bool enumerateKcdata(std::span<const std::byte> buffer, const KcdataItemHandler& handler) {
+    auto item = takeItem(buffer);
+    if (!item || item->type != BeginMarker) {
+        return false;
+    }
+    while (item && item->type != EndMarker) {
+        handler(*item);
+        item = takeItem(buffer);
+    }
+    return true;
+}
+
+bool enumerateCorpseKcdata(mach_port_t corpse, const KcdataItemHandler& handler) {
+    if (corpse == MACH_PORT_NULL) {
+        return false;
+    }
+    const MappedCrashInformation information(corpse);
+    return information.isMapped() && enumerateKcdata(information.buffer(), handler);
+}
+
+} // namespace tally

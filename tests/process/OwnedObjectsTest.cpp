@@ -1,0 +1,88 @@
+#include "WalkTest.h"
+
+#include <cerrno>
+#include <cstring>
+
+namespace tally {
+namespace {
+
+using namespace platform;
+
+class OwnedMemory : public WalkTest {};
+
+TEST_F(OwnedMemory, IsChargedWhereItIsMappedFirstElseUnmapped) {
+    task.owned = {{9, 0x9000, 0x5000, 0, 0x1000, 0x2000},
+                  {2, 0x2000, 0x2000, 0x800, 0x300, 0x700, false, 4, VM_PURGABLE_VOLATILE},
+                  {3, 0x3000, 0x3000, 0x10, 0x100, 0, /*noTally=*/true},
+                  {4, 0, 0x100, 0, 0x200, 0, false, 7},
+                  {5, 0, 0x7000, 0}};
+    task.map({.tag = 90, .pages = "DDC", .object = 9});
+    task.map({.tag = 90, .pages = "DDC", .object = 9, .shareMode = SM_PRIVATE});
+    task.map({.tag = 67, .pages = "DDC", .object = 2});
+    task.map({.pages = "D", .object = 5, .file = "/f"}); // a file's mapping shows no owned object
+    task.map({.tag = TLUnmappedTag, .pages = "DDDD"});   // the list says it in more detail
+    EXPECT_EQ(walkedLines(),
+              (Lines{"10000+3000 audio d4000 s2000 r1000 owned", "13000+3000 audio d2000 c1000",
+                     "16000+3000 OpenCL (graphics) d800 r300 owned", "19000+1000 mapped file /f d1000",
+                     "unmapped+3000 Owned physical tally (unmapped) r100 w3000 owned",
+                     "unmapped+0 Owned physical tally (unmapped) (VM ledger tag 7) r200 owned",
+                     "unmapped+0 Owned physical tally (unmapped) d7000 owned"}));
+    setPhysTallyCollectionEnabled(0); // no list, and nobody is charged
+    EXPECT_EQ(walkedLines().at(0), "10000+3000 audio d3000");
+}
+
+// Without a list: what is found behind purgeable mappings comes off the kernel's one figure.
+TEST_F(OwnedMemory, WithoutAListComesOffTheKernelsFigure) {
+    const std::string surplus = "p [7]: Tally changed while analyzing – unmapped owned physical tally may be "
+                                "over-counted by 4096 bytes";
+    const std::string rest = "unmapped+9000 Owned physical tally (unmapped)";
+    const std::tuple<PageCounts, PageCounts, Lines> cases[] = {
+        {{}, {2, 2, 0, 1}, {"10000+9000 audio", rest + " d2000 s1000"}},
+        {{2, 1, 0, 4},
+         {3, 3, 0, 1},
+         {"10000+9000 audio d2000 owned", rest + " d1000 s1000"}}, // clean is dirty
+        {{3, 3}, {2, 2, 0, 2}, {"10000+9000 audio d3000 owned", rest + " s1000"}},
+        {{3, 3}, {2, 2, 0, 1}, {"10000+9000 audio d3000 owned"}},
+        {{4, 4}, {2, 2, 0, 1}, {"10000+9000 audio d4000 owned", surplus}},
+    };
+    task.owned.reset();
+    task.map({.start = 0xa0000, .pages = "D"}); // the walk ends before it
+    for (const auto& [found, unmapped, expected] : cases) {
+        task.map({.start = 0x10000, .size = 0x9000, .tag = 90, .pages = found, .purgeable = 0});
+        task.map({.start = 0x80000, .size = 0x9000, .tag = TLUnmappedTag, .pages = unmapped});
+        EXPECT_EQ(walkedLines(), expected);
+        task.unmap(0x10000);
+        task.unmap(0x80000);
+    }
+    task.map({.tag = 87, .pages = "DC", .purgeable = 0});
+    task.map({.tag = 90, .pages = "DC"}); // not purgeable
+    task.map({.tag = 90, .pages = "SS", .purgeable = 0});
+    for (const std::string& line : walkedLines()) {
+        EXPECT_EQ(line.find("owned"), std::string::npos) << line;
+    }
+}
+
+TEST_F(OwnedMemory, IsListedWhileTheListGrowsAndNotWhereThereIsNone) {
+    kernel.before("sysctl_owned_vmobjects", [&] { task.owned->resize(41); }, {.nth = 2});
+    task.owned->push_back({.id = 1});
+    walk();
+    EXPECT_EQ(kernel.callCount("sysctl_owned_vmobjects"), 4u); // the size; room for 17, 33 and 49 records
+    testing::internal::CaptureStderr();
+    for (const auto& [error, nth] : {std::pair(ENOENT, 1u), {EPERM, 1u}, {EPERM, 2u}}) {
+        kernel.fail("sysctl_owned_vmobjects", error, {.nth = nth});
+        EXPECT_FALSE(gatherOwnedVmObjects(*process));
+    }
+    const std::string warning = "p [7]: vm.get_owned_vmobjects - Operation not permitted";
+    EXPECT_EQ(process->warnings(), (Lines{warning, warning}));
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), warning + "\n" + warning + "\n");
+    task.owned->clear();
+    EXPECT_TRUE(gatherOwnedVmObjects(*process)) << "an empty list is one";
+    for (const std::uint64_t count : {std::uint64_t{2}, ~std::uint64_t{0}}) { // of records that do not fit
+        task.ownedReply.emplace(sizeof count + 2 * sizeof(OwnedVmObject) - 1);
+        std::memcpy(task.ownedReply->data(), &count, sizeof count);
+        EXPECT_DEATH(gatherOwnedVmObjects(*process), "sizeof.record");
+    }
+}
+
+} // namespace
+} // namespace tally
