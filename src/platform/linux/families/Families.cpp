@@ -141,6 +141,19 @@ void leaveAddressSpace(const FamilyKey& key, MemberIdentity task) {
     }
 }
 
+std::size_t countRelatives(const FamilyKey& key) {
+    FamilyTable& table = familyTable();
+    const std::scoped_lock lock(table.mutex);
+    const auto found = table.relatives.find(key);
+    std::size_t count = 0;
+    if (found != table.relatives.end()) {
+        for (const Tenants& tenants : found->second) {
+            count += tenants.tasks.size();
+        }
+    }
+    return count;
+}
+
 std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity owner) {
     FamilyTable& table = familyTable();
     std::unique_lock lock(table.mutex);

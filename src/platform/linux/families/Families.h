@@ -21,6 +21,9 @@ MemberIdentity enterAddressSpace(const FamilyKey& key, MemberIdentity task);
 /// Takes back what enterAddressSpace entered.
 void leaveAddressSpace(const FamilyKey& key, MemberIdentity task);
 
+/// How many tasks to which there are rights descend from the exec of `key`.
+std::size_t countRelatives(const FamilyKey& key);
+
 /// The address space of the process that `owner` stands for, read together with its relatives. Absent when it
 /// has none among the tasks, when no gather is under way, or when it could not be read with them.
 std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity owner);

@@ -1,6 +1,7 @@
 #include "platform/gather.h"
 
 #include "platform/linux/families/Families.h"
+#include "platform/linux/gather/LazyFree.h"
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/images/LayoutTable.h"
 #include "platform/linux/objects/Backing.h"
@@ -14,9 +15,11 @@ GatherScope::GatherScope() {
     beginOwned();
     beginMachineState();
     beginFamilies();
+    restartLazyFreeSearch(true);
 }
 
 GatherScope::~GatherScope() {
+    restartLazyFreeSearch(false);
     endFamilies();
     endOwned();
     endMachineState();

@@ -46,6 +46,15 @@ class PortTable {
         return name == byPid_.end() ? nullptr : ports_[name->second].task;
     }
 
+    std::vector<std::shared_ptr<Task>> all() {
+        const std::scoped_lock lock(mutex_);
+        std::vector<std::shared_ptr<Task>> tasks;
+        for (const auto& [name, entry] : ports_) {
+            tasks.push_back(entry.task);
+        }
+        return tasks;
+    }
+
     kern_return_t changeReferences(mach_port_t name, int change) {
         std::shared_ptr<Task> released; // destroyed after the lock is given back
         const std::scoped_lock lock(mutex_);
@@ -99,6 +108,8 @@ const Walk* Task::walk(kern_return_t* status) {
     }
     return walk_.get();
 }
+
+std::vector<std::shared_ptr<Task>> allTasks() { return portTable().all(); }
 
 std::shared_ptr<Task> taskOfPort(mach_port_t port) { return portTable().find(port); }
 

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "platform/kern_return.h"
+#include "platform/linux/families/Families.h"
 #include "platform/linux/walk/Walk.h"
 
 #include <cstdint>
@@ -25,6 +26,8 @@ class Task {
     std::int32_t pid() const { return identity_.pid; }
     /// Whether a task with a lower pid has the very same address space, and so its page tables too.
     bool isSecondTenant() const { return owner_.pid != identity_.pid; }
+    /// Whether there is a right to another task that descends from the same exec.
+    bool hasRelatives() const { return countRelatives(key_) > 1; }
     std::uint64_t startTicks() const { return identity_.startTicks; }
 
     /// The walk that is under way; starts one when there is none.
@@ -41,6 +44,9 @@ class Task {
     std::vector<std::string> notices_;
     std::vector<std::string> given_; // notices that were given once already
 };
+
+/// Every task to which a right exists.
+std::vector<std::shared_ptr<Task>> allTasks();
 
 /// The task that `port` names; null when it names none.
 std::shared_ptr<Task> taskOfPort(mach_port_t port);

@@ -1,6 +1,7 @@
 #include "platform/linux/walk/Walk.h"
 
 #include "platform/linux/families/Families.h"
+#include "platform/linux/gather/LazyFree.h"
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/pieces/PieceBuilder.h"
@@ -17,13 +18,12 @@ namespace tally::platform {
 namespace {
 
 /// Finds out which figures that only smaps tells the process can have at all.
-WalkFacts gatherFacts(MemberIdentity owner, bool objectView, const std::string& folder) {
+WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView, const std::string& folder) {
     const ProcessStatus status = decodeStatus(readSystemFile(folder + "/status").value_or(""));
     const MachineState machine = machineState();
     WalkFacts facts{.owner = owner, .objectView = objectView, .swapInUse = machine.swapInUse};
     facts.asksLocked = status.locked != 0;
-    facts.asksLazyFree = machine.lazyFree != 0 && status.residentAnonymous != 0 &&
-                         decodeRollupLazyFree(readSystemFile(folder + "/smaps_rollup").value_or("")) != 0;
+    facts.asksLazyFree = hasLazilyFreedMemory(task.pid, folder, status.residentAnonymous);
     return facts;
 }
 
@@ -60,7 +60,7 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
         walk->statusPastEnd_ = space.status;
         space.mappings.resize(space.states.mappings.size());
     }
-    const WalkFacts facts = gatherFacts(owner, objectView, space.folder);
+    const WalkFacts facts = gatherFacts(task, owner, objectView, space.folder);
     SmapsOfProcess smaps(space.folder);
     PieceBuilder builder(facts, space, smaps);
     for (std::size_t i = 0; i < space.mappings.size(); ++i) {

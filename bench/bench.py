@@ -1,0 +1,154 @@
+#!/usr/bin/env python3
+"""Times tally against other ways to read the same memory, side by side in one run, and prints tables.
+
+  bench.py TALLY PROGRAMS [NAME ...]
+
+TALLY is the tool, PROGRAMS the folder of puppet and latency. NAMEs choose among: population big mappings scaling latency
+(all). Commands that are compared run in turn, five times each after one run that does not count; figures are medians.
+Everything that is started is ended by pid.
+"""
+import json, os, platform, resource, shutil, signal, statistics, subprocess, sys, time
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+RUNS = 5
+
+
+class Child:
+    """A program that says when it is ready; ended when the block is left."""
+
+    def __init__(self, command, ready):
+        self.process = subprocess.Popen(command, stdin=subprocess.PIPE, stdout=subprocess.PIPE, text=True)
+        self.output = ""
+        for line in self.process.stdout:
+            self.output += line
+            if line.rstrip() == ready:
+                return
+        raise SystemExit("did not get ready: %s" % command)
+
+    def __enter__(self):
+        return self
+
+    def __exit__(self, *_):
+        self.process.send_signal(signal.SIGTERM)
+        self.process.stdin.close()
+        self.process.wait()
+
+
+def run(command):
+    """Wall seconds, processor seconds and peak resident MiB of one run."""
+    before = resource.getrusage(resource.RUSAGE_CHILDREN)
+    start = time.monotonic()
+    process = subprocess.Popen(command, shell=isinstance(command, str), stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+    _, _, usage = os.wait4(process.pid, 0)
+    wall = time.monotonic() - start
+    process.returncode = 0
+    after = resource.getrusage(resource.RUSAGE_CHILDREN)
+    spent = after.ru_utime + after.ru_stime - before.ru_utime - before.ru_stime
+    return wall, spent, usage.ru_maxrss / 1024
+
+
+def compare(title, commands):
+    """Runs the commands in turn and prints a table; the last one is what the others are measured by."""
+    results = {name: [] for name, _ in commands}
+    for turn in range(RUNS + 1):
+        for name, command in commands:
+            result = run(command)
+            if turn > 0:
+                results[name].append(result)
+    medians = {name: [statistics.median(column) for column in zip(*rows)] for name, rows in results.items()}
+    base = medians[commands[-1][0]]
+    print("\n### %s\n" % title)
+    print("| command | wall | of the last | processor time | of the last | peak memory |")
+    print("|---|---|---|---|---|---|")
+    for name, _ in commands:
+        wall, spent, peak = medians[name]
+        print("| %s | %.0f ms | %.2f | %.0f ms | %.2f | %.0f MiB |" %
+              (name, wall * 1e3, wall / base[0], spent * 1e3, spent / base[1] if base[1] else 0, peak), flush=True)
+    return medians
+
+
+def others(pids="/proc/[0-9]*"):
+    found = []
+    if shutil.which("smem"):
+        found.append(("smem", ["smem", "-c", "pid pss uss"]))
+    if shutil.which("pmap"):
+        found.append(("pmap -X of every process", "for p in /proc/[0-9]*; do pmap -X ${p#/proc/}; done"))
+    return found
+
+
+SMAPS_OF_ALL = ("cat of every smaps", "cat /proc/[0-9]*/smaps")
+
+
+def population(tally, programs):
+    with Child([sys.executable, os.path.join(HERE, "population.py"), "--seconds", "560"], "}"):
+        compare("The population (370 processes)", [("tally -a", [tally, "-a"])] + others() + [SMAPS_OF_ALL])
+
+
+def big(tally, programs):
+    with Child([programs + "/puppet", "big", "2048"], "ready") as child:
+        pid = str(child.process.pid)
+        compare("One process of 2 GiB in 4 KiB pages",
+                [("tally --pid", [tally, "--pid", pid]), ("cat of smaps", ["cat", "/proc/%s/smaps" % pid])])
+
+
+MOST_MAPPINGS = "/proc/sys/vm/max_map_count"
+
+
+def mappings(tally, programs):
+    # A process may have 65,530 mappings unless the machine is told otherwise.
+    with open(MOST_MAPPINGS) as file:
+        before = file.read()
+    try:
+        with open(MOST_MAPPINGS, "w") as file:
+            file.write("200000")
+        compare_mappings(tally, programs)
+    finally:
+        with open(MOST_MAPPINGS, "w") as file:
+            file.write(before)
+
+
+def compare_mappings(tally, programs):
+    walls = {}
+    for count in (1000, 10000, 50000, 100000):
+        with Child([programs + "/puppet", "maps", str(count // 2 * 2)], "ready") as child:
+            pid = str(child.process.pid)
+            medians = compare("%d mappings" % count, [("tally --pid", [tally, "--pid", pid]),
+                                                      ("cat of smaps", ["cat", "/proc/%s/smaps" % pid])])
+            walls[count] = medians["tally --pid"][0]
+    print("\n100,000 mappings take %.2f times as long as 50,000." % (walls[100000] / walls[50000]))
+
+
+def scaling(tally, programs):
+    for count in (10, 100, 1000):
+        sleepers = [subprocess.Popen(["sleep", "300"]) for _ in range(count)]
+        try:
+            pids = [word for sleeper in sleepers for word in ("--pid", str(sleeper.pid))]
+            files = ["/proc/%d/smaps" % sleeper.pid for sleeper in sleepers]
+            compare("%d processes" % count, [("tally", [tally] + pids), ("cat of smaps", ["cat"] + files)])
+        finally:
+            for sleeper in sleepers:
+                sleeper.kill()
+                sleeper.wait()
+
+
+def latency(tally, programs):
+    print("\n### What a process of 2 GiB sees of its own mmap and munmap\n")
+    print("| measured by | median | 99th percentile | maximum |\n|---|---|---|---|")
+    for name, command in [("nobody", ["-"]), ("tally --pid", [tally, "--pid", "PID"]),
+                          ("cat of smaps", ["sh", "-c", 'cat /proc/$0/smaps', "PID"])]:
+        rows = [[int(word) for word in subprocess.run([programs + "/latency", "4"] + command, check=True, text=True,
+                                                      stdout=subprocess.PIPE).stdout.split()] for _ in range(3)]
+        print("| %s | %d us | %d us | %d us |" % ((name,) + tuple(statistics.median(column) for column in zip(*rows))),
+              flush=True)
+
+
+def main():
+    tally, programs = sys.argv[1:3]
+    print("Linux %s, %d processors, %s" % (platform.release(), os.cpu_count(), time.strftime("%Y-%m-%d")))
+    for name in sys.argv[3:] or ["population", "big", "mappings", "scaling", "latency"]:
+        {"population": population, "big": big, "mappings": mappings, "scaling": scaling, "latency": latency}[name](
+            os.path.abspath(tally), os.path.abspath(programs))
+
+
+if __name__ == "__main__":
+    main()
