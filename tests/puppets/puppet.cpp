@@ -13,10 +13,10 @@
 //                                  child's number), "drop" (the second half unmapped), "huge" (huge pages,
 //                                  the first 4 KiB of each written) or "grow" (the parent's and the
 //                                  children's mappings grow apart)
-//   puppet twins                   a second process in the same address space
-//   puppet leaderless              the first thread ends, another lives on
-//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY;
-//   "fixed" in place
+//   puppet memory PAGES            a memfd of PAGES pages, all written, of which only the first are mapped
+//   and touched puppet twins                   a second process in the same address space puppet leaderless
+//   the first thread ends, another lives on puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of
+//   that request number answered by ENOTTY; "fixed" in place
 //                                  of a number runs it without randomised addresses
 //
 // Every line of output is "name address bytes key=bytes ...", what the mapping must show; "ready" ends the
@@ -362,6 +362,16 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
     }
 }
 
+void halfTouchedMemory(std::size_t pages) {
+    const int file = makeMemfd("half", pages);
+    char* m = map(pages * page, readWrite, MAP_SHARED, file);
+    write(m, 0, pages);
+    munmap(m, pages * page);
+    m = map(pages * page, readWrite, MAP_SHARED, file);
+    touch(m, 0, pages / 2);
+    tell("half-touched", m, pages, "");
+}
+
 void twins() {
     char* m = anonymous(64);
     write(m, 0, 64);
@@ -437,6 +447,8 @@ int main(int argc, char** argv) {
         churn();
     } else if (what == "family" && argc > 4) {
         family(number(2), number(3), argv[4]);
+    } else if (what == "memory") {
+        halfTouchedMemory(number(2));
     } else if (what == "twins") {
         twins();
     } else if (what == "leaderless") {

@@ -1,0 +1,125 @@
+// The figures of all processes together against the machine's own counters.
+//
+// What other programs do meanwhile moves both, so the suite runs alone, compares what is added, and tries
+// three times.
+
+#include "linux/Puppet.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cmath>
+#include <cstdlib>
+#include <fstream>
+#include <memory>
+#include <sstream>
+
+namespace tally::test {
+namespace {
+
+/// Bytes of a row of /proc/meminfo, with the processors' own counters folded in first.
+std::int64_t meminfo(const std::string& key) {
+    std::ofstream("/proc/sys/vm/stat_refresh") << "1";
+    std::ifstream file("/proc/meminfo");
+    for (std::string word; file >> word;) {
+        std::int64_t kibibytes = 0;
+        if (word == key + ":" && file >> kibibytes) {
+            return kibibytes * 1024;
+        }
+    }
+    return -1;
+}
+
+/// Dirty bytes per category of the summary over all processes.
+std::map<std::string, std::int64_t> summary(const std::string& view) {
+    const Outcome outcome = run({TALLY_PROGRAM, "-a", "-f", "bytes", view});
+    std::istringstream lines(
+        outcome.output.substr(std::min(outcome.output.rfind("Summary Tally"), outcome.output.size())));
+    std::map<std::string, std::int64_t> rows;
+    for (std::string line; std::getline(lines, line);) {
+        // "dirty B  clean B  reclaimable B  regions    category"
+        std::istringstream figures(line);
+        std::int64_t dirty = 0;
+        std::string skipped;
+        std::string category;
+        if (figures >> dirty >> skipped && skipped == "B") {
+            for (int field = 0; field < (view == "--swapped" ? 7 : 5); ++field) {
+                figures >> skipped;
+            }
+            std::getline(figures >> std::ws, category);
+            rows[category] += dirty;
+        }
+    }
+    return rows;
+}
+
+struct Machine {
+    std::int64_t anonymous = 0;
+    std::int64_t shared = 0;
+    std::int64_t pageTables = 0;
+
+    static Machine byMeminfo() { return {meminfo("AnonPages"), meminfo("Shmem"), meminfo("PageTables")}; }
+    static Machine byTally() {
+        Machine machine;
+        for (const auto& [category, dirty] : summary("--swapped")) {
+            machine.pageTables += category == "page table" ? dirty : 0;
+            machine.anonymous += category == "TOTAL" ? dirty : 0;
+        }
+        machine.anonymous -= machine.pageTables;
+        for (const auto& [category, dirty] : summary("--vmObjectDirty")) {
+            machine.shared += category.starts_with("shared memory") ? dirty : 0;
+        }
+        return machine;
+    }
+    Machine operator-(const Machine& other) const {
+        return {anonymous - other.anonymous, shared - other.shared, pageTables - other.pageTables};
+    }
+};
+
+bool isWithin(std::int64_t measured, std::int64_t expected, double part) {
+    const double allowed = std::max(static_cast<double>(expected) * part, 1048576.0);
+    return std::abs(static_cast<double>(measured - expected)) <= allowed;
+}
+
+TEST(Machine, WhatProcessesAddIsWhatTheMachineCounts) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "all processes are measured by root only";
+    }
+    Machine expected;
+    Machine measured;
+    for (int attempt = 0; attempt < 3; ++attempt) {
+        const Machine before = Machine::byMeminfo();
+        const Machine tallyBefore = Machine::byTally();
+        // Anonymous memory: forked relatives and one alone. What of it is shared counts once in both.
+        const Puppet same({"family", "8", "16384", "same"});
+        const Puppet half({"family", "4", "16384", "half"});
+        const Puppet big({"big", "128"});
+        const Machine middle = Machine::byMeminfo();
+        const Machine tallyMiddle = Machine::byTally();
+        // Shared memory, of which one process touches a part only: the object view counts all of it.
+        const Puppet writer({"memory", "24576"});
+        const Machine after = Machine::byMeminfo();
+        const Machine tallyAfter = Machine::byTally();
+        expected = middle - before;
+        measured = tallyMiddle - tallyBefore;
+        expected.shared = (after - middle).shared;
+        measured.shared = (tallyAfter - tallyMiddle).shared;
+        if (isWithin(measured.anonymous, expected.anonymous, 0.001) &&
+            isWithin(measured.shared, expected.shared, 0.005) &&
+            isWithin(measured.pageTables, expected.pageTables, 0.03)) {
+            RecordProperty("anonymous",
+                           std::to_string(measured.anonymous) + " of " + std::to_string(expected.anonymous));
+            RecordProperty("shared",
+                           std::to_string(measured.shared) + " of " + std::to_string(expected.shared));
+            RecordProperty("page tables", std::to_string(measured.pageTables) + " of " +
+                                              std::to_string(expected.pageTables));
+            return;
+        }
+    }
+    ADD_FAILURE() << "anonymous " << measured.anonymous << " of " << expected.anonymous << ", shared "
+                  << measured.shared << " of " << expected.shared << ", page tables " << measured.pageTables
+                  << " of " << expected.pageTables;
+}
+
+} // namespace
+} // namespace tally::test
