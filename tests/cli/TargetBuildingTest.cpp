@@ -94,7 +94,7 @@ TEST_F(TargetBuilding, FollowsTheOptions) {
         {"guar\tded helper", "103", refused, ""},
         {"--pid 104", "", refusedPid, ""},
         {"--pid -5 100", "100", noPid, ""},
-        {"-t 101", "101 103", refusedPid, ""},
+        {"-t worker guar\tded", "101 102 103", refusedPid, ""},                   // names are forgotten
         {"-t server -x worker -x idle", "100 101 102 103 99000", refusedPid, ""}, // descendants come back
         {"-s idle server", "100", "", ""},
         {"-a -x worker server", "1 100 103 105", unread, ""},
