@@ -63,13 +63,17 @@ TLMemoryObject& TLTally::MemoryObjectTables::objectForRegion(const TLMemoryRegio
         table = &textMemoryObjects;
     }
     if (key == 0 || key == TLNotSet) {
-        return *uniqueMemoryObjects.emplace_back(std::make_shared<TLMemoryObject>());
+        return *uniqueMemoryObjects.emplace_back(makeObject());
     }
     std::shared_ptr<TLMemoryObject>& object = (*table)[key];
     if (!object) {
-        object = std::make_shared<TLMemoryObject>();
+        object = makeObject();
     }
     return *object;
+}
+
+std::shared_ptr<TLMemoryObject> TLTally::MemoryObjectTables::makeObject() const {
+    return std::allocate_shared<TLMemoryObject>(std::pmr::polymorphic_allocator<TLMemoryObject>(arena));
 }
 
 void TLTally::MemoryObjectTables::finalizeSizes() {
@@ -90,17 +94,21 @@ void TLTally::MemoryObjectTables::finalizeSizes() {
 }
 
 void TLTally::analyzeMemoryObjects() {
-    tables_ = MemoryObjectTables();
-    tables_.memoryObjects.reserve(100 * processes_.size());
-    tables_.textMemoryObjects.reserve(2 * processes_.size());
-    tables_.linkeditMemoryObjects.reserve(2 * processes_.size());
+    tables_.reset();
+    arena_ = std::make_unique<std::pmr::monotonic_buffer_resource>();
+    MemoryObjectTables& tables = tables_.emplace(arena_.get());
+    tables.memoryObjects.reserve(100 * processes_.size());
+    tables.textMemoryObjects.reserve(2 * processes_.size());
+    tables.linkeditMemoryObjects.reserve(2 * processes_.size());
 
     const bool asCharged = tally::physTallyCollectionEnabled();
     for (const auto& process : processes_) {
         const auto& cache = process->sharedCache();
-        ObjectTable* const cacheTable = cache ? &tables_.sharedCacheMemoryObjects[cache->uuid] : nullptr;
+        ObjectTable* const cacheTable =
+            cache ? &tables.sharedCacheMemoryObjects.try_emplace(cache->uuid, arena_.get()).first->second
+                  : nullptr;
         for (TLMemoryRegion& region : process->memoryRegions()) {
-            TLMemoryObject& object = tables_.objectForRegion(region, *process, cacheTable);
+            TLMemoryObject& object = tables.objectForRegion(region, *process, cacheTable);
             object.addRegionForProcess(region, process.get());
             if (asCharged && region.ownedExclusivelyByParentProcess) {
                 object.ownerPid = process->pid();
@@ -108,7 +116,7 @@ void TLTally::analyzeMemoryObjects() {
             region.memoryObject = &object;
         }
     }
-    tables_.finalizeSizes();
+    tables.finalizeSizes();
 
     pidToTally_.clear();
     for (const auto& process : displayedProcesses()) {

@@ -1,13 +1,16 @@
-// Process grouping: every object collects the processes that map it; objects with equal sets of them then
-// find one group through a hash table of sets.
+// Process grouping: every object finds the set of processes that map it.
 //
-// Cost: a table look-up per region, and a comparison of members per object.
+// The idea: processes come in one order, so a set is the set it grew from and the process that joined it
+// last. Sets that grow from one set by one process are one, so equal sets are found without comparing
+// members. Cost: a step per region, and a look-up per set and process. One thread.
 
 #include "analysis/ProcessGrouping.h"
 
 #include "base/BatchEnumeration.h"
 
+#include <algorithm>
 #include <cstddef>
+#include <unordered_map>
 #include <unordered_set>
 #include <utility>
 
@@ -17,9 +20,16 @@ namespace {
 
 using PidSet = std::unordered_set<std::int32_t>;
 
-struct ObjectMembers {
+/// A set of processes: the one it grew from, and who joined it last.
+struct GrownSet {
+    std::size_t from = 0;
+    const std::shared_ptr<TLProcess>* joined = nullptr; // null for the empty set
+    std::shared_ptr<TLProcessGroup> group; // made when an object turns out to have exactly this set
+};
+
+struct GroupedObject {
     TLMemoryObject* object = nullptr; // owned by the tables
-    TLProcessGroupMinimal members;
+    std::size_t set = 0;
 };
 
 bool isUnmappedMemoryOfDisplayed(const TLMemoryObject& object, const PidSet& displayedPids) {
@@ -27,57 +37,62 @@ bool isUnmappedMemoryOfDisplayed(const TLMemoryObject& object, const PidSet& dis
            object.hasUnmappedOwnedRegion();
 }
 
-/// Every object that counts with the processes that map it, in the order in which objects are first met.
-std::vector<ObjectMembers> membersByObject(std::span<const std::shared_ptr<TLProcess>> processes,
-                                           const PidSet& displayedPids) {
-    std::vector<ObjectMembers> objects;
-    std::unordered_map<const TLMemoryObject*, std::size_t> indexByObject;
-    for (const auto& process : processes) {
+/// All sets of processes, and the objects in the order in which they are first met.
+struct Grouping {
+    std::vector<GrownSet> sets{GrownSet()}; // the empty one first
+    std::vector<GroupedObject> objects;
+
+    /// Adds `process` to the sets of the objects it maps. `displayedPids`: whose memory counts.
+    void add(const std::shared_ptr<TLProcess>& process, const PidSet& displayedPids) {
+        std::unordered_map<std::size_t, std::size_t> grown; // set without the process to set with it
         const auto addBatch = [&](std::span<const TLMemoryRegion> batch) {
             for (const TLMemoryRegion& region : batch) {
                 TLMemoryObject* const object = region.memoryObject;
                 if (process->hiddenFromDisplay() && !isUnmappedMemoryOfDisplayed(*object, displayedPids)) {
                     continue;
                 }
-                const auto [known, isNew] = indexByObject.try_emplace(object, objects.size());
-                if (isNew) {
-                    objects.push_back({object, {}});
+                if (object->reportIndex == TLMemoryObject::notInReport) {
+                    object->reportIndex = objects.size();
+                    objects.push_back({object, 0});
                 }
-                objects[known->second].members.addProcess(process);
+                std::size_t& set = objects[object->reportIndex].set;
+                if (sets[set].joined == nullptr || (*sets[set].joined)->pid() != process->pid()) {
+                    const auto [known, isNew] = grown.try_emplace(set, sets.size());
+                    if (isNew) {
+                        sets.push_back({set, &process, nullptr});
+                    }
+                    set = known->second;
+                }
             }
         };
         tl_enumerateObjectsWithBatchSize(std::span(std::as_const(*process).memoryRegions()), 256, addBatch);
     }
-    return objects;
-}
 
-struct GroupHash {
-    std::size_t operator()(const TLProcessGroupMinimal* group) const { return group->hash(); }
-};
-
-struct GroupEqual {
-    bool operator()(const TLProcessGroupMinimal* a, const TLProcessGroupMinimal* b) const {
-        return a->isEqual(*b);
-    }
-};
-
-/// One group per distinct set of members, each with its objects.
-ProcessGroups::GroupList makeGroups(std::vector<ObjectMembers> objects, std::size_t displayedCount) {
-    ProcessGroups::GroupList groups;
-    std::unordered_map<const TLProcessGroupMinimal*, TLProcessGroup*, GroupHash, GroupEqual> known;
-    known.reserve(6 * displayedCount);
-    for (ObjectMembers& entry : objects) {
-        const auto twin = known.find(&entry.members);
-        TLProcessGroup* group = twin == known.end() ? nullptr : twin->second;
-        if (group == nullptr) {
-            groups.push_back(TLProcessGroup::makeImmutableGroup(std::move(entry.members)));
-            group = groups.back().get();
-            known.emplace(group, group);
+    TLProcessGroupMinimal members(std::size_t set) const {
+        std::vector<const std::shared_ptr<TLProcess>*> latestFirst;
+        for (; sets[set].joined != nullptr; set = sets[set].from) {
+            latestFirst.push_back(sets[set].joined);
         }
-        group->addObject(entry.object->shared_from_this());
+        TLProcessGroupMinimal minimal;
+        for (auto process = latestFirst.rbegin(); process != latestFirst.rend(); ++process) {
+            minimal.addProcess(**process);
+        }
+        return minimal;
     }
-    return groups;
-}
+
+    /// One group per set that is exactly an object's, each with its objects.
+    ProcessGroups::GroupList makeGroups() {
+        ProcessGroups::GroupList groups;
+        for (const GroupedObject& entry : objects) {
+            std::shared_ptr<TLProcessGroup>& group = sets[entry.set].group;
+            if (!group) {
+                group = groups.emplace_back(TLProcessGroup::makeImmutableGroup(members(entry.set)));
+            }
+            group->addObject(entry.object->shared_from_this());
+        }
+        return groups;
+    }
+};
 
 } // namespace
 
@@ -94,8 +109,16 @@ ProcessGroups groupProcesses(std::span<const std::shared_ptr<TLProcess>> process
             displayedPids.insert(process->pid());
         }
     }
+    // Members are told by their pid alone: those of one pid, a process and a snapshot of it, come one after
+    // the other.
+    std::vector<std::shared_ptr<TLProcess>> byPid(processes.begin(), processes.end());
+    std::ranges::stable_sort(byPid, {}, [](const auto& process) { return process->pid(); });
+    Grouping grouping;
+    for (const auto& process : byPid) {
+        grouping.add(process, displayedPids);
+    }
     ProcessGroups result;
-    for (const auto& group : makeGroups(membersByObject(processes, displayedPids), displayedPids.size())) {
+    for (const auto& group : grouping.makeGroups()) {
         const bool isPrivate = group->processes().size() == 1;
         for (const auto& process : group->processes()) {
             auto& groups = result.groupsByPid[process->pid()];

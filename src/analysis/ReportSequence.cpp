@@ -7,7 +7,6 @@
 #include "analysis/TLTally.h"
 
 #include <algorithm>
-#include <unordered_set>
 
 namespace tally {
 
@@ -82,11 +81,11 @@ void printCategories(const Formatters& formatters, const ProcessGroups& groups, 
 /// Every object of the displayed processes, whole and once.
 TLCategoryDictionary summaryCategories(const TLTally::ProcessList& displayedProcesses, bool summarize) {
     TLCategoryDictionary categories;
-    std::unordered_set<const TLMemoryObject*> counted;
     for (const auto& process : displayedProcesses) {
         for (const TLMemoryRegion& region : process->memoryRegions()) {
-            const TLMemoryObject* const object = region.memoryObject;
-            if (counted.insert(object).second) {
+            TLMemoryObject* const object = region.memoryObject;
+            if (object->reportIndex != TLMemoryObject::notInReport) {
+                object->reportIndex = TLMemoryObject::notInReport; // from here on: counted
                 categories.try_emplace(categoryKey(*object, summarize), TLMemoryCategory(summarize))
                     .first->second.addMemoryObject(object->shared_from_this());
             }
@@ -111,7 +110,7 @@ void TLTally::printReport(bool regionlistLikeOutput, bool summarize) {
     }
 
     const ProcessGroups groups = groupProcesses(processes_);
-    tables_ = MemoryObjectTables();
+    tables_.reset();
 
     Findings findings;
     for (const auto& process : sorted) {

@@ -18,7 +18,9 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <memory_resource>
 #include <optional>
+#include <unordered_map>
 #include <vector>
 
 namespace tally {
@@ -26,7 +28,8 @@ namespace tally {
 class TLTally {
   public:
     using ProcessList = std::vector<std::shared_ptr<TLProcess>>;
-    using ObjectTable = IntegerTable<std::shared_ptr<TLMemoryObject>>;
+    using ObjectTable =
+        std::pmr::unordered_map<std::uint64_t, std::shared_ptr<TLMemoryObject>, IntegerKeyHash>;
 
     explicit TLTally(ProcessList processes) : processes_(std::move(processes)) {}
     TLTally(const TLTally&) = delete;
@@ -70,15 +73,19 @@ class TLTally {
 
   private:
     struct MemoryObjectTables {
-        ObjectTable memoryObjects;
+        std::pmr::memory_resource* arena;
+        ObjectTable memoryObjects{arena};
         std::map<platform::uuid_t, ObjectTable> sharedCacheMemoryObjects;
-        ObjectTable textMemoryObjects;
-        ObjectTable linkeditMemoryObjects;
+        ObjectTable textMemoryObjects{arena};
+        ObjectTable linkeditMemoryObjects{arena};
         std::vector<std::shared_ptr<TLMemoryObject>> uniqueMemoryObjects; // no two regions share one of them
+
+        explicit MemoryObjectTables(std::pmr::memory_resource* resource) : arena(resource) {}
 
         /// The object that `region` shows, made when it is the first to show it.
         TLMemoryObject& objectForRegion(const TLMemoryRegion& region, const TLProcess& process,
                                         ObjectTable* sharedCacheTable);
+        std::shared_ptr<TLMemoryObject> makeObject() const;
         void finalizeSizes();
     };
 
@@ -87,7 +94,10 @@ class TLTally {
 
     ProcessList processes_;                            // never changes
     std::map<std::int32_t, std::uint64_t> pidToTally_; // bytes, of the displayed processes
-    MemoryObjectTables tables_;
+    // Objects and tables are made by the ten thousand and go together: they come from here, and outlive
+    // nothing of it.
+    std::unique_ptr<std::pmr::monotonic_buffer_resource> arena_;
+    std::optional<MemoryObjectTables> tables_; // from the analysis to the grouping
     std::vector<std::shared_ptr<TLOutputFormatter>> outputFormatters_;
     std::optional<TLTime> gatherStartTime_;
     std::optional<TLTime> gatherEndTime_;

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <functional>
+#include <utility>
 
 namespace tally {
 
@@ -62,8 +63,16 @@ void TLMemoryObject::addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t
     if (process != nullptr && (!processMemoryRegions_.empty() || region.isSharedMapping())) {
         makeRegionsOf(process->pid()).push_back(&region);
     }
+    if (!rangeList_ && onlyRange_ == nullptr && !region.subrangeList) {
+        onlyRange_ = &region;
+        onlyRangePageSize_ = pageSize;
+        return;
+    }
     if (!rangeList_) {
         rangeList_.emplace();
+    }
+    if (onlyRange_ != nullptr) {
+        rangeList_->addRegionRange(*std::exchange(onlyRange_, nullptr), onlyRangePageSize_);
     }
     rangeList_->addRegionRange(region, pageSize);
     region.subrangeList.reset();
@@ -71,7 +80,10 @@ void TLMemoryObject::addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t
 
 void TLMemoryObject::finalizeSizes(bool breakDown) {
     tl_assert(!accurateSizes_, "!self.accurateSizes");
-    const TLRangeSizes united = rangeList_ ? rangeList_->sumSizes() : TLRangeSizes();
+    const TLRangeSizes united = rangeList_              ? rangeList_->sumSizes()
+                                : onlyRange_ != nullptr ? sizesOf(*onlyRange_)
+                                                        : TLRangeSizes();
+    onlyRange_ = nullptr;
     if (breakDown) {
         const Charges charged = sumOfCharges(memoryRegions_);
         totalDirtySize = charged.dirty;

@@ -75,6 +75,11 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     std::int32_t ownerPid = -1; // -1: none
     std::uint64_t totalWiredSize = 0;
 
+    /// The object's place in a list that the report under way makes of its objects: a region leads to it
+    /// without a look-up. Only the report uses it.
+    static constexpr std::size_t notInReport = ~std::size_t{0};
+    std::size_t reportIndex = notInReport;
+
     bool accurateSizes() const { return accurateSizes_; }
     const RegionList& memoryRegions() const {
         return original_ == nullptr ? memoryRegions_ : original_->memoryRegions();
@@ -95,6 +100,9 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     std::shared_ptr<const TLMemoryObject> original_; // of a copy: the object whose regions it has
     std::vector<ProcessRegionList> processMemoryRegions_;
     std::optional<TLRangeList> rangeList_; // dropped when sizes are final
+    // Most objects are mapped once, as a whole: their one range is its region's, and no list is made of it.
+    const TLMemoryRegion* onlyRange_ = nullptr;
+    std::uint64_t onlyRangePageSize_ = 0;
 };
 
 } // namespace tally

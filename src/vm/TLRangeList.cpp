@@ -34,6 +34,14 @@ TLRangeSizes mergedSizes(const TLRangeSizes& a, const TLRangeSizes& b, std::uint
 
 } // namespace
 
+TLRangeSizes sizesOf(const TLMemoryRegion& region) {
+    return {.dirty = region.dirtySize,
+            .swapped = region.swappedSize,
+            .clean = region.cleanNonSpecSize,
+            .reclaimable = region.reclaimableSize,
+            .wired = region.wired ? region.size : 0};
+}
+
 TLRangeList::~TLRangeList() {
     while (head_) { // one by one: a chain of nodes that free each other would use up the stack
         head_ = std::move(head_->next);
@@ -107,12 +115,7 @@ void TLRangeList::addRegionRange(const TLMemoryRegion& region, std::uint64_t pag
         mergeRangeList(*region.subrangeList, pageSize);
         return;
     }
-    addSubrange(region.offset, region.size, pageSize,
-                {.dirty = region.dirtySize,
-                 .swapped = region.swappedSize,
-                 .clean = region.cleanNonSpecSize,
-                 .reclaimable = region.reclaimableSize,
-                 .wired = region.wired ? region.size : 0});
+    addSubrange(region.offset, region.size, pageSize, sizesOf(region));
 }
 
 void TLRangeList::mergeRangeList(const TLRangeList& other, std::uint64_t pageSize) {

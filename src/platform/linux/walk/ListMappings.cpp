@@ -44,7 +44,7 @@ constexpr std::uint64_t QueryCoveringOrNext = 0x10;
 
 // A query costs more than a line of text once names are rare: in address spaces of this many mappings, which
 // are mostly anonymous, the text is read instead.
-constexpr std::size_t mostQueries = 10'000;
+constexpr std::size_t mostQueries = 2'000;
 
 enum class QueryResult { listed, unavailable, tooMany, failed };
 
