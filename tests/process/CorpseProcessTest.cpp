@@ -64,6 +64,11 @@ TEST_F(Corpse, IsMadeOfItsCrashInformation) {
     EXPECT_EQ(corpse->displayString(), "foo [123] (corpse)");
     EXPECT_TRUE(corpse->is64bit() && corpse->isTranslated());
     EXPECT_EQ(corpse->idleExitStatus(), TLIdleExitStatus::clean);
+    setPhysTallyCollectionEnabled(0);
+    const auto seenAsObjects = corpseWith(wholeCrash);
+    seenAsObjects->gatherData();
+    EXPECT_EQ(seenAsObjects->memoryRegions().size(), 1u) << "page tables are a charge";
+    setPhysTallyCollectionEnabled(1);
     task.exit(); // it no longer matters
     corpse->gatherData();
     ASSERT_EQ(corpse->memoryRegions().size(), 2u);
