@@ -1,9 +1,10 @@
-// What a process with 2 GiB of memory in 4 KiB pages sees of being measured: the latency of its own mmap and munmap.
+// What a process with 2 GiB of memory in 4 KiB pages sees of being measured: the latency of its own mmap and
+// munmap.
 //
 //   latency SECONDS COMMAND [ARGUMENT ...]   "PID" among the arguments stands for the process
 //
-// Prints the median, the 99th percentile and the maximum in microseconds, while COMMAND runs again and again; with "-" as
-// COMMAND, of the undisturbed process.
+// Prints the median, the 99th percentile and the maximum in microseconds, while COMMAND runs again and again;
+// with "-" as COMMAND, of the undisturbed process.
 
 #include <sys/mman.h>
 #include <sys/wait.h>

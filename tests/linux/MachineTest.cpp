@@ -11,7 +11,6 @@
 #include <cmath>
 #include <cstdlib>
 #include <fstream>
-#include <memory>
 #include <sstream>
 
 namespace tally::test {
@@ -81,15 +80,18 @@ bool isWithin(std::int64_t measured, std::int64_t expected, double part) {
     return std::abs(static_cast<double>(measured - expected)) <= allowed;
 }
 
-TEST(Machine, WhatProcessesAddIsWhatTheMachineCounts) {
-    if (geteuid() != 0) {
-        GTEST_SKIP() << "all processes are measured by root only";
-    }
+/// What puppets added, by the machine's counters and by the tool.
+struct Attempt {
     Machine expected;
     Machine measured;
-    for (int attempt = 0; attempt < 3; ++attempt) {
-        const Machine before = Machine::byMeminfo();
-        const Machine tallyBefore = Machine::byTally();
+    bool wasQuiet = false; // everything was as before once the puppets had ended
+};
+
+Attempt addPuppets() {
+    Attempt attempt;
+    const Machine before = Machine::byMeminfo();
+    const Machine tallyBefore = Machine::byTally();
+    {
         // Anonymous memory: forked relatives and one alone. What of it is shared counts once in both.
         const Puppet same({"family", "8", "16384", "same"});
         const Puppet half({"family", "4", "16384", "half"});
@@ -98,27 +100,39 @@ TEST(Machine, WhatProcessesAddIsWhatTheMachineCounts) {
         const Machine tallyMiddle = Machine::byTally();
         // Shared memory, of which one process touches a part only: the object view counts all of it.
         const Puppet writer({"memory", "24576"});
-        const Machine after = Machine::byMeminfo();
-        const Machine tallyAfter = Machine::byTally();
-        expected = middle - before;
-        measured = tallyMiddle - tallyBefore;
-        expected.shared = (after - middle).shared;
-        measured.shared = (tallyAfter - tallyMiddle).shared;
-        if (isWithin(measured.anonymous, expected.anonymous, 0.001) &&
-            isWithin(measured.shared, expected.shared, 0.005) &&
-            isWithin(measured.pageTables, expected.pageTables, 0.03)) {
-            RecordProperty("anonymous",
-                           std::to_string(measured.anonymous) + " of " + std::to_string(expected.anonymous));
-            RecordProperty("shared",
-                           std::to_string(measured.shared) + " of " + std::to_string(expected.shared));
-            RecordProperty("page tables", std::to_string(measured.pageTables) + " of " +
-                                              std::to_string(expected.pageTables));
+        attempt.expected = middle - before;
+        attempt.measured = tallyMiddle - tallyBefore;
+        attempt.expected.shared = (Machine::byMeminfo() - middle).shared;
+        attempt.measured.shared = (Machine::byTally() - tallyMiddle).shared;
+    }
+    constexpr std::int64_t quiet = 512 << 10;
+    const Machine left = Machine::byMeminfo() - before;
+    const Machine tallyLeft = Machine::byTally() - tallyBefore;
+    attempt.wasQuiet = true;
+    for (const std::int64_t difference : {left.anonymous, left.shared, left.pageTables, tallyLeft.anonymous,
+                                          tallyLeft.shared, tallyLeft.pageTables}) {
+        attempt.wasQuiet = attempt.wasQuiet && std::abs(difference) <= quiet;
+    }
+    return attempt;
+}
+
+TEST(Machine, WhatProcessesAddIsWhatTheMachineCounts) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "all processes are measured by root only";
+    }
+    for (int left = 6; left > 0; --left) {
+        const auto [expected, measured, wasQuiet] = addPuppets();
+        const bool agrees = isWithin(measured.anonymous, expected.anonymous, 0.001) &&
+                            isWithin(measured.shared, expected.shared, 0.005) &&
+                            isWithin(measured.pageTables, expected.pageTables, 0.03);
+        if (agrees || wasQuiet) {
+            EXPECT_TRUE(agrees) << "anonymous " << measured.anonymous << " of " << expected.anonymous
+                                << ", shared " << measured.shared << " of " << expected.shared
+                                << ", page tables " << measured.pageTables << " of " << expected.pageTables;
             return;
         }
     }
-    ADD_FAILURE() << "anonymous " << measured.anonymous << " of " << expected.anonymous << ", shared "
-                  << measured.shared << " of " << expected.shared << ", page tables " << measured.pageTables
-                  << " of " << expected.pageTables;
+    GTEST_SKIP() << "other programs change the machine's memory too much to compare";
 }
 
 } // namespace
