@@ -140,6 +140,7 @@ TEST_F(TargetBuilding, FilesAreSnapshotsFirstAndThenNames) {
     const Built one = build("worker server 100");
     const Built none = build("server notes\033");
     std::filesystem::current_path(before);
+    std::filesystem::remove_all("shadows");
     EXPECT_EQ(one.targets, "100 101");
     EXPECT_EQ(one.messages,
               "NOTICE: 'worker' is also a file here, so only process 101 of the 2 that match is "
