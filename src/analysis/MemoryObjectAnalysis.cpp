@@ -73,7 +73,7 @@ TLMemoryObject& TLTally::MemoryObjectTables::objectForRegion(const TLMemoryRegio
 }
 
 std::shared_ptr<TLMemoryObject> TLTally::MemoryObjectTables::makeObject() const {
-    return std::allocate_shared<TLMemoryObject>(std::pmr::polymorphic_allocator<TLMemoryObject>(arena));
+    return std::allocate_shared<TLMemoryObject>(std::pmr::polymorphic_allocator<TLMemoryObject>(objects));
 }
 
 void TLTally::MemoryObjectTables::finalizeSizes() {
@@ -105,8 +105,9 @@ void TLTally::analyzeMemoryObjects() {
     for (const auto& process : processes_) {
         const auto& cache = process->sharedCache();
         ObjectTable* const cacheTable =
-            cache ? &tables.sharedCacheMemoryObjects.try_emplace(cache->uuid, arena_.get()).first->second
-                  : nullptr;
+            cache
+                ? &tables.sharedCacheMemoryObjects.try_emplace(cache->uuid, tables.nodes.get()).first->second
+                : nullptr;
         for (TLMemoryRegion& region : process->memoryRegions()) {
             TLMemoryObject& object = tables.objectForRegion(region, *process, cacheTable);
             object.addRegionForProcess(region, process.get());

@@ -41,10 +41,15 @@ bool isUnmappedMemoryOfDisplayed(const TLMemoryObject& object, const PidSet& dis
 struct Grouping {
     std::vector<GrownSet> sets{GrownSet()}; // the empty one first
     std::vector<GroupedObject> objects;
+    std::shared_ptr<TLProcess> lastAdded;
+    std::unordered_map<std::size_t, std::size_t> grown; // set without the process added last to set with it
 
     /// Adds `process` to the sets of the objects it maps. `displayedPids`: whose memory counts.
     void add(const std::shared_ptr<TLProcess>& process, const PidSet& displayedPids) {
-        std::unordered_map<std::size_t, std::size_t> grown; // set without the process to set with it
+        if (!lastAdded || lastAdded->pid() != process->pid()) {
+            grown.clear();
+        }
+        lastAdded = process;
         const auto addBatch = [&](std::span<const TLMemoryRegion> batch) {
             for (const TLMemoryRegion& region : batch) {
                 TLMemoryObject* const object = region.memoryObject;

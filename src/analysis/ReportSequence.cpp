@@ -5,6 +5,7 @@
 
 #include "analysis/ProcessGrouping.h"
 #include "analysis/TLTally.h"
+#include "base/Assertion.h"
 
 #include <algorithm>
 
@@ -81,11 +82,16 @@ void printCategories(const Formatters& formatters, const ProcessGroups& groups, 
 /// Every object of the displayed processes, whole and once.
 TLCategoryDictionary summaryCategories(const TLTally::ProcessList& displayedProcesses, bool summarize) {
     TLCategoryDictionary categories;
+    std::vector<bool> counted; // by the number that the grouping gave the object
     for (const auto& process : displayedProcesses) {
         for (const TLMemoryRegion& region : process->memoryRegions()) {
             TLMemoryObject* const object = region.memoryObject;
-            if (object->reportIndex != TLMemoryObject::notInReport) {
-                object->reportIndex = TLMemoryObject::notInReport; // from here on: counted
+            tl_assert(object->reportIndex != TLMemoryObject::notInReport, "object->reportIndex");
+            if (object->reportIndex >= counted.size()) {
+                counted.resize(object->reportIndex + 1);
+            }
+            if (!counted[object->reportIndex]) {
+                counted[object->reportIndex] = true;
                 categories.try_emplace(categoryKey(*object, summarize), TLMemoryCategory(summarize))
                     .first->second.addMemoryObject(object->shared_from_this());
             }

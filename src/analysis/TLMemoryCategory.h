@@ -21,6 +21,7 @@ class TLMemoryCategory {
     void addMemoryObject(std::shared_ptr<const TLMemoryObject> object);
 
     bool isSummary() const { return isSummary_; }
+    /// Lives no longer than the measurement it comes from.
     const std::shared_ptr<const TLMemoryObject>& firstMemoryObject() const { return firstMemoryObject_; }
     Name name() const;
     Name detailedName() const; // absent for a summary category
@@ -39,7 +40,7 @@ class TLMemoryCategory {
     std::shared_ptr<const TLMemoryObject> firstMemoryObject_;
 };
 
-/// Category key to category. The order of keys means nothing to a reader; it keeps reports stable.
+/// Category key to category. In ascending order of keys, which sorts rows that are otherwise equal.
 using TLCategoryDictionary = std::map<std::string, TLMemoryCategory, std::less<>>;
 
 /// Sums over a category dictionary; bytes.

@@ -73,14 +73,17 @@ class TLTally {
 
   private:
     struct MemoryObjectTables {
-        std::pmr::memory_resource* arena;
-        ObjectTable memoryObjects{arena};
+        using Arena = std::pmr::monotonic_buffer_resource;
+
+        std::unique_ptr<Arena> nodes = std::make_unique<Arena>(); // of the tables: goes when they go
+        std::pmr::memory_resource* objects;                       // outlives the tables
+        ObjectTable memoryObjects{nodes.get()};
         std::map<platform::uuid_t, ObjectTable> sharedCacheMemoryObjects;
-        ObjectTable textMemoryObjects{arena};
-        ObjectTable linkeditMemoryObjects{arena};
+        ObjectTable textMemoryObjects{nodes.get()};
+        ObjectTable linkeditMemoryObjects{nodes.get()};
         std::vector<std::shared_ptr<TLMemoryObject>> uniqueMemoryObjects; // no two regions share one of them
 
-        explicit MemoryObjectTables(std::pmr::memory_resource* resource) : arena(resource) {}
+        explicit MemoryObjectTables(std::pmr::memory_resource* resource) : objects(resource) {}
 
         /// The object that `region` shows, made when it is the first to show it.
         TLMemoryObject& objectForRegion(const TLMemoryRegion& region, const TLProcess& process,
@@ -94,8 +97,7 @@ class TLTally {
 
     ProcessList processes_;                            // never changes
     std::map<std::int32_t, std::uint64_t> pidToTally_; // bytes, of the displayed processes
-    // Objects and tables are made by the ten thousand and go together: they come from here, and outlive
-    // nothing of it.
+    // Objects are made by the ten thousand and go together: they live here, and none may outlive its tally.
     std::unique_ptr<std::pmr::monotonic_buffer_resource> arena_;
     std::optional<MemoryObjectTables> tables_; // from the analysis to the grouping
     std::vector<std::shared_ptr<TLOutputFormatter>> outputFormatters_;

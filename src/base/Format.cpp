@@ -36,7 +36,11 @@ std::size_t sequenceLength(std::string_view text) {
             return 0;
         }
     }
-    return length;
+    // A longer sequence than a character needs is none: it could hide a control character.
+    const auto second = static_cast<unsigned char>(length > 1 ? text[1] : 0);
+    const bool isOverlong =
+        lead == 0xc0 || lead == 0xc1 || (lead == 0xe0 && second < 0xa0) || (lead == 0xf0 && second < 0x90);
+    return isOverlong || lead > 0xf4 ? 0 : length;
 }
 
 bool isControl(std::string_view sequence) {
@@ -44,7 +48,12 @@ bool isControl(std::string_view sequence) {
     if (sequence.size() == 1) {
         return first < 0x20 || first == 0x7f || (first >= 0x80 && first <= 0x9f);
     }
-    return sequence.size() == 2 && first == 0xc2 && static_cast<unsigned char>(sequence[1]) <= 0x9f;
+    if (sequence.size() == 2) {
+        return first == 0xc2 && static_cast<unsigned char>(sequence[1]) <= 0x9f;
+    }
+    // U+202A to U+202E and U+2066 to U+2069 turn the direction of what follows.
+    return (sequence >= "\xe2\x80\xaa" && sequence <= "\xe2\x80\xae") ||
+           (sequence >= "\xe2\x81\xa6" && sequence <= "\xe2\x81\xa9");
 }
 
 } // namespace

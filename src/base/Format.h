@@ -11,8 +11,8 @@ namespace tally {
 [[gnu::format(printf, 1, 2)]] std::string formatted(const char* format, ...);
 
 /// `text` with every control character replaced by "?": bytes below 0x20, 0x7f, and the C1 controls
-/// (U+0080 to U+009F, written in UTF-8 or as a lone byte). A name comes from another process and must not
-/// be able to drive the terminal that shows it.
+/// (U+0080 to U+009F, written in UTF-8 or as a lone byte), and marks that turn the direction of text. A name
+/// comes from another process and must not be able to drive the terminal that shows it.
 std::string printable(std::string_view text);
 
 /// Writes `printable(message)` and a newline to standard error.

@@ -105,7 +105,7 @@ std::uint64_t PieceCutter::imagePieceEnd(const TLImage& image) {
     const TLImage* const next = images_.nextImageOverlapping(end, mapping_.end());
     const bool startsAreAligned =
         isMultipleOf(alignment, at_) && isMultipleOf(alignment, next == nullptr ? 0 : next->start);
-    return next != &image && startsAreAligned ? roundUpToPage(end, alignment) : end;
+    return next != &image && startsAreAligned ? std::max(end, roundUpToPage(end, alignment)) : end;
 }
 
 bool PieceCutter::append(TLMemoryRegion piece, bool withPageQueries) {
