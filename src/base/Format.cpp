@@ -1,6 +1,7 @@
 #include "base/Format.h"
 
 #include <cstdarg>
+#include <cstdint>
 #include <cstdio>
 
 namespace tally {
@@ -18,30 +19,33 @@ std::string formatted(const char* format, ...) {
     return text;
 }
 
-namespace {
-
-/// Length of the UTF-8 sequence at the start of `text`; 0 when there is none.
-std::size_t sequenceLength(std::string_view text) {
+std::size_t utf8SequenceLength(std::string_view text) {
     const auto lead = static_cast<unsigned char>(text[0]);
-    const std::size_t length = lead < 0x80             ? 1
-                               : (lead & 0xe0) == 0xc0 ? 2
+    if (lead < 0x80) {
+        return 1;
+    }
+    const std::size_t length = (lead & 0xe0) == 0xc0   ? 2
                                : (lead & 0xf0) == 0xe0 ? 3
                                : (lead & 0xf8) == 0xf0 ? 4
                                                        : 0;
     if (length == 0 || length > text.size()) {
         return 0;
     }
+    std::uint32_t character = lead & (0x7fU >> length);
     for (std::size_t i = 1; i < length; ++i) {
-        if ((static_cast<unsigned char>(text[i]) & 0xc0) != 0x80) {
+        const auto byte = static_cast<unsigned char>(text[i]);
+        if ((byte & 0xc0) != 0x80) {
             return 0;
         }
+        character = character << 6 | (byte & 0x3f);
     }
     // A longer sequence than a character needs is none: it could hide a control character.
-    const auto second = static_cast<unsigned char>(length > 1 ? text[1] : 0);
-    const bool isOverlong =
-        lead == 0xc0 || lead == 0xc1 || (lead == 0xe0 && second < 0xa0) || (lead == 0xf0 && second < 0x90);
-    return isOverlong || lead > 0xf4 ? 0 : length;
+    constexpr std::uint32_t leastOfLength[] = {0, 0, 0x80, 0x800, 0x10000};
+    const bool isSurrogate = character >= 0xd800 && character <= 0xdfff;
+    return character < leastOfLength[length] || isSurrogate || character > 0x10ffff ? 0 : length;
 }
+
+namespace {
 
 bool isControl(std::string_view sequence) {
     const auto first = static_cast<unsigned char>(sequence[0]);
@@ -62,7 +66,7 @@ std::string printable(std::string_view text) {
     std::string safe;
     safe.reserve(text.size());
     while (!text.empty()) {
-        const std::size_t length = sequenceLength(text);
+        const std::size_t length = utf8SequenceLength(text);
         const std::string_view sequence = text.substr(0, length == 0 ? 1 : length);
         if (isControl(sequence)) {
             safe += '?';

@@ -2,6 +2,7 @@
 
 #pragma once
 
+#include <cstddef>
 #include <string>
 #include <string_view>
 
@@ -9,6 +10,10 @@ namespace tally {
 
 /// The formatted text as a string.
 [[gnu::format(printf, 1, 2)]] std::string formatted(const char* format, ...);
+
+/// Length of the UTF-8 character at the start of `text`, which is not empty; 0 when there is none. Overlong
+/// forms, surrogates and what lies beyond U+10FFFF are none.
+std::size_t utf8SequenceLength(std::string_view text);
 
 /// `text` with every control character replaced by "?": bytes below 0x20, 0x7f, and the C1 controls
 /// (U+0080 to U+009F, written in UTF-8 or as a lone byte), and marks that turn the direction of text. A name
