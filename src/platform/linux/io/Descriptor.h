@@ -27,6 +27,8 @@ class Descriptor {
 
     bool isOpen() const { return number_ >= 0; }
     int number() const { return number_; }
+    /// Hands the descriptor over: it is the caller's to close.
+    int release() { return std::exchange(number_, -1); }
 
   private:
     int number_ = -1;
