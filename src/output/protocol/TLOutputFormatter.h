@@ -7,7 +7,8 @@
 //   printProcessAuxData; then printProcessesWithWarnings, printSummaryCategories, printGlobalAuxData,
 //   endAtTime.
 // configureForMultipleOutputs comes once before the first report of a sampling run, close once after the
-// last. All calls come from one thread at a time. Arguments are valid during the call only.
+// last, discard instead of both. All calls come from one thread at a time. Arguments are valid during the
+// call only.
 
 #pragma once
 
@@ -65,7 +66,10 @@ class TLOutputFormatter {
     virtual void startAtTime(const std::optional<TLTime>& /*time*/) {}
     virtual bool supportsMultipleOutputs() const { return false; }
     virtual void configureForMultipleOutputs() {}
-    virtual void close() {}
+    /// No report follows: finishes the output. @return 0, or the errno for which something is missing in it.
+    virtual int close() { return 0; }
+    /// The run has failed before its first report: removes an output that this formatter created.
+    virtual void discard() {}
     virtual bool supportsRegionlistLikeOutput() const { return false; }
     virtual void printRegionlistLikeOutputForProcess(const TLProcess& /*process*/,
                                                      std::span<const TLMemoryRegion> /*regions*/) {}

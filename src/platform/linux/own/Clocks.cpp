@@ -33,6 +33,12 @@ int mach_get_times(mach_times* times) {
     return 0;
 }
 
+std::uint64_t clock_uptime_raw_approx_ns() {
+    std::uint64_t now = 0;
+    readTicks(CLOCK_MONOTONIC, &now);
+    return now;
+}
+
 void mach_timebase_info(mach_timebase* timebase) { *timebase = {1, 1}; }
 
 } // namespace tally::platform

@@ -1,6 +1,5 @@
 // Calls that this system answers with "none".
 
-#include "platform/benchlog.h"
 #include "platform/dyld_inspection.h"
 #include "platform/mach_kernel_memory.h"
 #include "platform/mach_task.h"
@@ -44,11 +43,6 @@ kern_return_t vm_deallocate(std::span<const std::byte> /*buffer*/) { return KERN
 std::unique_ptr<QRYProcessObjectGraph> QRYDirectedGraphWithData(std::string_view /*contents*/,
                                                                 std::string* error) {
     *error = "not a heapsnap file";
-    return nullptr;
-}
-
-std::unique_ptr<BenchlogWriter> blwriter_open(const char* /*path*/) {
-    errno = ENOTSUP;
     return nullptr;
 }
 
