@@ -24,4 +24,8 @@ class GatherScope {
 /// warnings, such as a figure that rights did not allow and an estimate stands in for.
 std::vector<std::string> task_take_notices(mach_port_t task);
 
+/// Whether `task` shares memory by descent with another process to which there is a right, so that what it is
+/// charged may stay the same while the pages behind it change. True where that cannot be told.
+bool task_has_relatives(mach_port_t task);
+
 } // namespace tally::platform

@@ -312,6 +312,24 @@ TEST(Family, TwoProcessesInOneAddressSpaceCountOnce) {
     EXPECT_GT(tables, 0);
 }
 
+TEST(Family, RelativesAreKnownWhileThereAreRightsToThem) {
+    const Puppet puppet({"family", "1", "4", "same"});
+    mach_port_t parent = MACH_PORT_NULL;
+    mach_port_t child = MACH_PORT_NULL;
+    ASSERT_EQ(task_read_for_pid(puppet.pid(), &parent), KERN_SUCCESS);
+    const PortRight parentRight(parent);
+    EXPECT_FALSE(task_has_relatives(parent));
+    {
+        const auto& last = puppet.ledger().back();
+        ASSERT_EQ(last.name, "child");
+        ASSERT_EQ(task_read_for_pid(static_cast<std::int32_t>(last.size), &child), KERN_SUCCESS);
+        const PortRight childRight(child);
+        EXPECT_TRUE(task_has_relatives(parent));
+        EXPECT_TRUE(task_has_relatives(child));
+    }
+    EXPECT_FALSE(task_has_relatives(parent));
+}
+
 TEST(Family, FoundWithoutRandomisedAddressesToo) {
     if (geteuid() != 0) {
         GTEST_SKIP() << "frame numbers are shown to root only";

@@ -10,6 +10,7 @@
 #include "platform/mach_kernel_memory.h"
 #include "platform/mach_task.h"
 #include "platform/mach_vm.h"
+#include "platform/output_file.h"
 #include "platform/quarry.h"
 #include "platform/runekit.h"
 #include "platform/system.h"
@@ -20,6 +21,15 @@ namespace tally::platform {
 
 [[gnu::used]] const std::tuple allCalls{
     &blwriter_open,
+    &blwriter_set_description,
+    &blwriter_set_primary_metric,
+    &blwriter_new_group,
+    &blwriter_new_value,
+    &blwriter_record_variable_str,
+    &blwriter_record_label_str,
+    &blwriter_record_tag,
+    &blwriter_close,
+    &blwriter_discard,
     &proc_listallpids,
     static_cast<int (*)(std::int32_t, proc_bsdinfo*)>(&proc_pidinfo),
     static_cast<int (*)(std::int32_t, proc_bsdshortinfo*)>(&proc_pidinfo),
@@ -36,12 +46,15 @@ namespace tally::platform {
     &vm_kernel_page_size,
     &mach_get_times,
     &mach_timebase_info,
+    &clock_uptime_raw_approx_ns,
     &iso8601LocalDate,
     &dispatch_apply,
-    &dispatch_source_sigint,
-    &restoreDefaultSigintAction,
+    &dispatch_source_interrupt,
+    &restoreDefaultInterruptAction,
+    &dispatch_source_timer,
     &dyld_shared_cache_for_task,
     &task_take_notices,
+    &task_has_relatives,
     &mach_error_string,
     &mach_error,
     &mach_memory_info,
@@ -61,6 +74,8 @@ namespace tally::platform {
     &RKForeachSymbolOwner,
     &RKResolvedPath,
     &RKCreateKernelSymbolicator,
+    &OutputFile::open,
+    &isOneFile,
     &OptionScanner::next,
     &OptionScanner::argument,
     &OptionScanner::index,

@@ -433,22 +433,38 @@ TEST_F(Contract, DifferentTasksAreAskedAtOnce) {
     });
 }
 
+TEST_F(Contract, AProcessIsNoRelativeOfItself) {
+    const PortRight first = portOf(pid);
+    const PortRight second = portOf(pid);
+    EXPECT_FALSE(task_has_relatives(first.name()));
+    EXPECT_FALSE(task_has_relatives(second.name()));
+    EXPECT_TRUE(task_has_relatives(MACH_PORT_NULL)); // as far as can be told
+}
+
 TEST_F(Contract, ASignalSourceTakesInterruptsUntilItIsCancelled) {
-    std::atomic<int> interrupts = 0;
-    const auto source = dispatch_source_sigint([&] { ++interrupts; });
-    ASSERT_NE(source, nullptr);
-    for (int expected = 1; expected <= 2; ++expected) {
+    for (const InterruptSignals which : {InterruptSignals::sigint, InterruptSignals::sigintAndTermination}) {
+        std::atomic<int> interrupts = 0;
+        Semaphore called;
+        const auto source = dispatch_source_interrupt(which, [&] {
+            ++interrupts;
+            called.signal();
+        });
+        ASSERT_NE(source, nullptr);
         environment->interrupt();
-        for (int waits = 0; waits < 2000 && interrupts < expected; ++waits) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(5));
+        called.wait();
+        if (which == InterruptSignals::sigint) {
+            environment->interrupt();
+        } else {
+            environment->terminate();
         }
-        EXPECT_EQ(interrupts, expected);
+        called.wait();
+        source->cancel();
+        source->cancel(); // again is nothing new
+        environment->interrupt();
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        EXPECT_EQ(interrupts, 2);
     }
-    source->cancel();
-    source->cancel(); // again is nothing new
-    environment->interrupt();
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    EXPECT_EQ(interrupts, 2);
+    restoreDefaultInterruptAction();
 }
 
 } // namespace

@@ -35,6 +35,8 @@ class Environment {
     virtual void endSubject() = 0;
     /// Sends SIGINT to this program.
     virtual void interrupt() = 0;
+    /// Sends SIGTERM to this program.
+    virtual void terminate() = 0;
 };
 
 } // namespace tally::platform

@@ -5,9 +5,11 @@
 
 #pragma once
 
+#include "platform/dispatch.h"
 #include "platform/scripted/ScriptedKernel.h"
 
 #include <cerrno>
+#include <condition_variable>
 #include <cstddef>
 #include <mutex>
 
@@ -30,7 +32,22 @@ struct ScriptedKernel::State {
         std::uint32_t references = 1;
     };
 
+    struct InterruptHandler {
+        std::function<void()> call;
+        bool takesSigint = true;
+        bool takesTermination = false;
+    };
+    struct Timer {
+        SerialQueue* queue = nullptr;
+        std::function<void(std::uint64_t)> handler;
+        bool isSet = false;
+    };
+
+    /// Calls the handlers of the sources that take such a signal. @return whether there was one.
+    bool deliver(bool InterruptHandler::*isTaken);
+
     mutable std::recursive_mutex mutex; // an action may ask the kernel itself
+    std::condition_variable_any called;
     std::vector<std::unique_ptr<ScriptedTask>> tasks;
     std::map<std::int32_t, ScriptedTask*> tasksByPid;
     std::map<mach_port_t, Port> ports;
@@ -39,7 +56,8 @@ struct ScriptedKernel::State {
     std::uint64_t lastObjectId = 0x7a11'0000'0000;
     std::vector<std::unique_ptr<Fault>> faults; // never shrinks: an action may add one
     std::vector<CallRecord> calls;
-    std::map<const void*, std::function<void()>> interruptHandlers; // by source
+    std::map<const void*, InterruptHandler> interruptHandlers; // by source
+    Timer* timer = nullptr;                                    // the one that exists
     std::uint64_t clockReadings = 0;
     bool gathering = false;
 };

@@ -26,9 +26,9 @@ constexpr std::array<std::string_view, 35> callsThatCanFail{
     "RKCreateKernelSymbolicator",
     "RKForeachSymbolOwner",
     "RKResolvedPath",
-    "blwriter_open",
     "copyLoadedModuleIdentifiers",
-    "dispatch_source_sigint",
+    "dispatch_source_interrupt",
+    "dispatch_source_timer",
     "dyld_shared_cache_for_task",
     "ledger_entries",
     "ledger_template",
@@ -57,15 +57,18 @@ constexpr std::array<std::string_view, 35> callsThatCanFail{
     "task_take_notices",
     "vm_deallocate",
 };
-constexpr std::array<std::string_view, 9> callsThatCannot{
+constexpr std::array<std::string_view, 12> callsThatCannot{
     "GatherScope",
+    "clock_uptime_raw_approx_ns",
     "effectiveUserId",
     "hasInternalContent",
     "mach_timebase_info",
     "ownPid",
     "prepareStandardStreams",
-    "restoreDefaultSigintAction",
+    "restoreDefaultInterruptAction",
+    "setTimer",
     "standardOutputIsTerminal",
+    "task_has_relatives",
     "vm_kernel_page_size",
 };
 
@@ -131,13 +134,42 @@ void ScriptedKernel::before(std::string_view call, std::function<void()> action,
         State::Fault{.call = std::string(call), .which = which, .error = 0, .action = std::move(action)}));
 }
 
-bool ScriptedKernel::interrupt() {
-    const std::lock_guard lock(state_->mutex);
-    const auto handlers = state_->interruptHandlers; // a handler may cancel its source
+bool ScriptedKernel::interrupt() { return state_->deliver(&State::InterruptHandler::takesSigint); }
+
+bool ScriptedKernel::terminate() { return state_->deliver(&State::InterruptHandler::takesTermination); }
+
+bool ScriptedKernel::State::deliver(bool InterruptHandler::*isTaken) {
+    const std::lock_guard lock(mutex);
+    bool wasTaken = false;
+    const auto handlers = interruptHandlers; // a handler may cancel its source
     for (const auto& [source, handler] : handlers) {
-        handler();
+        if (handler.*isTaken) {
+            wasTaken = true;
+            handler.call();
+        }
     }
-    return !handlers.empty();
+    return wasTaken;
+}
+
+bool ScriptedKernel::fireTimer(std::uint64_t ticks) {
+    SerialQueue* queue = nullptr;
+    std::function<void(std::uint64_t)> handler;
+    {
+        const std::lock_guard lock(state_->mutex);
+        if (state_->timer == nullptr || !state_->timer->isSet) {
+            return false;
+        }
+        queue = state_->timer->queue;
+        handler = state_->timer->handler;
+    }
+    queue->sync([&] { handler(ticks); }); // without the lock: the handler asks the kernel
+    return true;
+}
+
+void ScriptedKernel::awaitCall(std::string_view call, std::uint64_t count) {
+    requireCallName(call, false);
+    std::unique_lock lock(state_->mutex);
+    state_->called.wait(lock, [&] { return callCount(call) >= count; });
 }
 
 const std::vector<CallRecord>& ScriptedKernel::calls() const { return state_->calls; }
@@ -186,6 +218,7 @@ Answer::Answer(const char* call, PortName port, Numbers arguments, std::string_v
 void Answer::begin(const CallRecord& record) {
     requireCallName(record.name, false);
     state.calls.push_back(record);
+    state.called.notify_all();
     for (std::size_t i = 0; i < state.faults.size(); ++i) {
         ScriptedKernel::State::Fault& candidate = *state.faults[i];
         if (!candidate.meets(record)) {

@@ -95,6 +95,13 @@ class ScriptedKernel {
     /// Delivers a SIGINT. @return whether a source took it; without one the signal would have ended the
     /// program.
     bool interrupt();
+    /// Delivers a SIGTERM. @return as interrupt() does.
+    bool terminate();
+    /// Lets the timer that is set fire as after `ticks` of its periods, and returns once its handler has run.
+    /// @return false when there is none, or no longer.
+    bool fireTimer(std::uint64_t ticks = 1);
+    /// Waits until `call` has been made `count` times.
+    void awaitCall(std::string_view call, std::uint64_t count = 1);
 
     // What was asked.
 
@@ -118,6 +125,7 @@ class ScriptedKernel {
                      .wall_nanoseconds = 0}; // the first answer
     std::uint64_t ticksBetweenReadings = 1'000;
     mach_timebase timebase{.numer = 1, .denom = 1};
+    std::uint64_t uptimeNanoseconds = 0;
     std::map<std::uint32_t, std::string> tagDescriptions; // of VM tags
 
     // The kernel's own memory.

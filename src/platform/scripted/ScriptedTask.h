@@ -130,6 +130,7 @@ struct TaskRecord {
     kern_return_t cacheProcessStatus = 0;
     kern_return_t cacheSnapshotStatus = 0;
     std::vector<std::string> notices{}; // what the platform has to say about its figures
+    std::int32_t family = 0;            // processes of one family are relatives; 0: none
 };
 
 class ScriptedTask : public TaskRecord {

@@ -1,6 +1,5 @@
-// Clocks, the interrupt source, the performance-data writer and the tool's own process.
+// Clocks, the interrupt source, timers and the tool's own process.
 
-#include "platform/benchlog.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/system.h"
@@ -15,7 +14,8 @@ constexpr std::int64_t nanosecondsPerSecond = 1'000'000'000;
 
 class InterruptSource final : public SignalSource {
   public:
-    InterruptSource(ScriptedKernel::State& state, std::function<void()> handler) : state_(state) {
+    InterruptSource(ScriptedKernel::State& state, ScriptedKernel::State::InterruptHandler handler)
+        : state_(state) {
         state_.interruptHandlers[this] = std::move(handler);
     }
     ~InterruptSource() override { cancel(); }
@@ -26,6 +26,30 @@ class InterruptSource final : public SignalSource {
 
   private:
     ScriptedKernel::State& state_;
+};
+
+class Timer final : public TimerSource {
+  public:
+    Timer(ScriptedKernel::State& state, SerialQueue& queue, std::function<void(std::uint64_t)> handler)
+        : state_(state), timer_{.queue = &queue, .handler = std::move(handler)} {
+        state_.timer = &timer_;
+    }
+    ~Timer() override {
+        const std::lock_guard lock(state_.mutex);
+        state_.timer = nullptr;
+    }
+    void setTimer(std::uint64_t start, std::uint64_t interval, std::uint64_t leeway) override {
+        const Answer answer("setTimer", -1, {start, interval, leeway});
+        timer_.isSet = true;
+    }
+    void cancel() override {
+        const std::lock_guard lock(state_.mutex);
+        timer_.isSet = false;
+    }
+
+  private:
+    ScriptedKernel::State& state_;
+    ScriptedKernel::State::Timer timer_;
 };
 
 } // namespace
@@ -46,22 +70,34 @@ int mach_get_times(mach_times* times) {
     return 0;
 }
 
-void mach_timebase_info(mach_timebase* timebase) { *timebase = Answer("mach_timebase_info").kernel.timebase; }
-
-std::unique_ptr<SignalSource> dispatch_source_sigint(std::function<void()> handler) {
-    const Answer answer("dispatch_source_sigint");
-    return answer.fault != 0 ? nullptr : std::make_unique<InterruptSource>(answer.state, std::move(handler));
+std::uint64_t clock_uptime_raw_approx_ns() {
+    return Answer("clock_uptime_raw_approx_ns").kernel.uptimeNanoseconds;
 }
 
-void restoreDefaultSigintAction() { const Answer answer("restoreDefaultSigintAction"); }
+void mach_timebase_info(mach_timebase* timebase) { *timebase = Answer("mach_timebase_info").kernel.timebase; }
 
-std::unique_ptr<BenchlogWriter> blwriter_open(const char* path) {
-    const Answer answer("blwriter_open", -1, {}, path);
+std::unique_ptr<SignalSource> dispatch_source_interrupt(InterruptSignals which,
+                                                        std::function<void()> handler) {
+    const Answer answer("dispatch_source_interrupt", -1, {static_cast<std::uint64_t>(which)});
+    if (answer.fault != 0) {
+        return nullptr;
+    }
+    return std::make_unique<InterruptSource>(
+        answer.state,
+        ScriptedKernel::State::InterruptHandler{
+            .call = std::move(handler), .takesTermination = which == InterruptSignals::sigintAndTermination});
+}
+
+void restoreDefaultInterruptAction() { const Answer answer("restoreDefaultInterruptAction"); }
+
+std::unique_ptr<TimerSource> dispatch_source_timer(SerialQueue& queue,
+                                                   std::function<void(std::uint64_t)> handler) {
+    const Answer answer("dispatch_source_timer", -1, {}, queue.label);
     if (answer.fault != 0) {
         Answer::refuse(answer.fault);
         return nullptr;
     }
-    return std::make_unique<BenchlogWriter>();
+    return std::make_unique<Timer>(answer.state, queue, std::move(handler));
 }
 
 void prepareStandardStreams() { const Answer answer("prepareStandardStreams"); }

@@ -117,4 +117,14 @@ std::vector<std::string> task_take_notices(mach_port_t task) {
     return std::exchange(port->second.task->notices, {});
 }
 
+bool task_has_relatives(mach_port_t task) {
+    const Answer answer("task_has_relatives", PortName{task});
+    const ScriptedTask* const scripted = answer.taskOfPort(task);
+    return scripted == nullptr ||
+           (scripted->family != 0 && std::ranges::any_of(answer.state.ports, [&](const auto& entry) {
+                const ScriptedTask& other = *entry.second.task;
+                return other.family == scripted->family && other.pid != scripted->pid;
+            }));
+}
+
 } // namespace tally::platform

@@ -1,6 +1,7 @@
-// What both platforms share: dates, error texts and the option scanner.
+// What both platforms share: dates, error texts, serial queues and the option scanner.
 
 #include "platform/clock.h"
+#include "platform/dispatch.h"
 #include "platform/kern_return.h"
 #include "platform/system.h"
 
@@ -38,6 +39,29 @@ TEST(LocalDate, GivesTheZonesOffsetAndCutsMilliseconds) {
     }
     unsetenv("TZ");
     tzset();
+}
+
+TEST(SerialQueue, RunsAndDropsItemsInTheirOrder) {
+    std::vector<std::string> events;
+    struct Tellable {
+        std::vector<std::string>* events;
+        std::string name;
+        ~Tellable() { events->push_back("drops " + name); }
+    };
+    Semaphore gate;
+    {
+        SerialQueue queue("queue");
+        queue.async([&] { gate.wait(); });
+        for (const char* name : {"a", "b"}) {
+            queue.async([&events, item = std::make_shared<Tellable>(&events, name)] {
+                events.push_back("runs " + item->name);
+            });
+        }
+        gate.signal();
+        queue.sync([&] { events.emplace_back("sync"); });
+        queue.async([&] { events.emplace_back("last"); }); // the end of the queue waits for it
+    }
+    EXPECT_EQ(events, (std::vector<std::string>{"runs a", "drops a", "runs b", "drops b", "sync", "last"}));
 }
 
 TEST(ErrorTexts, SayWhatTheStatusMeans) {

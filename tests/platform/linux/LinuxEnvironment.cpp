@@ -101,6 +101,7 @@ class LinuxEnvironment final : public Environment {
         waitpid(pid_, nullptr, 0);
     }
     void interrupt() override { kill(getpid(), SIGINT); }
+    void terminate() override { kill(getpid(), SIGTERM); }
 
   private:
     [[noreturn]] void beSubject(int tell) {

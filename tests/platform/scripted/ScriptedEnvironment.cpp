@@ -32,6 +32,7 @@ class ScriptedEnvironment final : public Environment {
     void leaveSubjectAsZombie() override { task_.becomeZombie(); }
     void endSubject() override { task_.exit(); }
     void interrupt() override { kernel_.interrupt(); }
+    void terminate() override { kernel_.terminate(); }
 
   private:
     static constexpr std::uint64_t page = 4096;

@@ -148,7 +148,9 @@ std::size_t countRelatives(const FamilyKey& key) {
     std::size_t count = 0;
     if (found != table.relatives.end()) {
         for (const Tenants& tenants : found->second) {
-            count += tenants.tasks.size();
+            for (std::size_t i = 0; i < tenants.tasks.size(); ++i) { // rising by pid
+                count += i == 0 || tenants.tasks[i].pid != tenants.tasks[i - 1].pid ? 1 : 0;
+            }
         }
     }
     return count;

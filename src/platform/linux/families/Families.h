@@ -21,7 +21,7 @@ MemberIdentity enterAddressSpace(const FamilyKey& key, MemberIdentity task);
 /// Takes back what enterAddressSpace entered.
 void leaveAddressSpace(const FamilyKey& key, MemberIdentity task);
 
-/// How many tasks to which there are rights descend from the exec of `key`.
+/// How many processes to which there are rights, be it several, descend from the exec of `key`.
 std::size_t countRelatives(const FamilyKey& key);
 
 /// The address space of the process that `owner` stands for, read together with its relatives. Absent when it

@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <map>
 #include <mutex>
+#include <set>
 #include <vector>
 
 namespace tally::platform {
@@ -41,7 +42,11 @@ std::uint64_t lazilyFreed(const std::string& folder) {
 void prepare(Search& search) {
     search.isPrepared = true;
     search.left = machineState().lazyFree;
+    std::set<std::int32_t> pids; // a process can have several rights
     for (const auto& task : allTasks()) {
+        if (!pids.insert(task->pid()).second) {
+            continue;
+        }
         if (const std::optional<ProcessStatus> status = readProcessStatus(task->pid())) {
             search.candidates.push_back({task->pid(), status->residentAnonymous, task->hasRelatives()});
         }

@@ -1,4 +1,4 @@
-// SIGINT as a source: the signal wakes a thread that calls the handler.
+// Interrupts as a source: the signal wakes a thread that calls the handler.
 
 #include "platform/dispatch.h"
 #include "platform/linux/io/Descriptor.h"
@@ -33,11 +33,11 @@ void onSignal(int /*signal*/) {
     errno = error;
 }
 
-class SigintSource final : public SignalSource {
+class InterruptSource final : public SignalSource {
   public:
-    SigintSource(Descriptor event, std::function<void()> handler)
+    InterruptSource(Descriptor event, std::function<void()> handler)
         : event_(std::move(event)), handler_(std::move(handler)), thread_([this] { run(); }) {}
-    ~SigintSource() override { SigintSource::cancel(); }
+    ~InterruptSource() override { InterruptSource::cancel(); }
 
     void cancel() override {
         if (thread_.joinable()) {
@@ -69,22 +69,46 @@ class SigintSource final : public SignalSource {
     std::thread thread_;
 };
 
+bool isIgnored(int signal) {
+    struct sigaction action {};
+    return sigaction(signal, nullptr, &action) == 0 && action.sa_handler == SIG_IGN;
+}
+
+void catchSignal(int signal) {
+    struct sigaction action {};
+    action.sa_handler = onSignal;
+    action.sa_flags = SA_RESTART;
+    sigaction(signal, &action, nullptr);
+}
+
 } // namespace
 
-std::unique_ptr<SignalSource> dispatch_source_sigint(std::function<void()> handler) {
+std::unique_ptr<SignalSource> dispatch_source_interrupt(InterruptSignals which,
+                                                        std::function<void()> handler) {
     Descriptor event(eventfd(0, EFD_CLOEXEC));
     if (!event.isOpen()) {
         return nullptr;
     }
     signalEvent = event.number();
-    auto source = std::make_unique<SigintSource>(std::move(event), std::move(handler));
-    struct sigaction action {};
-    action.sa_handler = onSignal;
-    action.sa_flags = SA_RESTART;
-    sigaction(SIGINT, &action, nullptr);
+    auto source = std::make_unique<InterruptSource>(std::move(event), std::move(handler));
+    catchSignal(SIGINT); // also where a shell had it ignored, as for what runs in the background
+    if (which == InterruptSignals::sigintAndTermination) {
+        for (const int signal : {SIGTERM, SIGHUP}) {
+            if (!isIgnored(signal)) {
+                catchSignal(signal);
+            }
+        }
+    }
     return source;
 }
 
-void restoreDefaultSigintAction() { std::signal(SIGINT, SIG_DFL); }
+void restoreDefaultInterruptAction() {
+    for (const int signal : {SIGINT, SIGTERM, SIGHUP}) {
+        struct sigaction action {};
+        if (sigaction(signal, nullptr, &action) == 0 && action.sa_handler == onSignal) {
+            std::signal(signal, SIG_DFL);
+        }
+    }
+}
 
 } // namespace tally::platform

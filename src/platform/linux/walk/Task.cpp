@@ -137,6 +137,11 @@ kern_return_t mach_port_retain(mach_port_t port) { return portTable().changeRefe
 
 kern_return_t mach_port_deallocate(mach_port_t port) { return portTable().changeReferences(port, -1); }
 
+bool task_has_relatives(mach_port_t task) {
+    const std::shared_ptr<Task> found = taskOfPort(task);
+    return !found || found->hasRelatives();
+}
+
 std::vector<std::string> task_take_notices(mach_port_t task) {
     const std::shared_ptr<Task> found = taskOfPort(task);
     return found ? found->takeNotices() : std::vector<std::string>();

@@ -26,8 +26,8 @@ class Task {
     std::int32_t pid() const { return identity_.pid; }
     /// Whether a task with a lower pid has the very same address space, and so its page tables too.
     bool isSecondTenant() const { return owner_.pid != identity_.pid; }
-    /// Whether there is a right to another task that descends from the same exec.
-    bool hasRelatives() const { return countRelatives(key_) > 1; }
+    /// Whether there is a right to another process that descends from the same exec, as far as can be told.
+    bool hasRelatives() const { return !key_.isKnown() || countRelatives(key_) > 1; }
     std::uint64_t startTicks() const { return identity_.startTicks; }
 
     /// The walk that is under way; starts one when there is none.
