@@ -46,6 +46,12 @@ std::uint64_t sumOfDistinctObjects(const TLProcess& process) {
     return sum;
 }
 
+std::unique_ptr<TLRangeList> copyOf(const TLRangeList& ranges, std::uint64_t pageSize) {
+    auto copy = std::make_unique<TLRangeList>();
+    copy->mergeRangeList(ranges, pageSize);
+    return copy;
+}
+
 } // namespace
 
 TLMemoryObject& TLTally::MemoryObjectTables::objectForRegion(const TLMemoryRegion& region,
@@ -110,6 +116,9 @@ void TLTally::analyzeMemoryObjects() {
                 : nullptr;
         for (TLMemoryRegion& region : process->memoryRegions()) {
             TLMemoryObject& object = tables.objectForRegion(region, *process, cacheTable);
+            if (isSample && region.subrangeList) {
+                takenSubranges_.emplace_back(&region, copyOf(*region.subrangeList, process->pageSize()));
+            }
             object.addRegionForProcess(region, process.get());
             if (asCharged && region.ownedExclusivelyByParentProcess) {
                 object.ownerPid = process->pid();

@@ -140,6 +140,10 @@ void TLTally::printReport(bool regionlistLikeOutput, bool summarize) {
         formatter->printGlobalAuxData(findings.globalAuxData);
         formatter->endAtTime(gatherEndTime_);
     }
+    for (auto& [region, subranges] : takenSubranges_) {
+        region->subrangeList = std::move(subranges);
+    }
+    takenSubranges_.clear();
 }
 
 } // namespace tally

@@ -39,8 +39,11 @@ class TLTally {
 
     /// Gathers every process, highest pid first, on all processors. @return whether it was interrupted.
     bool gatherAllProcesses();
-    /// A started source that runs `handler` on every SIGINT; the caller cancels it.
-    static std::unique_ptr<platform::SignalSource> installSigintHandler(std::function<void()> handler);
+    /// A started source that runs `handler` on every SIGINT, or other signal of `signals`; the caller cancels
+    /// it.
+    static std::unique_ptr<platform::SignalSource>
+    installSigintHandler(std::function<void()> handler,
+                         platform::InterruptSignals signals = platform::InterruptSignals::sigint);
     /// The accounting switch (vm/PhysTallyCollection.h).
     static bool physTallyCollectionEnabled();
     static void setPhysTallyCollectionEnabled(int value);
@@ -70,6 +73,8 @@ class TLTally {
 
     std::atomic<bool> earlyExit = false; // only ever set to true, by the interrupt handler
     std::uint32_t qualityOfService = platform::QOS_CLASS_UTILITY;
+    /// One of several measurements, which can hand a process on from one to the next while it is reported.
+    bool isSample = false;
 
   private:
     struct MemoryObjectTables {
@@ -100,6 +105,8 @@ class TLTally {
     // Objects are made by the ten thousand and go together: they live here, and none may outlive its tally.
     std::unique_ptr<std::pmr::monotonic_buffer_resource> arena_;
     std::optional<MemoryObjectTables> tables_; // from the analysis to the grouping
+    /// What the objects took from the regions of a sample, for the next one's analysis.
+    std::vector<std::pair<TLMemoryRegion*, std::unique_ptr<TLRangeList>>> takenSubranges_;
     std::vector<std::shared_ptr<TLOutputFormatter>> outputFormatters_;
     std::optional<TLTime> gatherStartTime_;
     std::optional<TLTime> gatherEndTime_;

@@ -37,7 +37,8 @@ bool TLTally::gatherAllProcesses() {
             sorted[index]->gatherData();
         }
     });
-    if (interrupted) {
+    // An interrupted sample is never reported, and the process may be in an earlier one that is.
+    if (interrupted && !isSample) {
         sorted.back()->_addGlobalError(
             "Tally exited early due to SIGINT and did not finish gathering all data");
     }
@@ -45,8 +46,9 @@ bool TLTally::gatherAllProcesses() {
     return interrupted;
 }
 
-std::unique_ptr<platform::SignalSource> TLTally::installSigintHandler(std::function<void()> handler) {
-    return platform::dispatch_source_sigint(std::move(handler));
+std::unique_ptr<platform::SignalSource> TLTally::installSigintHandler(std::function<void()> handler,
+                                                                      platform::InterruptSignals signals) {
+    return platform::dispatch_source_interrupt(signals, std::move(handler));
 }
 
 bool TLTally::physTallyCollectionEnabled() { return tally::physTallyCollectionEnabled(); }

@@ -3,6 +3,7 @@
 #include "analysis/TLTally.h"
 #include "cli/OutputFiles.h"
 #include "cli/ParseArguments.h"
+#include "cli/Sampling.h"
 #include "cli/TargetBuilding.h"
 #include "cli/Usage.h"
 #include "platform/system.h"
@@ -20,43 +21,43 @@ void printMessage(const std::optional<TLError>& error) {
     }
 }
 
-/// The targets of the run; absent, with a message, when there is nothing to measure.
-std::optional<TLTally::ProcessList> buildTargets(TLTallyArgs& args) {
+/// The targets of the run; empty, with a message, when there is nothing to measure.
+TLTally::ProcessList buildTargets(TLTallyArgs& args) {
     std::optional<TLError> error;
     const std::optional<TLProcessTable> table = targetProcessesForArgs(args, &error);
     if (!table) {
         printMessage(error);
         printUsage();
-        return std::nullopt;
+        return {};
     }
     if (table->empty()) {
         std::fputs(
             "Unable to find any processes matching the supplied process names or pids (try as root?)\n",
             stderr);
-        return std::nullopt;
+        return {};
     }
     printMessage(error);
-    TLTally::ProcessList targets;
-    for (const auto& [key, process] : *table) {
-        targets.push_back(process);
-    }
-    return targets;
+    return processesOf(*table);
 }
 
 void measureOnce(const TLTallyArgs& args, TLTally::ProcessList targets, const OutputFiles& outputs) {
     TLTally tally(std::move(targets));
     std::unique_ptr<platform::SignalSource> interrupts;
     if (!platform::standardOutputIsTerminal()) {
-        interrupts = TLTally::installSigintHandler([&tally] {
+        const auto exitEarly = [&tally] {
             tally.earlyExit = true;
             std::fputs("Exiting early due to SIGINT\n", stderr);
-        });
+        };
+        // Whoever ends a run that writes files, by whichever signal, wants them whole.
+        interrupts = TLTally::installSigintHandler(
+            exitEarly, outputs.hasFiles() ? platform::InterruptSignals::sigintAndTermination
+                                          : platform::InterruptSignals::sigint);
     }
     tally.gatherAllProcesses();
     tally.analyzeMemoryObjects();
     if (interrupts) {
         interrupts->cancel();
-        platform::restoreDefaultSigintAction();
+        platform::restoreDefaultInterruptAction();
     }
     for (const auto& formatter : outputs.formatters()) {
         tally.addOutputFormatter(formatter);
@@ -66,15 +67,15 @@ void measureOnce(const TLTallyArgs& args, TLTally::ProcessList targets, const Ou
 
 /// Measures what `args` ask for, into `outputs`. @return whether there was something to report.
 bool measure(TLTallyArgs& args, const OutputFiles& outputs) {
-    std::optional<TLTally::ProcessList> targets = buildTargets(args);
-    if (!targets) {
+    TLTally::ProcessList targets = buildTargets(args);
+    if (targets.empty()) {
         return false;
     }
     if (args.sampleInterval != 0) {
-        std::fputs("Sampling is not available in this build\n", stderr);
-        return false;
+        targets.clear(); // every sample has its own
+        return runSampling(args, outputs);
     }
-    measureOnce(args, *std::move(targets), outputs);
+    measureOnce(args, std::move(targets), outputs);
     return true;
 }
 
@@ -98,11 +99,10 @@ int runTally(int argc, char** argv) {
     }
     OutputFiles outputs;
     if (!outputs.create(args) || !measure(args, outputs)) {
-        outputs.deleteFiles();
+        outputs.discard();
         return 1;
     }
-    outputs.close();
-    return 0;
+    return outputs.close() ? 0 : 1;
 }
 
 } // namespace tally

@@ -275,4 +275,13 @@ std::optional<TLProcessTable> targetProcessesForArgs(TLTallyArgs& args, std::opt
     return built ? std::optional(builder.takeTable()) : std::nullopt;
 }
 
+std::vector<std::shared_ptr<TLProcess>> processesOf(const TLProcessTable& table) {
+    std::vector<std::shared_ptr<TLProcess>> processes;
+    processes.reserve(table.size());
+    for (const auto& [key, process] : table) {
+        processes.push_back(process);
+    }
+    return processes;
+}
+
 } // namespace tally

@@ -9,7 +9,9 @@
 #include "cli/TLTallyArgs.h"
 #include "process/TargetSelection.h"
 
+#include <memory>
 #include <optional>
+#include <vector>
 
 namespace tally {
 
@@ -20,5 +22,8 @@ namespace tally {
 ///              not be resolved.
 /// @return the table, which may be empty; absent when target building failed.
 std::optional<TLProcessTable> targetProcessesForArgs(TLTallyArgs& args, std::optional<TLError>* error);
+
+/// The processes of `table`, in no order that means something.
+std::vector<std::shared_ptr<TLProcess>> processesOf(const TLProcessTable& table);
 
 } // namespace tally

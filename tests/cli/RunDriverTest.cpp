@@ -1,11 +1,6 @@
 #include "cli/RunDriver.h"
 #include "cli/CommandLine.h"
-#include "cli/OutputFiles.h"
-#include "output/TLOutputFormatterText.h"
 #include "platform/scripted/ScriptedKernel.h"
-
-#include <filesystem>
-#include <fstream>
 
 namespace tally {
 namespace {
@@ -34,11 +29,13 @@ TEST_F(RunDriver, EndsWithItsStatusAndMessage) {
         std::string words, message;
     } cases[] = {
         {"--unmapped server", "Must run as root.\n"},
-        {"-j x --benchlog y server", "Unable to create JSON output\n"},
-        {"--benchlog x server", "Unable to create benchlog output\n"},
+        {"-j no/x server",
+         "Unable to open JSON writer: No such file or directory\nUnable to create JSON output\n"},
+        {"-j . server", "Unable to open JSON writer: Is a directory\nUnable to create JSON output\n"},
+        {"--benchlog no/x server",
+         "Unable to open blwriter: No such file or directory\nUnable to create benchlog output\n"},
         {"--sample 1 nobody",
          "Unable to find any processes matching the supplied process names or pids (try as root?)\n"},
-        {"--sample 1 server", "Sampling is not available in this build\n"},
     };
     kernel.effectiveUserId = 1000;
     for (const auto& [words, message] : cases) {
@@ -72,20 +69,18 @@ TEST_F(RunDriver, ReportsWhatAnInterruptLeft) {
                       output.npos,
                   !isTerminal);
         EXPECT_FALSE(kernel.interrupt()); // the source is gone, and the default action is back
-        EXPECT_EQ(kernel.callCount("restoreDefaultSigintAction"), 1U);
+        EXPECT_EQ(kernel.callCount("restoreDefaultInterruptAction"), 1U);
     }
 }
 
-TEST(OutputFiles, OnlyFilesOfFormattersAreDeleted) {
-    std::ofstream("ours") << "text";
-    std::ofstream("others") << "text";
-    OutputFiles outputs;
-    EXPECT_TRUE(
-        outputs.add(std::make_shared<TLOutputFormatterText>(TLSummaryFormat::bytes, 0, "Dirty"), "ours"));
-    EXPECT_FALSE(outputs.add(nullptr, "others"));
-    outputs.deleteFiles();
-    EXPECT_FALSE(std::filesystem::exists("ours"));
-    EXPECT_TRUE(std::filesystem::remove("others"));
+TEST_F(RunDriver, TerminationEndsEarlyOnlyWhatWritesFiles) {
+    for (const bool writesFile : {true, false}) {
+        bool wasTaken = !writesFile;
+        kernel.before("mach_get_times", [&] { wasTaken = kernel.terminate(); });
+        EXPECT_EQ(run(writesFile ? "server -j /dev/null" : "server"), 0);
+        EXPECT_EQ(wasTaken, writesFile);
+        EXPECT_EQ(messages, writesFile ? "Exiting early due to SIGINT\n" : "");
+    }
 }
 
 } // namespace
