@@ -4,6 +4,7 @@
 #include "vm/TLMemoryRegion.h"
 
 #include <algorithm>
+#include <iterator>
 #include <utility>
 
 namespace tally {
@@ -15,6 +16,10 @@ namespace {
 std::uint64_t mergedBytes(std::uint64_t a, std::uint64_t b, std::uint64_t overlap) {
     const std::uint64_t sum = a + b;
     return std::max({a, b, sum < overlap ? 0 : sum - overlap});
+}
+
+bool isBefore(const TLRangeListNode& node, std::uint64_t firstPage, std::uint64_t pageSize) {
+    return roundUpToPage(node.end(), pageSize) < firstPage;
 }
 
 TLRangeSizes mergedSizes(const TLRangeSizes& a, const TLRangeSizes& b, std::uint64_t overlap) {
@@ -49,19 +54,12 @@ void TLRangeList::addSubrange(std::uint64_t start, std::uint64_t size, std::uint
     size = std::min(size, ~std::uint64_t{0} - pageSize -
                               start); // a device's offsets can reach past the last address
     const std::uint64_t pagesEnd = roundUpToPage(start + size, pageSize);
-    const auto isBefore = [&](const TLRangeListNode& node) {
-        return roundUpToPage(node.end(), pageSize) < firstPage;
-    };
     auto node = std::make_unique<TLRangeListNode>();
     node->start = start;
     node->size = size;
     node->sizes = sizes;
 
-    std::unique_ptr<TLRangeListNode>* link =
-        lastInserted_ != nullptr && isBefore(*lastInserted_) ? &lastInserted_->next : &head_;
-    while (*link && isBefore(**link)) {
-        link = &(*link)->next;
-    }
+    Link* const link = linkBefore(firstPage, pageSize);
     while (*link && roundDownToPage((*link)->start, pageSize) <= pagesEnd) {
         const TLRangeListNode& other = **link;
         const std::uint64_t overlapStart = std::max(roundDownToPage(other.start, pageSize), firstPage);
@@ -71,11 +69,47 @@ void TLRangeList::addSubrange(std::uint64_t start, std::uint64_t size, std::uint
         const std::uint64_t end = std::max(other.end(), node->end());
         node->start = std::min(other.start, node->start);
         node->size = end - node->start;
+        if (index_) {
+            index_->erase(other.start);
+        }
         *link = std::move((*link)->next);
     }
     node->next = std::move(*link);
     *link = std::move(node);
     lastInserted_ = link->get();
+    if (index_) {
+        index_->emplace(lastInserted_->start, lastInserted_);
+    }
+}
+
+/// The link behind the last node that lies wholly before `firstPage`.
+TLRangeList::Link* TLRangeList::linkBefore(std::uint64_t firstPage, std::uint64_t pageSize) {
+    constexpr int longWalk = 64; // nodes
+    Link* link = &head_;
+    if (index_) {
+        auto next = index_->lower_bound(firstPage);
+        while (next != index_->begin() && !isBefore(*std::prev(next)->second, firstPage, pageSize)) {
+            --next;
+        }
+        link = next == index_->begin() ? &head_ : &std::prev(next)->second->next;
+    } else if (lastInserted_ != nullptr && isBefore(*lastInserted_, firstPage, pageSize)) {
+        link = &lastInserted_->next;
+    }
+    int steps = 0;
+    for (; *link && isBefore(**link, firstPage, pageSize); link = &(*link)->next) {
+        ++steps;
+    }
+    if (steps > longWalk && !index_) {
+        makeIndex();
+    }
+    return link;
+}
+
+void TLRangeList::makeIndex() {
+    index_ = std::make_unique<std::map<std::uint64_t, TLRangeListNode*>>();
+    for (TLRangeListNode* node = head_.get(); node != nullptr; node = node->next.get()) {
+        index_->emplace_hint(index_->end(), node->start, node);
+    }
 }
 
 void TLRangeList::addRegionRange(const TLMemoryRegion& region, std::uint64_t pageSize) {

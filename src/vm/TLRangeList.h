@@ -2,12 +2,15 @@
 //
 // Decides how overlapping ranges merge; knows nothing of processes or formats.
 // Invariant: nodes are sorted by start and no two share a page or touch at a page boundary.
-// Cost: one pass over the chain per insertion, begun at the last insertion where that lies before the new
-// range; nodes are freed as they fold. Not thread-safe: a list belongs to one object and one thread.
+// Cost: an insertion walks the chain, from the last insertion on where that lies before the new range. The
+// first long walk makes an index, since a file can be mapped in pieces in any order: from then on an
+// insertion costs the logarithm of the length. Nodes are freed as they fold. Not thread-safe: a list belongs
+// to one object and one thread.
 
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 
 namespace tally {
@@ -56,8 +59,15 @@ class TLRangeList {
     const TLRangeListNode* rangeListHead() const { return head_.get(); }
 
   private:
-    std::unique_ptr<TLRangeListNode> head_;
+    using Link = std::unique_ptr<TLRangeListNode>;
+
+    Link* linkBefore(std::uint64_t firstPage, std::uint64_t pageSize);
+    void makeIndex();
+
+    Link head_;
     TLRangeListNode* lastInserted_ = nullptr;
+    std::unique_ptr<std::map<std::uint64_t, TLRangeListNode*>>
+        index_; // by start; absent until it is worth it
 };
 
 } // namespace tally

@@ -77,8 +77,8 @@ int readPool() {
 
 } // namespace
 
-Puppet::Puppet(std::vector<std::string> arguments) {
-    arguments.insert(arguments.begin(), PUPPET_PROGRAM);
+Puppet::Puppet(std::vector<std::string> arguments, const std::string& program) {
+    arguments.insert(arguments.begin(), program);
     const Pipe in;
     const Pipe out;
     pid_ = start(arguments, in.reading, out.writing, -1);

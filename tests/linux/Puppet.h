@@ -20,8 +20,8 @@ class Puppet {
         std::map<std::string, std::string> figures; // "dirty" and so on: bytes, or "any"
     };
 
-    /// Starts the puppet program with `arguments` and waits until it is ready.
-    explicit Puppet(std::vector<std::string> arguments);
+    /// Starts a puppet program with `arguments` and waits until it is ready.
+    explicit Puppet(std::vector<std::string> arguments, const std::string& program = PUPPET_PROGRAM);
     ~Puppet();
     Puppet(const Puppet&) = delete;
     Puppet& operator=(const Puppet&) = delete;

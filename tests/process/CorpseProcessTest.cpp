@@ -22,28 +22,21 @@ std::string raw(Number value) {
     return {reinterpret_cast<const char*>(&value), sizeof value};
 }
 
-/// A kcdata buffer of items with these types and payloads.
-Bytes kcdata(const std::vector<std::pair<std::uint32_t, std::string>>& items) {
-    std::string buffer;
-    for (const auto& [type, payload] : items) {
-        buffer +=
-            raw(type) + raw(static_cast<std::uint32_t>(payload.size())) + raw(~std::uint64_t{0}) + payload;
-    }
-    const auto bytes = std::as_bytes(std::span(buffer));
+std::string item(std::uint32_t type, const std::string& payload = "") {
+    return raw(type) + raw(static_cast<std::uint32_t>(payload.size())) + raw(~std::uint64_t{0}) + payload;
+}
+
+/// Crash information of these items.
+Bytes kcdata(const std::string& items) {
+    const auto bytes = std::as_bytes(std::span(items));
     return {bytes.begin(), bytes.end()};
 }
 
-const Bytes wholeCrash = kcdata({{begin, ""},
-                                 {0x805, raw(9)},
-                                 {0x805, raw(123)},
-                                 {0x80F, std::string("/usr/libexec/foo\0rest", 21)},
-                                 {0x815, raw(0x4 | 0x20000)},
-                                 {0x819, raw(3)},
-                                 {0x825, raw(std::uint64_t{0x5000})},
-                                 {0x826, raw(std::uint64_t{70})},
-                                 {0x827, raw(std::uint64_t{90})},
-                                 {end, ""},
-                                 {0x805, raw(1)}});
+const Bytes wholeCrash =
+    kcdata(item(begin) + item(0x805, raw(9)) + item(0x805, raw(123)) +
+           item(0x80F, std::string("/usr/libexec/foo\0rest", 21)) + item(0x815, raw(0x4 | 0x20000)) +
+           item(0x819, raw(3)) + item(0x825, raw(0x5000ull)) + item(0x826, raw(70ull)) +
+           item(0x827, raw(90ull)) + item(end) + item(0x805, raw(1)));
 
 class Corpse : public testing::Test {
   protected:
@@ -89,7 +82,8 @@ TEST_F(Corpse, IsMadeOfItsCrashInformation) {
 }
 
 TEST_F(Corpse, MakesDoWithMissingAndShortItemsButNotWithDamage) {
-    const auto corpse = corpseWith(kcdata({{begin, ""}, {0x805, "ab"}, {0x80F, std::string(2000, 'x')}}));
+    const auto corpse =
+        corpseWith(kcdata(item(begin) + item(0x805, "ab") + item(0x80F, std::string(2000, 'x'))));
     ASSERT_TRUE(corpse);
     EXPECT_EQ(corpse->pid(), -1);
     EXPECT_EQ(corpse->name().size(), 1023u) << "the longest path";
@@ -97,7 +91,7 @@ TEST_F(Corpse, MakesDoWithMissingAndShortItemsButNotWithDamage) {
     EXPECT_FALSE(corpse->is64bit() || corpse->isTranslated() || corpse->auxData());
     EXPECT_FALSE(TLCorpseProcess::initWithCorpse(MACH_PORT_NULL));
     EXPECT_FALSE(corpseWith({}));
-    EXPECT_FALSE(corpseWith(kcdata({{0x805, "abcd"}, {begin, ""}})));
+    EXPECT_FALSE(corpseWith(kcdata(item(0x805, "abcd") + item(begin))));
     kernel.fail("task_map_corpse_info_64", KERN_FAILURE);
     EXPECT_FALSE(corpseWith(wholeCrash));
     kernel.fail("mach_port_retain", KERN_NO_SPACE);

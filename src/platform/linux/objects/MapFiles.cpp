@@ -29,10 +29,13 @@ struct cachestat_counts {
 };
 constexpr long cachestatCall = 451;
 
+/// Where no disk is behind a mount, the list of mappings can name another device than the file itself does,
+/// as with subvolumes.
 bool isFileOf(const Descriptor& file, const Mapping& mapping) {
     struct stat status {};
     return fstat(file.number(), &status) == 0 && S_ISREG(status.st_mode) && status.st_ino == mapping.inode &&
-           major(status.st_dev) == mapping.deviceMajor && minor(status.st_dev) == mapping.deviceMinor;
+           major(status.st_dev) == mapping.deviceMajor &&
+           (minor(status.st_dev) == mapping.deviceMinor || mapping.deviceMajor == 0);
 }
 
 } // namespace
