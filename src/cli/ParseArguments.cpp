@@ -48,7 +48,7 @@ std::optional<TLError> setSort(TLTallyArgs& args, const char* value) {
         accepted += (accepted.empty() ? "" : ", ") + name;
     }
     return failure(TLErrorBadSort, formatted("Unrecognized argument '%s' to --sort.\nAccepted arguments: %s",
-                                             printable(value).c_str(), accepted.c_str()));
+                                             value, accepted.c_str()));
 }
 
 std::optional<TLError> addPid(TLTallyArgs& args, const char* value) {
@@ -57,7 +57,7 @@ std::optional<TLError> addPid(TLTallyArgs& args, const char* value) {
     if (end == value) {
         return failure(TLErrorBadPid, formatted("'%s' is not a valid integer for --pid.\n\nUse -p / --proc "
                                                 "if you meant to specify a process name.",
-                                                printable(value).c_str()));
+                                                value));
     }
     args.targetPids[static_cast<std::int32_t>(pid)] = std::nullopt;
     return std::nullopt;
@@ -78,8 +78,7 @@ double leadingDecimal(std::string_view text) {
 std::optional<TLError> setSampleInterval(TLTallyArgs& args, const char* value) {
     const double seconds = leadingDecimal(value);
     if (!std::isnormal(seconds) || seconds < 0) {
-        return failure(TLErrorBadInterval,
-                       formatted("Invalid sampling interval '%s'", printable(value).c_str()));
+        return failure(TLErrorBadInterval, formatted("Invalid sampling interval '%s'", value));
     }
     args.sampleInterval = seconds;
     return std::nullopt;

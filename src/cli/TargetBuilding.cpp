@@ -11,6 +11,8 @@
 #include <cstdio>
 #include <filesystem>
 #include <functional>
+#include <map>
+#include <string>
 #include <system_error>
 #include <utility>
 
@@ -32,7 +34,7 @@ TLTargetPids resolved(const std::set<std::string>& texts, std::vector<std::strin
 /// One building of the table. A step that returns false has ended it, with `error_` as the reason.
 class TargetBuilder {
   public:
-    explicit TargetBuilder(TLTallyArgs& args) : args_(args) {}
+    TargetBuilder(TLTallyArgs& args, bool says) : args_(args), says_(says) {}
 
     bool build();
 
@@ -50,6 +52,8 @@ class TargetBuilder {
     void resolveNames();
     bool addChildren();
     bool searchAllProcessesBut(TLPidSet excluded);
+    std::optional<TLProcessTable> allReadableProcesses(const TLPidSet& excluded) const;
+    void notice(const std::string& text) const;
     std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name) const;
 
     bool fail(int code, std::string message) {
@@ -58,6 +62,8 @@ class TargetBuilder {
     }
 
     TLTallyArgs& args_;
+    bool says_;                                    // notices
+    std::map<std::int32_t, std::string> shadowed_; // notices by the pid that a file's name stood for
     TLProcessTable table_;
     std::optional<TLError> error_;
 };
@@ -136,12 +142,12 @@ bool TargetBuilder::targetOneProcess(const std::string& text) {
         return false;
     }
     const auto& [pid, name] = *matches.begin();
+    shadowed_[pid] =
+        formatted("NOTICE: '%s' is also a file here; taken for process %d", printable(text).c_str(), pid);
     if (matches.size() > 1) {
-        std::fprintf(stderr,
-                     "NOTICE: '%s' is also a file here, so only process %d of the %zu that match is analyzed "
-                     "(use --pid for the others)\n",
-                     printable(text).c_str(), pid, matches.size());
+        shadowed_[pid] += formatted(", one of %zu that match (use --pid for the others)", matches.size());
     }
+    shadowed_[pid] += '\n';
     args_.targetPids[pid] = name;
     return true;
 }
@@ -158,24 +164,40 @@ TLPidSet TargetBuilder::exclusionSet() const {
 }
 
 bool TargetBuilder::targetEveryProcess(const TLPidSet& excluded) {
+    auto processes = allReadableProcesses(excluded);
+    if (processes) {
+        table_ = *std::move(processes);
+    }
+    return processes.has_value();
+}
+
+/// Every process but `excluded`; what may not be read is said in one line.
+std::optional<TLProcessTable> TargetBuilder::allReadableProcesses(const TLPidSet& excluded) const {
     TLUnreadableProcesses unreadable;
     auto processes = allProcessesExcludingPids(excluded, &unreadable);
-    if (!processes) {
-        return false;
-    }
     if (unreadable.count != 0) {
-        std::fprintf(stderr,
-                     "NOTICE: processes that could not be read and are left out: %zu (with %" PRIu64
-                     " bytes of resident anonymous memory)\n",
-                     unreadable.count, unreadable.residentAnonymous);
+        notice(formatted("NOTICE: processes that could not be read and are left out: %zu (with %" PRIu64
+                         " bytes of resident anonymous memory)\n",
+                         unreadable.count, unreadable.residentAnonymous));
     }
-    table_ = *std::move(processes);
-    return true;
+    return processes;
+}
+
+/// Says something of the whole run; a sample, whose targets are built again and again, says it no more.
+void TargetBuilder::notice(const std::string& text) const {
+    if (says_) {
+        std::fputs(text.c_str(), stderr);
+    }
 }
 
 bool TargetBuilder::targetNamedProcesses(const TLPidSet& excluded) {
     resolveNames();
     std::erase_if(args_.targetPids, [&](const auto& target) { return excluded.contains(target.first); });
+    for (const auto& [pid, text] : shadowed_) {
+        if (args_.targetPids.contains(pid)) {
+            notice(text);
+        }
+    }
     // After the exclusions: an excluded process that descends from a target is one again.
     if (args_.targetChildren && !addChildren()) {
         return false;
@@ -227,7 +249,7 @@ bool TargetBuilder::searchAllProcessesBut(TLPidSet excluded) {
         excluded.insert(pid);
     }
     excluded.insert(0);
-    auto processes = allProcessesExcludingPids(excluded);
+    auto processes = allReadableProcesses(excluded);
     if (!processes) {
         return false;
     }
@@ -238,7 +260,7 @@ bool TargetBuilder::searchAllProcessesBut(TLPidSet excluded) {
     return true;
 }
 
-/// The process of a targeted pid, or its corpse; null, with a message, when there is none.
+/// The process of a targeted pid, or its corpse; null when there is none.
 std::shared_ptr<TLProcess> TargetBuilder::liveTarget(std::int32_t pid, const TLTargetName& name) const {
     std::shared_ptr<TLProcess> process = TLProcess::processWithPid(pid);
     if (!process) {
@@ -267,7 +289,7 @@ std::shared_ptr<TLProcess> TargetBuilder::liveTarget(std::int32_t pid, const TLT
 } // namespace
 
 std::optional<TLProcessTable> targetProcessesForArgs(TLTallyArgs& args, std::optional<TLError>* error) {
-    TargetBuilder builder(args);
+    TargetBuilder builder(args, error != nullptr);
     const bool built = builder.build();
     if (error != nullptr) {
         *error = builder.error();

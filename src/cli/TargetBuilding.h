@@ -1,7 +1,7 @@
 // Target building: from the options to the processes that a run analyzes.
 //
 // Snapshots come first, because they may fix the analysis mode; then names and pids, exclusions, children and
-// corpses. A single target that cannot be analyzed costs a line on standard error and no more.
+// corpses. A single target that cannot be analyzed is said on standard error and ends nothing.
 
 #pragma once
 
@@ -17,9 +17,7 @@ namespace tally {
 
 /// Builds the target table. Changes `args`: what is recognised moves to `targetPids` or leaves
 /// `potentialTargetProcesses`, and a snapshot fixes the analysis mode.
-/// @param error when wanted: the reason of a failure, if it has one that can be told; with a table, what
-/// could
-///              not be resolved.
+/// @param error when wanted: why it failed, if that can be told; with a table, what could not be resolved.
 /// @return the table, which may be empty; absent when target building failed.
 std::optional<TLProcessTable> targetProcessesForArgs(TLTallyArgs& args, std::optional<TLError>* error);
 

@@ -74,7 +74,8 @@ TEST(ParseArguments, TheFirstFailureEndsItAndWarningsDoNot) {
         {"-f Bytes -h", TLErrorBadFormat,
          "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'."},
         {"--pid \033", TLErrorBadPid,
-         "'?' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process name."},
+         "'\033' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process "
+         "name."},
         {"--forkCorpse -a --unmapped", TLErrorCorpseOfAll,
          "--forkCorpse is not compatible with -a/--all due to corpse resource limits"},
         {"-y", none, "WARNING: -y/--summary options are deprecated because summary is the default mode\n"},

@@ -98,7 +98,7 @@ TEST_F(TargetBuilding, FollowsTheOptions) {
         {"-t server -x worker -x idle", "100 101 102 103 99000", refusedPid, ""}, // descendants come back
         {"-s idle server", "100", "", ""},
         {"-a -x worker server", "1 100 103 105", unread, ""},
-        {"--unmapped worker -x server", "[1] 101 102 [103] [105]", "", ""},
+        {"--unmapped worker -x server", "[1] 101 102 [103] [105]", unread, ""},
         {"--forkCorpse server worker", "100c", noCorpse, ""},
     };
     for (const auto& [words, targets, messages, unresolved] : cases) {
@@ -142,9 +142,11 @@ TEST_F(TargetBuilding, FilesAreSnapshotsFirstAndThenNames) {
     std::filesystem::current_path(before);
     std::filesystem::remove_all("shadows");
     EXPECT_EQ(one.targets, "100 101");
-    EXPECT_EQ(one.messages,
-              "NOTICE: 'worker' is also a file here, so only process 101 of the 2 that match is "
-              "analyzed (use --pid for the others)\n");
+    EXPECT_EQ(
+        one.messages,
+        "NOTICE: 'server' is also a file here; taken for process 100\n"
+        "NOTICE: 'worker' is also a file here; taken for process 101, one of 2 that match (use --pid for the "
+        "others)\n");
     EXPECT_EQ(one.error.message, "");
     EXPECT_EQ(none.targets, "none");
     EXPECT_EQ(none.error.code, TLErrorBadSnapshot);

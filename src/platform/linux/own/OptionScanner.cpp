@@ -4,6 +4,8 @@
 
 #include <getopt.h>
 
+#include <cstdlib>
+
 namespace tally::platform {
 
 struct OptionScanner::State {
@@ -21,7 +23,8 @@ OptionScanner::OptionScanner(int argc, char** argv, const char* shortOptions,
             {known.name, known.takesArgument ? required_argument : no_argument, nullptr, known.value});
     }
     state_->longOptions.push_back({});
-    optind = 0; // forget an earlier scan, its permutation included
+    unsetenv("POSIXLY_CORRECT"); // the command line alone decides, and options may follow names
+    optind = 0;                  // forget an earlier scan, its permutation included
     opterr = 1;
 }
 

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstdint>
+#include <system_error>
 #include <thread>
 #include <utility>
 
@@ -90,7 +91,13 @@ std::unique_ptr<SignalSource> dispatch_source_interrupt(InterruptSignals which,
         return nullptr;
     }
     signalEvent = event.number();
-    auto source = std::make_unique<InterruptSource>(std::move(event), std::move(handler));
+    std::unique_ptr<SignalSource> source;
+    try {
+        source = std::make_unique<InterruptSource>(std::move(event), std::move(handler));
+    } catch (const std::system_error&) { // no thread is to be had
+        signalEvent = -1;
+        return nullptr;
+    }
     catchSignal(SIGINT); // also where a shell had it ignored, as for what runs in the background
     if (which == InterruptSignals::sigintAndTermination) {
         for (const int signal : {SIGTERM, SIGHUP}) {
