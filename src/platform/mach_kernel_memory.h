@@ -26,13 +26,14 @@ struct mach_memory_site {
     std::uint64_t size = 0;   // bytes
     std::uint64_t mapped = 0; // bytes
     std::uint16_t zone = 0;
-    std::string name;
+    std::string name{};
 };
 
 struct mach_memory_record {
     std::vector<std::string> zone_names;
     std::vector<mach_zone_info> zones;
     std::vector<mach_memory_site> sites;
+    std::vector<std::string> notices; // texts for the kernel's warnings: what could not be read
 };
 
 /// Reads the whole record. @return KERN_SUCCESS, or an error, and then `*record` is empty.

@@ -1,6 +1,7 @@
 #include "process/TLProcess.h"
 
 #include "base/Format.h"
+#include "process/TLKernelProcess.h"
 #include "process/TLUserProcess.h"
 #include "vm/PhysTallyCollection.h"
 
@@ -17,10 +18,12 @@ std::shared_ptr<TLProcess> TLProcess::processWithBsdInfo(const proc_bsdinfo& inf
     if (refusal != nullptr) {
         *refusal = KERN_SUCCESS;
     }
-    if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) { // no kind of process reads the kernel
-        return nullptr;
+    std::shared_ptr<TLProcess> process;
+    if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
+        process = std::make_shared<TLKernelProcess>();
+    } else {
+        process = std::make_shared<TLUserProcess>();
     }
-    const std::shared_ptr<TLProcess> process = std::make_shared<TLUserProcess>();
     process->refusal_ = refusal;
     const bool isReadable = process->initWithBsdInfo(info);
     process->refusal_ = nullptr;

@@ -97,7 +97,7 @@ TEST_F(TargetBuilding, FollowsTheOptions) {
         {"-t worker guar\tded", "101 102 103", refusedPid, ""},                   // names are forgotten
         {"-t server -x worker -x idle", "100 101 102 103 99000", refusedPid, ""}, // descendants come back
         {"-s idle server", "100", "", ""},
-        {"-a -x worker server", "1 100 103 105", unread, ""},
+        {"-a -x worker server", "0 1 100 103 105", unread, ""},
         {"--unmapped worker -x server", "[1] 101 102 [103] [105]", unread, ""},
         {"--forkCorpse server worker", "100c", noCorpse, ""},
     };

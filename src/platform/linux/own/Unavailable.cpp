@@ -1,7 +1,6 @@
 // Calls that this system answers with "none".
 
 #include "platform/dyld_inspection.h"
-#include "platform/mach_kernel_memory.h"
 #include "platform/mach_task.h"
 #include "platform/quarry.h"
 #include "platform/runekit.h"
@@ -19,14 +18,8 @@ std::optional<dyld_shared_cache> dyld_shared_cache_for_task(mach_port_t /*task*/
     return std::nullopt;
 }
 
+// The kernel names its callers itself, so its symbols are not read for that.
 std::unique_ptr<RKKernelSymbolicator> RKCreateKernelSymbolicator() { return nullptr; }
-
-kern_return_t mach_memory_info(mach_memory_record* record) {
-    *record = mach_memory_record();
-    return KERN_NOT_SUPPORTED;
-}
-
-std::map<std::uint64_t, std::string> copyLoadedModuleIdentifiers() { return {}; }
 
 kern_return_t task_generate_corpse(mach_port_t /*task*/, mach_port_t* corpse) {
     *corpse = MACH_PORT_NULL;

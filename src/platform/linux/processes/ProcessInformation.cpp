@@ -1,6 +1,6 @@
 // Who the processes are: the list of pids, identity records, argument areas.
 //
-// Threads of the kernel are left out everywhere: their memory is the kernel's.
+// The kernel is process 0. Its threads are left out everywhere: their memory is the kernel's.
 
 #include "platform/bsd_process.h"
 #include "platform/linux/io/SystemFiles.h"
@@ -23,12 +23,14 @@ namespace tally::platform {
 
 namespace {
 
+constexpr std::int32_t kernelPid = 0;
+
 std::optional<std::vector<std::int32_t>> listPids() {
     const std::unique_ptr<DIR, int (*)(DIR*)> folder(opendir(systemPath("/proc").c_str()), closedir);
     if (!folder) {
         return std::nullopt;
     }
-    std::vector<std::int32_t> pids;
+    std::vector<std::int32_t> pids{kernelPid};
     while (const dirent* entry = readdir(folder.get())) {
         const char* name = entry->d_name;
         const char* end = name + std::strlen(name);
@@ -95,6 +97,14 @@ int proc_listallpids(std::span<std::int32_t> pids) {
 }
 
 int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
+    if (pid == kernelPid) {
+        *info = proc_bsdinfo();
+        info->pbi_flags = PROC_FLAG_SYSTEM | (sizeof(void*) == 8 ? PROC_FLAG_LP64 : 0);
+        info->pbi_status = SRUN;
+        copyName(info->pbi_comm, "kernel");
+        copyName(info->pbi_name, "kernel");
+        return sizeof(proc_bsdinfo);
+    }
     const std::optional<ProcessStat> stat = readUserProcess(pid);
     if (!stat) {
         return 0;
