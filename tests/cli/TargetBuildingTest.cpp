@@ -1,9 +1,11 @@
 #include "cli/TargetBuilding.h"
 #include "cli/CommandLine.h"
 #include "cli/ParseArguments.h"
+#include "platform/quarry.h"
 #include "platform/scripted/ScriptedKernel.h"
 #include "process/TLCorpseProcess.h"
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 
@@ -150,7 +152,48 @@ TEST_F(TargetBuilding, FilesAreSnapshotsFirstAndThenNames) {
     EXPECT_EQ(one.error.message, "");
     EXPECT_EQ(none.targets, "none");
     EXPECT_EQ(none.error.code, TLErrorBadSnapshot);
-    EXPECT_EQ(none.error.message, "Error opening heapsnap notes?: not a snapshot");
+    EXPECT_EQ(none.error.message,
+              "Error opening heapsnap notes?: not a heapsnap file: no JSON from byte 2 on");
+}
+
+TEST_F(TargetBuilding, SnapshotsFixTheModeOfTheRun) {
+    const std::filesystem::path before = std::filesystem::current_path();
+    std::filesystem::create_directories("snapshots");
+    std::filesystem::current_path("snapshots");
+    for (const bool isCharged : {true, false}) {
+        const QRYSnapshot snapshot{.pid = 100, .architecture = "X86-64", .showsPhysTally = isCharged};
+        std::ofstream(isCharged ? "a" : "b") << QRYDataWithSnapshot(snapshot);
+    }
+    const std::string conflict =
+        "Heapsnap was gathered with an analysis mode that conflicts with other heapsnaps or command line "
+        "arguments: ";
+    const std::string unmapped = "--unmapped is not compatible with heapsnaps (a).\nRemove the flag for best "
+                                 "effort 'unmapped' analysis "
+                                 "(which may be more than other tools such as regionlist(1) but less than "
+                                 "tally(1) analyzing a running "
+                                 "process).";
+    const struct {
+        std::string words, error;
+        std::size_t count;
+    } cases[] = {
+        {"a", "", 1},
+        {"a server", "", 2}, // of one pid: two targets
+        {"b", "", 1},
+        {"--vmObjectDirty b", "", 1},
+        {"--vmObjectDirty a", conflict + "a", 0},
+        {"a b", conflict + "b", 0},
+        {"--unmapped a", unmapped, 0},
+        {"-a a", "", 7}, // opened, and not analyzed
+        {"-a a b", conflict + "b", 0},
+    };
+    for (const auto& [words, error, count] : cases) {
+        const Built built = build(words);
+        EXPECT_EQ(built.error.message, error) << words;
+        EXPECT_EQ(built.error.code, error.empty() ? 0 : TLErrorSnapshotConflict) << words;
+        EXPECT_EQ(built.targets == "none" ? 0 : 1U + std::ranges::count(built.targets, ' '), count) << words;
+    }
+    std::filesystem::current_path(before);
+    std::filesystem::remove_all("snapshots");
 }
 
 } // namespace

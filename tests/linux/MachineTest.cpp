@@ -31,7 +31,7 @@ std::int64_t meminfo(const std::string& key) {
 
 /// Dirty bytes per category of the summary over all processes.
 std::map<std::string, std::int64_t> summary(const std::string& view) {
-    const Outcome outcome = run({TALLY_PROGRAM, "-a", "-f", "bytes", view});
+    const Outcome outcome = run({TALLY_PROGRAM, "-a", "-x", "kernel", "-f", "bytes", view});
     std::istringstream lines(
         outcome.output.substr(std::min(outcome.output.rfind("Summary Tally"), outcome.output.size())));
     std::map<std::string, std::int64_t> rows;

@@ -1,5 +1,4 @@
 #include "platform/scripted/ScriptedKernel.h"
-#include "process/TLHeapsnapProcess.h"
 #include "process/TLProcess.h"
 
 #include <gtest/gtest.h>
@@ -61,19 +60,6 @@ TEST(Process, IsMadeOfItsIdentityOrRefused) {
     }
     EXPECT_EQ(testing::internal::GetCapturedStderr(),
               "task_read_for_pid: "s + mach_error_string(KERN_NO_ACCESS) + "\n");
-}
-
-TEST(Snapshot, ThatIsNoneSaysWhy) {
-    ScriptedKernel kernel;
-    std::optional<TLError> error;
-    for (const auto& [path, reason] : {std::pair("/dev/zero", "Invalid argument"),
-                                       {"/", "Is a directory"},
-                                       {"none", "No such file or directory"},
-                                       {__FILE__, "heapsnap initialization failed with unknown error"}}) {
-        kernel.snapshotError.clear();
-        EXPECT_FALSE(processWithHeapsnap(path, &error));
-        EXPECT_EQ(error->message, reason);
-    }
 }
 
 TEST(AuxData, SumsWhatMayBeSummed) {

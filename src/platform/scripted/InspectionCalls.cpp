@@ -39,31 +39,6 @@ class KernelSymbolicator final : public RKKernelSymbolicator {
     std::vector<ScriptedKernelSymbol> symbols_;
 };
 
-class SnapshotGraph final : public QRYProcessObjectGraph {
-  public:
-    explicit SnapshotGraph(ScriptedSnapshot snapshot) : snapshot_(std::move(snapshot)) {}
-
-    std::int32_t pid() const override { return snapshot_.pid; }
-    std::string processName() const override { return snapshot_.processName; }
-    bool is64bit() const override { return snapshot_.is64bit; }
-    std::string processDescriptionString() const override { return snapshot_.processDescription; }
-    std::string binaryImagesDescription() const override { return snapshot_.binaryImagesDescription; }
-    std::uint32_t vmPageSize() const override { return snapshot_.vmPageSize; }
-    std::uint64_t physicalTally() const override { return snapshot_.physicalTally; }
-    std::uint64_t physicalTallyPeak() const override { return snapshot_.physicalTallyPeak; }
-    bool showsPhysTally() const override { return snapshot_.showsPhysTally; }
-    void enumerateRegions(const std::function<bool(const QRYVMRegion&)>& visitor) const override {
-        for (const QRYVMRegion& region : snapshot_.regions) {
-            if (visitor(region)) {
-                return;
-            }
-        }
-    }
-
-  private:
-    ScriptedSnapshot snapshot_;
-};
-
 } // namespace
 
 std::optional<dyld_shared_cache> dyld_shared_cache_for_task(mach_port_t task, kern_return_t* process_status,
@@ -127,15 +102,20 @@ std::optional<std::string> QRYRegionTypeDescriptionForTag(std::uint32_t tag) {
     return found == answer.kernel.tagDescriptions.end() ? formatted("Memory Tag %u", tag) : found->second;
 }
 
-std::unique_ptr<QRYProcessObjectGraph> QRYDirectedGraphWithData(std::string_view contents,
-                                                                std::string* error) {
-    const Answer answer("QRYDirectedGraphWithData", -1, {contents.size()});
-    const auto found = answer.kernel.snapshots.find(contents);
-    if (answer.fault != 0 || found == answer.kernel.snapshots.end()) {
-        *error = answer.kernel.snapshotError;
-        return nullptr;
+std::uint32_t QRYTagForRegionTypeDescription(std::string_view description) {
+    const Answer answer("QRYTagForRegionTypeDescription", -1, {}, description);
+    auto& descriptions = answer.kernel.tagDescriptions;
+    const auto known =
+        std::ranges::find(descriptions, description, [](const auto& entry) { return entry.second; });
+    if (known != descriptions.end()) {
+        return known->first;
     }
-    return std::make_unique<SnapshotGraph>(found->second);
+    std::uint32_t tag = 100; // free in the tool's own table
+    while (descriptions.contains(tag)) {
+        ++tag;
+    }
+    descriptions.emplace(tag, description);
+    return tag;
 }
 
 } // namespace tally::platform

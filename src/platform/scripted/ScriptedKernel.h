@@ -11,7 +11,6 @@
 
 #include "platform/clock.h"
 #include "platform/mach_kernel_memory.h"
-#include "platform/quarry.h"
 #include "platform/scripted/ScriptedTask.h"
 
 #include <cstdint>
@@ -49,20 +48,6 @@ struct ScriptedKernelSymbol {
     std::uint64_t size = 0; // bytes
     std::string name{};
     std::optional<RKKernelSymbolicator::SourceInfo> source{};
-};
-
-/// What a snapshot file holds.
-struct ScriptedSnapshot {
-    std::int32_t pid = 0;
-    std::string processName{};
-    bool is64bit = true;
-    std::string processDescription{};
-    std::string binaryImagesDescription{};
-    std::uint32_t vmPageSize = 4096; // bytes
-    std::uint64_t physicalTally = 0;
-    std::uint64_t physicalTallyPeak = 0;
-    bool showsPhysTally = true;
-    std::vector<QRYVMRegion> regions{}; // in rising address order
 };
 
 class ScriptedKernel {
@@ -133,11 +118,6 @@ class ScriptedKernel {
     mach_memory_record memory;
     std::map<std::uint64_t, std::string> loadedModules; // identifiers by load tag
     std::optional<std::vector<ScriptedKernelSymbol>> kernelSymbols;
-
-    // Files.
-
-    std::map<std::string, ScriptedSnapshot, std::less<>> snapshots; // by a file's complete contents
-    std::string snapshotError = "not a snapshot";                   // of every other file
 
     // The tool's own process.
 

@@ -2,7 +2,6 @@
 
 #include "platform/dyld_inspection.h"
 #include "platform/mach_task.h"
-#include "platform/quarry.h"
 #include "platform/runekit.h"
 
 #include <cerrno>
@@ -32,11 +31,5 @@ kern_return_t task_map_corpse_info_64(mach_port_t /*corpse*/, std::span<const st
 }
 
 kern_return_t vm_deallocate(std::span<const std::byte> /*buffer*/) { return KERN_SUCCESS; }
-
-std::unique_ptr<QRYProcessObjectGraph> QRYDirectedGraphWithData(std::string_view /*contents*/,
-                                                                std::string* error) {
-    *error = "not a heapsnap file";
-    return nullptr;
-}
 
 } // namespace tally::platform

@@ -93,6 +93,15 @@ std::uint32_t tagOfName(std::string_view name) {
     return name.empty() ? tags::untagged : namedSlots().tagOf(name);
 }
 
+std::uint32_t QRYTagForRegionTypeDescription(std::string_view description) {
+    for (const Description& own : ownTags) {
+        if (own.text == description) {
+            return own.tag;
+        }
+    }
+    return description.empty() ? tags::untagged : namedSlots().tagOf(description);
+}
+
 std::optional<std::string> QRYRegionTypeDescriptionForTag(std::uint32_t tag) {
     for (const Description& own : ownTags) {
         if (own.tag == tag) {
