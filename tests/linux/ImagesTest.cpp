@@ -116,11 +116,15 @@ TEST(ImageSegments, EveryMappingOfAnImageHasItsName) {
                             {0x70004000, 0x70005000, "r-x", 0, "", "__TEXT"},
                             {0x70007000, 0x7000a000, "rw-", 0x5000, "/a", "__DATA"},
                             {0x7000a000, 0x70011000, "rw-", 0, "", "__BSS"}});
-    // What lies behind the data is the heap, another file, or much more than the image's own.
-    for (const auto& [end, name] : {std::pair(0x7000e000U, "[heap]"), {0x7000e000, "/b"}, {0x70020000, ""}}) {
+    // What lies behind the data is the heap, another file, away from it, or much more than the image's own.
+    const std::vector<Mapped> others{{0x7000a000, 0x7000e000, "rw-", 0, "[heap]", ""},
+                                     {0x7000a000, 0x7000e000, "rw-", 0x8000, "/b", ""},
+                                     {0x7000b000, 0x7000c000, "rw-", 0, "", ""},
+                                     {0x7000a000, 0x70020000, "rw-", 0, "", ""}};
+    for (const Mapped& other : others) {
         expectSegments(layout, {{0x70003000, 0x70006000, "r-x", 0x2000, "/a", "__TEXT"},
                                 {0x70008000, 0x7000a000, "rw-", 0x6000, "/a", "__DATA"},
-                                {0x7000a000, end, "rw-", 0, name, ""}});
+                                other});
     }
     // Other linkers: the relocated part is a segment of its own and constants come first; or code comes
     // first, is not moved, and lies more than 4 GiB below memory that the file has nothing of.
@@ -139,6 +143,24 @@ TEST(ImageSegments, EveryMappingOfAnImageHasItsName) {
                     {0x600000000, 0x600002000, "rw-", 0, "", "__BSS"}});
 }
 
+/// The segments of a process's images, by where they end, and the images' paths.
+struct Images {
+    std::map<std::uint64_t, std::string> segments;
+    std::set<std::string> paths;
+
+    explicit Images(const test::Puppet& puppet) {
+        mach_port_t port = MACH_PORT_NULL;
+        EXPECT_EQ(task_read_for_pid(puppet.pid(), &port), KERN_SUCCESS);
+        const PortRight task(port);
+        RKForeachSymbolOwner(port, [&](const RKSymbolOwner& owner) {
+            paths.insert(owner.path);
+            for (const RKSegment& segment : owner.segments) {
+                segments[segment.start + segment.size] = segment.name;
+            }
+        });
+    }
+};
+
 TEST(Images, NothingThatAProcessMapsOfAnImageIsWithoutItsName) {
     const test::TemporaryFolder folder;
     const std::string path = folder.path() + "/program";
@@ -147,31 +169,26 @@ TEST(Images, NothingThatAProcessMapsOfAnImageIsWithoutItsName) {
     std::filesystem::remove(path);
     std::filesystem::copy_file(files + "/cut-64", path); // something else takes its place
 
-    mach_port_t port = MACH_PORT_NULL;
-    ASSERT_EQ(task_read_for_pid(puppet.pid(), &port), KERN_SUCCESS);
-    const PortRight task(port);
-    std::map<std::uint64_t, std::string> names; // of segments, by where they end
-    std::set<std::string> paths;
-    RKForeachSymbolOwner(port, [&](const RKSymbolOwner& owner) {
-        paths.insert(owner.path);
-        for (const RKSegment& segment : owner.segments) {
-            names[segment.start + segment.size] = segment.name;
-        }
-    });
-    EXPECT_TRUE(paths.contains("[vdso]"));
-    EXPECT_EQ(paths.contains(path + " (deleted)"), geteuid() == 0); // only root can still open it
+    const Images images(puppet);
+    EXPECT_TRUE(images.paths.contains("[vdso]"));
+    EXPECT_EQ(images.paths.contains(path + " (deleted)"), geteuid() == 0); // only root can still open it
     std::set<std::string> seen;
     for (const Mapping& mapping :
          decodeMaps(readSystemFile(processFolder(puppet.pid()) + "/maps").value_or(""))) {
-        if (paths.contains(mapping.name)) {
-            const auto segment = names.upper_bound(mapping.start);
-            ASSERT_NE(segment, names.end());
+        if (images.paths.contains(mapping.name)) {
+            const auto segment = images.segments.upper_bound(mapping.start);
+            ASSERT_NE(segment, images.segments.end());
             EXPECT_EQ(mapping.writable, segment->second == "__DATA");
             EXPECT_TRUE(!mapping.executable || segment->second == "__TEXT");
             seen.insert(segment->second);
         }
     }
     EXPECT_EQ(seen, (std::set<std::string>{"__LINKEDIT", "__TEXT", "__DATA_CONST", "__DATA"}));
+
+    const std::string inMemory = "/dev/shm/tally-test-image-" + std::to_string(getpid());
+    std::filesystem::copy_file(PUPPET_PROGRAM, inMemory);
+    EXPECT_FALSE(Images(test::Puppet({"idle"}, inMemory)).paths.contains(inMemory)) << "it is shared memory";
+    std::filesystem::remove(inMemory);
 }
 
 TEST(ThreadLayoutTable, AFileIsReadByOneOfManyAndAgainWhenItHasChanged) {

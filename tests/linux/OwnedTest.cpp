@@ -35,7 +35,9 @@ std::vector<OwnedRecord> ownedBy(const Puppet& puppet) {
     std::memcpy(&count, reply.data(), sizeof count);
     EXPECT_EQ(length, sizeof count + count * sizeof(OwnedRecord));
     std::vector<OwnedRecord> records(count);
-    std::memcpy(static_cast<void*>(records.data()), &reply[sizeof count], count * sizeof(OwnedRecord));
+    for (std::size_t i = 0; i < count; ++i) {
+        std::memcpy(&records[i], &reply[sizeof count + i * sizeof(OwnedRecord)], sizeof(OwnedRecord));
+    }
     return records;
 }
 
@@ -76,9 +78,9 @@ TEST(Owned, WhatADescriptorOrASegmentAloneKeepsIsListedToTheByte) {
     }
 }
 
-/// A file on a tmpfs that goes away with its holder at the latest.
+/// A file on a tmpfs, which its name alone does not delete, until it is deleted or the holder goes away.
 struct SharedFile {
-    std::string path = "/dev/shm/tally-test-owned-" + std::to_string(getpid());
+    std::string path = "/dev/shm/tally-test-owned-" + std::to_string(getpid()) + " (deleted)";
     explicit SharedFile(std::size_t pages) { std::ofstream(path) << std::string(pages * 4096, 'x'); }
     ~SharedFile() { unlink(path.c_str()); }
 };

@@ -88,11 +88,13 @@ void allocators() {
     tellTag("longer-than-its-mapping", memory(size, noGuard, 0, 2 * size | 2), 0);
     tellTag("not-marked-as-mapped", memory(size, noGuard, 0, size | 1), 0);
     tellTag("no-thread-above-a-guard", memory(size, page), 0);
-    const auto aligned =
-        (reinterpret_cast<std::uintptr_t>(memory(3 * heapSize, noGuard)) + heapSize - 1) & ~(heapSize - 1);
-    auto* words = reinterpret_cast<Word*>(aligned);
-    words[0] = aligned + 0x30; // the header of a heap, but with sizes that are not the mapping's
-    words[2] = words[3] + page;
+    // The header of a heap, where one can be, but with sizes that are not its mapping's.
+    auto* words =
+        reinterpret_cast<Word*>(mmap(reinterpret_cast<void*>(0x100 * heapSize), size, PROT_READ | PROT_WRITE,
+                                     MAP_PRIVATE | MAP_ANONYMOUS | MAP_FIXED_NOREPLACE, -1, 0));
+    words[0] = 0x100 * heapSize + 0x30;
+    words[2] = 32 * page;
+    words[3] = 32 * page;
     tellTag("no-arena", words, 0);
     Word* closed = memory(page, noGuard);
     mprotect(const_cast<std::uint64_t*>(closed), page, PROT_NONE);

@@ -77,7 +77,7 @@ std::optional<Records> ownedBy(Task& task) {
     Records records;
     MappedObjects mapped(*walk);
     const bool isListed = forEachHeldObject(walk->folder(), [&](const OwnedRecord& record) {
-        if (!records.contains(record.objectId) && !mapped.contain(record.objectId)) {
+        if (!mapped.contain(record.objectId)) {
             records.emplace(record.objectId, record);
         }
     });
