@@ -161,7 +161,7 @@ TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
         {card, "drm-client-id: 9\ndrm-resident-memory: 99999999999999999 GiB\n", {}},
         {"anon_inode:bpf-map",
          "max_entries:\t2\nmemlock:\t36864\nmap_id:\t3\n",
-         {48, 36864, 36864, 36864, 0}},
+         {49, 36864, 36864, 36864, 0}},
         {"anon_inode:bpf-map", "memlock:\t36864\n", {}},
         {"anon_inode:[eventfd]", "memlock:\t36864\nmap_id:\t4\n", {}},
         {"/" + std::string(4000, 'x') + " (deleted)", "ino:\t91\nsize:\t65536\n", {}},

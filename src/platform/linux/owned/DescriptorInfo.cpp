@@ -105,7 +105,7 @@ std::optional<OwnedRecord> decodeGraphicsClient(std::string_view text) {
 
 std::optional<OwnedRecord> decodeBpfMap(std::string_view text) {
     std::optional<std::uint64_t> map;
-    OwnedRecord record;
+    OwnedRecord record{.flags = OwnedRecord::notPurgeable | OwnedRecord::notCharged};
     forEachLine(text, [&](std::string_view key, std::string_view value) {
         std::uint64_t number = 0;
         if (key == "map_id" && takeNumber(value, &number)) {

@@ -21,7 +21,8 @@ std::optional<OwnedRecord> decodeDmaBuffer(std::string_view text);
 /// machine's.
 std::optional<OwnedRecord> decodeGraphicsClient(std::string_view text);
 
-/// A map of the kernel's virtual machine ("anon_inode:bpf-map").
+/// A map of the kernel's virtual machine ("anon_inode:bpf-map"). It is not charged: its memory is the
+/// kernel's own and counts there.
 std::optional<OwnedRecord> decodeBpfMap(std::string_view text);
 
 } // namespace tally::platform

@@ -9,6 +9,7 @@ namespace tally::platform {
 /// Sizes in bytes.
 struct OwnedRecord {
     // Flags.
+    static constexpr std::uint64_t notCharged = 1; // somebody else pays for it
     static constexpr std::uint64_t notPurgeable = 3 << 4;
     static constexpr std::uint64_t graphics = 4 << 1; // ledger tag
 
