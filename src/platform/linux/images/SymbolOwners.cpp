@@ -3,12 +3,11 @@
 #include "platform/linux/images/ImageSegments.h"
 #include "platform/linux/images/LayoutTable.h"
 #include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/walk/Task.h"
 #include "platform/runekit.h"
 
-#include <algorithm>
-#include <utility>
-#include <vector>
+#include <map>
 
 namespace tally::platform {
 
@@ -16,11 +15,17 @@ namespace {
 
 constexpr const char* kernelCode = "[vdso]";
 
-/// Whether an image made so far covers the mapping: its code can be several mappings.
-bool isCovered(const std::vector<std::pair<std::uint64_t, std::uint64_t>>& covered, const Mapping& mapping) {
-    return std::any_of(covered.begin(), covered.end(), [&](const auto& range) {
-        return range.first <= mapping.start && mapping.end <= range.second;
-    });
+// Loaders make a handful of the same file at most. Somebody who maps one thousands of times shall not hold up
+// everybody's measurement.
+constexpr int mostInstances = 64;
+
+/// The code of the images made so far: where a range ends, and where it begins.
+using CodeRanges = std::map<std::uint64_t, std::uint64_t>;
+
+/// Whether the mapping is in one of them: an image's code can be several mappings.
+bool isCovered(const CodeRanges& ranges, const Mapping& mapping) {
+    const auto range = ranges.upper_bound(mapping.start);
+    return range != ranges.end() && range->second <= mapping.start;
 }
 
 } // namespace
@@ -32,17 +37,18 @@ void RKForeachSymbolOwner(mach_port_t port, const std::function<void(const RKSym
     if (walk == nullptr) {
         return; // the walk of the regions meets that too, and reports it
     }
-    std::vector<std::pair<std::uint64_t, std::uint64_t>> text; // address ranges of the images' code
+    CodeRanges code;
+    std::map<std::uint64_t, int> instances; // by object id of the file
     for (const Mapping& mapping : walk->mappings()) {
         if (mapping.name == kernelCode) {
             handler({kernelCode, mapping.start, {{mapping.start, mapping.size(), "__TEXT"}}});
         }
-        if (!mapping.executable || !mapping.isFileBacked() || isCovered(text, mapping)) {
+        if (!mapping.executable || !mapping.isFileBacked() || isCovered(code, mapping)) {
             continue;
         }
         // A file in memory is shared memory first of all: its pages are dirty, whoever maps them.
         const BackingObject object = backingOf(mapping, walk->folder());
-        if (object.backing != Backing::file) {
+        if (object.backing != Backing::file || ++instances[objectIdOfFile(object)] > mostInstances) {
             continue;
         }
         const auto layout = layoutOfFile(object, walk->folder(), mapping);
@@ -54,7 +60,7 @@ void RKForeachSymbolOwner(mach_port_t port, const std::function<void(const RKSym
                             segmentsOf(*layout, *bias, mapping, walk->mappings())};
         for (const RKSegment& segment : owner.segments) {
             if (segment.name == "__TEXT") {
-                text.emplace_back(segment.start, segment.start + segment.size);
+                code.emplace(segment.start + segment.size, segment.start);
             }
         }
         handler(owner);

@@ -49,7 +49,7 @@ std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::stri
     OwnedRecord record;
     record.objectId = objectIdOfFile(object);
     record.residentSize = status.stx_blocks * blockSize; // what is swapped out included
-    record.virtualSize = std::max(wholePages(status.stx_size), record.residentSize);
+    record.virtualSize = std::max<std::uint64_t>(status.stx_size, record.residentSize);
     if (isHuge) {
         record.wiredSize = record.residentSize;
     } else if (record.residentSize != 0 && machineState().swapInUse) {
@@ -86,8 +86,9 @@ bool forEachHeldObject(const std::string& folder, const std::function<void(const
         if (length <= 0) {
             continue; // closed meanwhile, or no descriptor
         }
-        const auto record = recordOf(folder, number, {link.data(), static_cast<std::size_t>(length)});
+        auto record = recordOf(folder, number, {link.data(), static_cast<std::size_t>(length)});
         if (record && record->holdsMemory()) {
+            record->virtualSize = wholePages(record->virtualSize);
             found(*record);
         }
     }

@@ -16,6 +16,7 @@ constexpr std::uint64_t heapSize = 64 << 20; // of an arena, which heaps are ali
 constexpr std::uint64_t smallestMappedChunk = 128 << 10;
 constexpr std::uint64_t chunkIsMapped = 2; // flag in a chunk's size
 constexpr int mostChunks = 64;             // that are followed: after so many in a row there is no doubt
+constexpr int mostCandidates = 8192;       // about 12 ms
 
 /// The first words of a heap, as the C library lays them out.
 struct HeapHeader {
@@ -96,15 +97,19 @@ class AllocatorRules {
 void tagAllocatorMemory(const std::string& folder, std::span<const Mapping> mappings,
                         const PageStates& states, std::span<std::uint32_t> tags) {
     AllocatorRules rules(folder, mappings);
-    for (std::size_t i = 0; i < mappings.size(); ++i) {
+    int candidates = 0;
+    for (std::size_t i = 0; i < mappings.size() && candidates < mostCandidates; ++i) {
         const Mapping& mapping = mappings[i];
         if (tags[i] != tags::untagged || !isNamelessMemory(mapping) || !mapping.writable ||
             states.mappings[i].anonymous == 0) {
             continue;
         }
-        if (mapping.start % heapSize == 0 && rules.isArena(mapping)) {
+        const bool canBeArena = mapping.start % heapSize == 0;
+        const bool canBeChunks = mapping.size() >= smallestMappedChunk;
+        candidates += canBeArena || canBeChunks ? 1 : 0;
+        if (canBeArena && rules.isArena(mapping)) {
             tags[i] = tags::mallocArena;
-        } else if (mapping.size() >= smallestMappedChunk && rules.isMappedChunks(mapping)) {
+        } else if (canBeChunks && rules.isMappedChunks(mapping)) {
             tags[i] = tags::mallocLarge;
         }
     }

@@ -3,7 +3,8 @@
 // Arenas: a heap of an arena begins at a multiple of 64 MiB with the address of its arena, the heap before it
 // and its sizes. Large allocations: a mapped chunk begins with a word that is 0 and its size, and ends where
 // the next begins. Both are checked against the mapping, so that other memory is hardly ever taken for one.
-// Cost: two short reads a candidate, and only where pages are present.
+// Cost: two short reads a candidate, and only where pages are present; of a process with very many candidates
+// the first are looked at.
 
 #pragma once
 

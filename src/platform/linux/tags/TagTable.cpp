@@ -3,6 +3,8 @@
 #include "platform/quarry.h"
 
 #include <algorithm>
+#include <functional>
+#include <map>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -48,20 +50,21 @@ constexpr KnownName knownNames[] = {
     {"Go: heap", tags::goHeap},
 };
 
-/// The names that got a slot of their own, by slot.
+/// The names that got a slot of their own, in the order of the slots.
 class NamedSlots {
   public:
     std::uint32_t tagOf(std::string_view name) {
         const std::scoped_lock lock(mutex_);
-        const auto found = std::find(names_.begin(), names_.end(), name);
-        if (found == names_.end()) {
-            if (names_.size() > tags::lastNamed - tags::firstNamed) {
-                return tags::otherNamed;
-            }
-            names_.emplace_back(name);
-            return tags::firstNamed + static_cast<std::uint32_t>(names_.size()) - 1;
+        const auto found = tags_.find(name);
+        if (found != tags_.end()) {
+            return found->second;
         }
-        return tags::firstNamed + static_cast<std::uint32_t>(found - names_.begin());
+        const auto tag = static_cast<std::uint32_t>(tags::firstNamed + names_.size());
+        if (tag > tags::lastNamed) {
+            return tags::otherNamed;
+        }
+        names_.emplace_back(name);
+        return tags_.emplace(name, tag).first->second;
     }
 
     std::optional<std::string> nameOf(std::uint32_t tag) {
@@ -74,6 +77,7 @@ class NamedSlots {
   private:
     std::mutex mutex_;
     std::vector<std::string> names_;
+    std::map<std::string, std::uint32_t, std::less<>> tags_;
 };
 
 NamedSlots& namedSlots() {
