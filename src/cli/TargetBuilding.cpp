@@ -165,10 +165,11 @@ TLPidSet TargetBuilder::exclusionSet() const {
 
 bool TargetBuilder::targetEveryProcess(const TLPidSet& excluded) {
     auto processes = allReadableProcesses(excluded);
-    if (processes) {
-        table_ = *std::move(processes);
+    if (!processes) {
+        return false;
     }
-    return processes.has_value();
+    table_ = *std::move(processes);
+    return true;
 }
 
 /// Every process but `excluded`; what may not be read is said in one line.
