@@ -7,6 +7,8 @@
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <chrono>
+#include <thread>
 
 namespace tally::platform {
 
@@ -29,11 +31,15 @@ struct pm_scan_arg {
 static_assert(sizeof(pm_scan_arg) == 96);
 
 constexpr unsigned long PAGEMAP_SCAN = _IOWR('f', 16, pm_scan_arg);
-constexpr std::uint64_t mostPages = (16 << 20) / basePage;
+constexpr std::uint64_t mostPages = (64 << 20) / basePage;
 constexpr std::uint64_t mostAddresses = 1 << 30;
 // Of a call that gives more regions than this, the kernel's own note of where it ended is stale (seen
 // on 6.18).
 constexpr std::size_t mostRegions = 512;
+
+/// A thread that waits to change the address space is only woken when a scan ends: the next one would take
+/// the lock before it, again and again, for milliseconds.
+void letWaitersIn() { std::this_thread::sleep_for(std::chrono::microseconds(1)); }
 
 } // namespace
 
@@ -71,6 +77,9 @@ int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile
         }
         const bool complete = step->regions.size() < used.size() && pages < mostPages;
         step->resume = complete ? query.end : step->regions.back().end;
+        if (pages >= mostPages && step->resume < end) {
+            letWaitersIn();
+        }
         return 0;
     }
 }

@@ -27,8 +27,8 @@ struct PageScanStep {
     std::uint64_t resume = 0;            // address at which to go on
 };
 
-/// Scans [start, end) for present and swapped pages, at most 16 MiB of them or 1 GiB of addresses a call: the
-/// target's own calls that change its address space wait for a scan.
+/// Scans [start, end) for present and swapped pages, at most 64 MiB of them or 1 GiB of addresses a call: the
+/// target's own calls that change its address space wait for a scan, and are let in between two long ones.
 /// @param withFile whether to tell file pages from others, which costs the kernel twice the time.
 /// @return 0, or the error: ESRCH when the task has ended, ENOTTY when this kernel has no such query.
 int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile, std::span<PageRegion> room,
