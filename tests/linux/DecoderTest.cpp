@@ -43,10 +43,11 @@ TEST(DecodeMaps, ReadsWhateverAPathHolds) {
             EXPECT_EQ(mapping.name, c.name);
         }
     }
-    const std::vector<Mapping> two =
-        decodeMaps("1000-2000 rw-s 00003000 fd:10 9 /a\n"
-                   "ffffffffff600000-ffffffffff601000 --xp 00000000 00:00 0 [vsyscall]\n"
-                   "3000-4000 ---p 00000000 00:00 0");
+    std::vector<Mapping> two;
+    decodeMaps("1000-2000 rw-s 00003000 fd:10 9 /a\n", &two);
+    decodeMaps("ffffffffff600000-ffffffffff601000 --xp 00000000 00:00 0 [vsyscall]\n"
+               "3000-4000 ---p 00000000 00:00 0",
+               &two);
     ASSERT_EQ(two.size(), 2U);
     EXPECT_TRUE(two[0].shared && two[0].writable && two[0].readable && !two[0].executable);
     EXPECT_EQ(two[0].fileOffset, 0x3000U);
@@ -56,16 +57,15 @@ TEST(DecodeMaps, ReadsWhateverAPathHolds) {
 }
 
 TEST(DecodeSmaps, TakesTheFiguresOfEachMapping) {
-    const std::vector<SmapsEntry> entries =
-        decodeSmaps("1000-3000 rw-p 00000000 00:00 0\n"
-                    "KernelPageSize:        4 kB\nRss:  8 kB\nAnonymous: 8 kB\n"
-                    "LazyFree:  4 kB\nSwap: 12 kB\nSwapPss: 3 kB\n"
-                    "VmFlags: rd wr mr lo ac\n"
-                    "ffffffffff600000-ffffffffff601000 --xp 0 00:00 0 [vsyscall]\n"
-                    "Rss: 4 kB\n"
-                    "3000-4000 rw-s 00000000 00:01 7 /x\n"
-                    "Shared_Dirty: 4 kB\nPrivate_Dirty: 8 kB\nRss: x kB\n"
-                    "Private_Hugetlb: 2048 kB\nVmFlags: rd look");
+    std::vector<SmapsEntry> entries;
+    for (const char* lines : {"Rss: 4 kB\n1000-3000 rw-p 00000000 00:00 0\n"
+                              "KernelPageSize:        4 kB\nRss:  8 kB\nAnonymous: 8 kB\n"
+                              "LazyFree:  4 kB\nSwap: 12 kB\nSwapPss: 3 kB\n",
+                              "VmFlags: rd wr mr lo ac\n3000-4000 rw-s 00000000 00:01 7 /x\n"
+                              "Shared_Dirty: 4 kB\nPrivate_Dirty: 8 kB\nRss: x kB\n"
+                              "Private_Hugetlb: 2048 kB\nVmFlags: rd look"}) {
+        decodeSmaps(lines, &entries);
+    }
     ASSERT_EQ(entries.size(), 2U);
     EXPECT_EQ(entries[0].resident, 8192U);
     EXPECT_EQ(entries[0].lazyFree, 4096U);

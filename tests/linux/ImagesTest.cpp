@@ -173,8 +173,9 @@ TEST(Images, NothingThatAProcessMapsOfAnImageIsWithoutItsName) {
     EXPECT_TRUE(images.paths.contains("[vdso]"));
     EXPECT_EQ(images.paths.contains(path + " (deleted)"), geteuid() == 0); // only root can still open it
     std::set<std::string> seen;
-    for (const Mapping& mapping :
-         decodeMaps(readSystemFile(processFolder(puppet.pid()) + "/maps").value_or(""))) {
+    std::vector<Mapping> mappings;
+    decodeMaps(readSystemFile(processFolder(puppet.pid()) + "/maps").value_or(""), &mappings);
+    for (const Mapping& mapping : mappings) {
         if (images.paths.contains(mapping.name)) {
             const auto segment = images.segments.upper_bound(mapping.start);
             ASSERT_NE(segment, images.segments.end());

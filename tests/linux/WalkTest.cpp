@@ -5,6 +5,7 @@
 #include "platform/gather.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/walk/DecodeMaps.h"
+#include "platform/linux/walk/SmapsOfProcess.h"
 #include "platform/mach_task.h"
 #include "platform/mach_vm.h"
 
@@ -122,12 +123,16 @@ TEST(Walk, ShowsEveryKindOfMemoryAsSmapsAndTheProcessItselfDo) {
 
     std::uint64_t memfdResident = 0;
     std::uint64_t lazyFree = 0;
-    for (const SmapsEntry& entry :
-         decodeSmaps(readSystemFile(processFolder(puppet.pid()) + "/smaps").value_or(""))) {
-        SCOPED_TRACE(entry.mapping.name);
-        const Sums sums = sumsOf(whole, entry.mapping.start, entry.mapping.end);
+    std::vector<Mapping> mappings;
+    decodeMaps(readSystemFile(processFolder(puppet.pid()) + "/maps").value_or(""), &mappings);
+    SmapsOfProcess smaps(processFolder(puppet.pid()));
+    for (const Mapping& mapping : mappings) {
+        SCOPED_TRACE(mapping.name);
+        ASSERT_NE(smaps.entryFor(mapping), nullptr);
+        const SmapsEntry entry = *smaps.entryFor(mapping);
+        const Sums sums = sumsOf(whole, mapping.start, mapping.end);
         EXPECT_TRUE(sums.complete);
-        if (entry.mapping.name == "/memfd:zoo (deleted)") {
+        if (mapping.name == "/memfd:zoo (deleted)") {
             memfdResident += sums.resident; // mapped twice
             continue;
         }

@@ -32,19 +32,44 @@ Descriptor openForReading(const std::string& path) {
     return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
 }
 
-bool readToEnd(const Descriptor& file, std::string& text) {
-    text.clear();
+namespace {
+
+/// Reads from `file` to its end and hands on each block as it comes. @return false on failure, with errno.
+template <typename Take>
+bool readBlocks(const Descriptor& file, const Take& take) {
     std::array<char, 16384> buffer; // the kernel's text files give a few KiB a read at most
     for (;;) {
         const ssize_t count = read(file.number(), buffer.data(), buffer.size());
         if (count > 0) {
-            text.append(buffer.data(), static_cast<std::size_t>(count));
+            take(std::string_view(buffer.data(), static_cast<std::size_t>(count)));
         } else if (count == 0) {
             return true;
         } else if (errno != EINTR) {
             return false;
         }
     }
+}
+
+} // namespace
+
+bool readToEnd(const Descriptor& file, std::string& text) {
+    text.clear();
+    return readBlocks(file, [&](std::string_view block) { text += block; });
+}
+
+bool readLines(const Descriptor& file, const std::function<void(std::string_view)>& take) {
+    std::string begun; // the start of a line whose end has not come yet
+    const bool isWhole = readBlocks(file, [&](std::string_view block) {
+        const std::size_t end = block.rfind('\n') + 1; // 0 where no line ends
+        if (end != 0) {
+            begun += block.substr(0, end);
+            take(begun);
+            begun.clear();
+        }
+        begun += block.substr(end);
+    });
+    take(begun);
+    return isWhole;
 }
 
 std::optional<std::string> readSystemFile(const std::string& path) {

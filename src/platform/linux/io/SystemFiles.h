@@ -9,6 +9,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -31,6 +32,10 @@ Descriptor openForReading(const std::string& path);
 /// Reads from `file` to its end into `text` (replaced). @return false on failure, with errno; `text` then
 /// holds what came before.
 bool readToEnd(const Descriptor& file, std::string& text);
+
+/// Reads from `file` to its end and hands on what it reads, a block of whole lines at a time: for texts that
+/// grow with the process that they tell of. @return as readToEnd.
+bool readLines(const Descriptor& file, const std::function<void(std::string_view lines)>& take);
 
 /// The whole file at `path`; absent on failure, with errno.
 std::optional<std::string> readSystemFile(const std::string& path);

@@ -50,8 +50,6 @@ void decodeSmapsField(std::string_view line, SmapsEntry& entry) {
         for (std::string_view flag = takeWord(line); !flag.empty(); flag = takeWord(line)) {
             entry.locked |= flag == "lo";
         }
-    } else if (key == "KernelPageSize" && takeNumber(line, &kibibytes)) {
-        entry.mapping.pageSize = kibibytes * 1024;
     } else if (std::uint64_t* field = sizeField(entry, key);
                field != nullptr && takeNumber(line, &kibibytes)) {
         *field += kibibytes * 1024;
@@ -86,33 +84,25 @@ bool decodeMapsLine(std::string_view line, Mapping* mapping) {
     return true;
 }
 
-std::vector<Mapping> decodeMaps(std::string_view text) {
-    std::vector<Mapping> mappings;
+void decodeMaps(std::string_view lines, std::vector<Mapping>* mappings) {
     Mapping mapping;
-    while (!text.empty()) {
-        if (decodeMapsLine(takeLine(text), &mapping) && mapping.name != "[vsyscall]") {
-            mappings.push_back(std::move(mapping));
+    while (!lines.empty()) {
+        if (decodeMapsLine(takeLine(lines), &mapping) && mapping.name != "[vsyscall]") {
+            mappings->push_back(std::move(mapping));
         }
     }
-    return mappings;
 }
 
-std::vector<SmapsEntry> decodeSmaps(std::string_view text) {
-    std::vector<SmapsEntry> entries;
+void decodeSmaps(std::string_view lines, std::vector<SmapsEntry>* entries) {
     Mapping mapping;
-    bool skipping = true; // until the first entry, and through one that is left out
-    while (!text.empty()) {
-        const std::string_view line = takeLine(text);
+    while (!lines.empty()) {
+        const std::string_view line = takeLine(lines);
         if (decodeMapsLine(line, &mapping)) {
-            skipping = mapping.name == "[vsyscall]";
-            if (!skipping) {
-                entries.push_back({.mapping = std::move(mapping)});
-            }
-        } else if (!skipping) {
-            decodeSmapsField(line, entries.back());
+            entries->push_back({.start = mapping.start});
+        } else if (!entries->empty()) {
+            decodeSmapsField(line, entries->back());
         }
     }
-    return entries;
 }
 
 std::uint64_t decodeRollupLazyFree(std::string_view text) {

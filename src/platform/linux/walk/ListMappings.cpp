@@ -108,12 +108,8 @@ bool listMappings(const Descriptor& maps, std::vector<Mapping>* mappings) {
             queriesAnswered = false;
         }
     }
-    std::string text;
-    if (!readToEnd(maps, text)) {
-        return false;
-    }
-    *mappings = decodeMaps(text);
-    return true;
+    mappings->clear();
+    return readLines(maps, [&](std::string_view lines) { decodeMaps(lines, mappings); });
 }
 
 } // namespace tally::platform

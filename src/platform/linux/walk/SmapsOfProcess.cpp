@@ -8,7 +8,12 @@ namespace tally::platform {
 
 bool SmapsOfProcess::isReadable() {
     if (!entries_) {
-        entries_ = decodeSmaps(readSystemFile(folder_ + "/smaps").value_or(""));
+        entries_.emplace();
+        const Descriptor file = openForReading(folder_ + "/smaps");
+        const auto take = [&](std::string_view lines) { decodeSmaps(lines, &*entries_); };
+        if (!file.isOpen() || !readLines(file, take)) {
+            entries_->clear();
+        }
     }
     return !entries_->empty();
 }
@@ -17,10 +22,10 @@ const SmapsEntry* SmapsOfProcess::entryFor(const Mapping& mapping) {
     if (!isReadable()) {
         return nullptr;
     }
-    const auto found = std::lower_bound(
-        entries_->begin(), entries_->end(), mapping.start,
-        [](const SmapsEntry& entry, std::uint64_t start) { return entry.mapping.start < start; });
-    return found != entries_->end() && found->mapping.start == mapping.start ? &*found : nullptr;
+    const auto found =
+        std::lower_bound(entries_->begin(), entries_->end(), mapping.start,
+                         [](const SmapsEntry& entry, std::uint64_t start) { return entry.start < start; });
+    return found != entries_->end() && found->start == mapping.start ? &*found : nullptr;
 }
 
 } // namespace tally::platform
