@@ -134,7 +134,7 @@ bool writeFile(const std::string& path, const std::string& contents) {
 } // namespace
 
 int runHeapsnap(int argc, char** argv) {
-    prepareStandardStreams();
+    prepareOwnProcess();
     const std::optional<HeapsnapArgs> args = parse(argc, argv);
     if (!args || args->wantsHelp) {
         std::fputs(usage, args ? stdout : stderr);

@@ -82,7 +82,7 @@ bool measure(TLTallyArgs& args, const OutputFiles& outputs) {
 } // namespace
 
 int runTally(int argc, char** argv) {
-    platform::prepareStandardStreams();
+    platform::prepareOwnProcess();
     auto parsed = parseArguments(argc, argv);
     if (const auto* error = std::get_if<TLError>(&parsed)) {
         printMessage(*error);

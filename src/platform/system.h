@@ -39,9 +39,10 @@ class OptionScanner {
     State* state_;
 };
 
-/// Opens descriptors 0, 1 and 2 on the null device where they are closed, so that no file of ours takes their
-/// place, and ignores the signal of a closed pipe.
-void prepareStandardStreams();
+/// To be called first: opens descriptors 0, 1 and 2 on the null device where they are closed, so that no file
+/// of ours takes their place, ignores the signal of a closed pipe, and has freed memory kept for what comes
+/// next.
+void prepareOwnProcess();
 
 bool standardOutputIsTerminal();
 std::uint32_t effectiveUserId();

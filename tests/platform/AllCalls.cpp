@@ -83,7 +83,7 @@ namespace tally::platform {
     &OptionScanner::next,
     &OptionScanner::argument,
     &OptionScanner::index,
-    &prepareStandardStreams,
+    &prepareOwnProcess,
     &standardOutputIsTerminal,
     &effectiveUserId,
     &ownPid,

@@ -64,7 +64,7 @@ constexpr std::array<std::string_view, 13> callsThatCannot{
     "hasInternalContent",
     "mach_timebase_info",
     "ownPid",
-    "prepareStandardStreams",
+    "prepareOwnProcess",
     "restoreDefaultInterruptAction",
     "setTimer",
     "standardOutputIsTerminal",

@@ -100,7 +100,7 @@ std::unique_ptr<TimerSource> dispatch_source_timer(SerialQueue& queue,
     return std::make_unique<Timer>(answer.state, queue, std::move(handler));
 }
 
-void prepareStandardStreams() { const Answer answer("prepareStandardStreams"); }
+void prepareOwnProcess() { const Answer answer("prepareOwnProcess"); }
 
 bool standardOutputIsTerminal() { return Answer("standardOutputIsTerminal").kernel.outputIsTerminal; }
 

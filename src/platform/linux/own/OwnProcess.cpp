@@ -3,13 +3,14 @@
 #include "platform/system.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <unistd.h>
 
 #include <csignal>
 
 namespace tally::platform {
 
-void prepareStandardStreams() {
+void prepareOwnProcess() {
     for (const int number : {STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO}) {
         if (fcntl(number, F_GETFD) == -1) {
             // The lowest free number is given, and all below this one are taken.
@@ -18,6 +19,10 @@ void prepareStandardStreams() {
         }
     }
     std::signal(SIGPIPE, SIG_IGN);
+    // Tables of a large process grow and go one after the other. Given back and asked for again, each page of
+    // theirs costs a fault: a fifth of the run for 100,000 mappings.
+    mallopt(M_MMAP_THRESHOLD, 32 << 20); // the most that is allowed
+    mallopt(M_TRIM_THRESHOLD, 64 << 20);
 }
 
 bool standardOutputIsTerminal() { return isatty(STDOUT_FILENO) == 1; }

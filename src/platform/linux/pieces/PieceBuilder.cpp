@@ -90,6 +90,7 @@ PieceBuilder::PieceBuilder(const WalkFacts& facts, const AddressSpace& space, Sm
     : facts_(facts), mappings_(space.mappings), states_(space.states), parts_(space.parts),
       folder_(space.folder), smaps_(smaps) {
     backings_.reserve(mappings_.size());
+    pieces_.reserve(mappings_.size());
     for (const Mapping& mapping : mappings_) {
         backings_.push_back(backingOf(mapping, folder_));
         if (mapping.isFileBacked() && !facts.objectView) {
