@@ -116,6 +116,39 @@ Attempt addPuppets() {
     return attempt;
 }
 
+/// Pages of relatives and of shared memory, swapped out before the fork, count once, as the swap file has
+/// them.
+TEST(Machine, SwappedMemoryOfRelativesIsWhatTheSwapFileHolds) {
+    const SwapFile swap(64);
+    if (!swap.isOn()) {
+        GTEST_SKIP() << "no swap file can be had here";
+    }
+    const auto used = [] { return meminfo("SwapTotal") - meminfo("SwapFree"); };
+    const std::int64_t before = used();
+    const Puppet family({"family", "3", "4096", "swapped"});
+    std::vector<std::string> command{TALLY_PROGRAM, "-f",    "bytes",
+                                     "--swapped",   "--pid", std::to_string(family.pid())};
+    for (const Puppet::Entry& entry : family.ledger()) {
+        if (entry.name == "child") {
+            command.insert(command.end(), {"--pid", std::to_string(entry.size)});
+        }
+    }
+    const std::string report = run(command).output;
+    std::int64_t swapped = 0;
+    std::istringstream summaryRows(report.substr(std::min(report.rfind("Summary Tally"), report.size())));
+    for (std::string line; std::getline(summaryRows, line);) {
+        std::string unit;
+        std::int64_t dirty = 0;
+        std::int64_t figure = 0;
+        if (std::istringstream(line) >> dirty >> unit >> figure && line.ends_with("TOTAL")) {
+            swapped = figure;
+        }
+    }
+    const std::int64_t expected = used() - before;
+    EXPECT_GT(expected, 30 << 20);
+    EXPECT_TRUE(isWithin(swapped, expected, 0.005)) << swapped << " of " << expected;
+}
+
 TEST(Machine, WhatProcessesAddIsWhatTheMachineCounts) {
     if (geteuid() != 0) {
         GTEST_SKIP() << "all processes are measured by root only";

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <sys/file.h>
 #include <sys/prctl.h>
+#include <sys/swap.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -65,6 +66,14 @@ std::string readAll(int descriptor) {
     }
     close(descriptor);
     return text;
+}
+
+/// Waits until no other test changes this setting of the machine. Until the descriptor is closed.
+int lockOfMachine(const std::string& setting) {
+    const std::string path = "/tmp/tally-test-" + setting + ".lock";
+    const int lock = open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600);
+    flock(lock, LOCK_EX);
+    return lock;
 }
 
 constexpr const char* poolFile = "/proc/sys/vm/nr_hugepages";
@@ -151,8 +160,7 @@ TemporaryFolder::~TemporaryFolder() {
 }
 
 HugePagePool::HugePagePool(int pages) {
-    lock_ = open("/tmp/tally-test-hugepages.lock", O_CREAT | O_RDWR | O_CLOEXEC, 0600);
-    flock(lock_, LOCK_EX);
+    lock_ = lockOfMachine("hugepages");
     before_ = readPool();
     std::ofstream(poolFile) << before_ + pages;
     granted_ = readPool() - before_;
@@ -160,6 +168,21 @@ HugePagePool::HugePagePool(int pages) {
 
 HugePagePool::~HugePagePool() {
     std::ofstream(poolFile) << before_;
+    close(lock_);
+}
+
+SwapFile::SwapFile(std::size_t mebibytes) : lock_(lockOfMachine("swap")) {
+    const std::string path = folder_.path() + "/swap";
+    const int file = open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600);
+    const bool hasRoom = posix_fallocate(file, 0, static_cast<off_t>(mebibytes << 20)) == 0;
+    close(file);
+    isOn_ = hasRoom && run({"/usr/sbin/mkswap", path}).status == 0 && swapon(path.c_str(), 0) == 0;
+}
+
+SwapFile::~SwapFile() {
+    if (isOn_) {
+        swapoff((folder_.path() + "/swap").c_str());
+    }
     close(lock_);
 }
 

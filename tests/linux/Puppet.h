@@ -72,4 +72,17 @@ class HugePagePool {
     int granted_ = 0;
 };
 
+/// A swap file of the test's own, alone among tests, off and removed in the end.
+class SwapFile {
+  public:
+    explicit SwapFile(std::size_t mebibytes);
+    ~SwapFile();
+    bool isOn() const { return isOn_; }
+
+  private:
+    TemporaryFolder folder_;
+    int lock_ = -1;
+    bool isOn_ = false;
+};
+
 } // namespace tally::test

@@ -7,17 +7,18 @@
 //   puppet big MIB                 private memory, every page written
 //   puppet maps COUNT              COUNT mappings of one page each, every second one written
 //   puppet churn                   maps and unmaps without end
-//   puppet family KIDS PAGES HOW   forks KIDS children that share PAGES pages and then change them: HOW is
-//   "same", "half"
-//                                  (every second page written), "random" (three pages in ten, drawn by the
-//                                  child's number), "drop" (the second half unmapped), "huge" (huge pages,
-//                                  the first 4 KiB of each written) or "grow" (the parent's and the
-//                                  children's mappings grow apart)
+//   puppet family KIDS PAGES HOW   forks KIDS children that share PAGES pages and change them. HOW is
+//                                  one of same, half (every second page written), random (three pages in
+//                                  ten, drawn by the child's number), drop (the second half unmapped),
+//                                  huge (huge pages, the first 4 KiB of each written), grow (the parent's
+//                                  and the children's mappings grow apart), swapped (nothing changes: it was
+//                                  swapped out before, and shared memory of as many pages with it)
 //   puppet memory PAGES            a memfd of PAGES pages, all written, of which only the first are mapped
-//   and touched puppet twins                   a second process in the same address space puppet leaderless
-//   the first thread ends, another lives on puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of
-//   that request number answered by ENOTTY; "fixed" in place
-//                                  of a number runs it without randomised addresses
+//                                  and touched
+//   puppet twins                   a second process in the same address space
+//   puppet leaderless              the first thread ends, another lives on
+//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY;
+//                                  "fixed" in place of a number runs it without randomised addresses
 //
 // Every line of output is "name address bytes key=bytes ...", what the mapping must show; "ready" ends the
 // ledger.
@@ -335,6 +336,13 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
         madvise(m, pages * page, MADV_HUGEPAGE);
     }
     write(m, 0, pages);
+    if (how == "swapped") {
+        char* shared = map(pages * page, readWrite, MAP_SHARED | MAP_ANONYMOUS);
+        write(shared, 0, pages);
+        for (char* memory : {m, shared}) {
+            madvise(memory, pages * page, MADV_PAGEOUT);
+        }
+    }
     int ready[2];
     if (pipe(ready) != 0) {
         fail("pipe");
