@@ -16,6 +16,7 @@
 #include <fstream>
 #include <sstream>
 #include <thread>
+#include <utility>
 
 namespace tally::test {
 
@@ -44,6 +45,7 @@ int start(const std::vector<std::string>& command, int input, int output, int er
     const int pid = fork();
     if (pid == 0) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
+        signal(SIGINT, SIG_DFL); // what runs in the background of a shell has it ignored
         const std::array<int, 3> wanted{input, output, errors};
         for (int i = 0; i < 3; ++i) {
             if (wanted[i] >= 0) {
@@ -74,6 +76,13 @@ int lockOfMachine(const std::string& setting) {
     const int lock = open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600);
     flock(lock, LOCK_EX);
     return lock;
+}
+
+/// Waits for the end. @return the exit status, or 128 + the signal.
+int waitFor(int pid) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
 constexpr const char* poolFile = "/proc/sys/vm/nr_hugepages";
@@ -140,11 +149,29 @@ Outcome run(const std::vector<std::string>& command, const std::string& folder) 
     std::thread reader([&] { outcome.errors = readAll(err.reading); });
     outcome.output = readAll(out.reading);
     reader.join();
-    int status = 0;
-    waitpid(pid, &status, 0);
-    outcome.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    outcome.status = waitFor(pid);
     return outcome;
 }
+
+Background::Background(const std::vector<std::string>& command, const std::string& folder) {
+    const auto create = [&](const char* name) {
+        return open((folder + "/" + name).c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    };
+    const int output = create("out");
+    const int errors = create("err");
+    pid_ = start(command, -1, output, errors, folder);
+    close(output);
+    close(errors);
+}
+
+Background::~Background() {
+    if (pid_ > 0) {
+        kill(pid_, SIGKILL);
+        wait();
+    }
+}
+
+int Background::wait() { return waitFor(std::exchange(pid_, -1)); }
 
 TemporaryFolder::TemporaryFolder() {
     std::string path = std::filesystem::temp_directory_path() / "tally-test-XXXXXX";

@@ -47,6 +47,23 @@ struct Outcome {
 /// Runs a program to its end. `folder` is its current folder, empty for the test's own.
 Outcome run(const std::vector<std::string>& command, const std::string& folder = "");
 
+/// A program that runs beside the test, with its output in the files "out" and "err" of its folder; ended by
+/// pid when the holder goes away.
+class Background {
+  public:
+    Background(const std::vector<std::string>& command, const std::string& folder);
+    ~Background();
+    Background(const Background&) = delete;
+    Background& operator=(const Background&) = delete;
+
+    int pid() const { return pid_; }
+    /// Waits for the end. @return the exit status, or 128 + the signal.
+    int wait();
+
+  private:
+    int pid_ = -1;
+};
+
 /// A folder of the test's own, removed with what is in it.
 class TemporaryFolder {
   public:

@@ -7,6 +7,7 @@
 //   puppet big MIB                 private memory, every page written
 //   puppet maps COUNT              COUNT mappings of one page each, every second one written
 //   puppet churn                   maps and unmaps without end
+//   puppet breathe                 grows, shrinks and forks children that end, without end
 //   puppet family KIDS PAGES HOW   forks KIDS children that share PAGES pages and change them. HOW is
 //                                  one of same, half (every second page written), random (three pages in
 //                                  ten, drawn by the child's number), drop (the second half unmapped),
@@ -305,6 +306,26 @@ void manyMappings(std::size_t count) {
     }
 }
 
+[[noreturn]] void breathe() {
+    std::printf("ready\n");
+    std::fflush(stdout);
+    alarm(120);
+    signal(SIGCHLD, SIG_IGN); // children leave nothing behind
+    for (std::size_t round = 0;; ++round) {
+        const std::size_t pages = 16 + round * 7919 % 1000;
+        char* m = map(pages * page, readWrite, privateAnonymous);
+        write(m, 0, pages);
+        if (round % 16 == 0 && fork() == 0) {
+            prctl(PR_SET_PDEATHSIG, SIGKILL);
+            write(m, 0, pages / 2);
+            usleep(250'000);
+            _exit(0);
+        }
+        usleep(20'000);
+        munmap(m, pages * page);
+    }
+}
+
 /// Whether child `child` of a "random" family writes page `at` of its memory.
 bool isDrawn(std::size_t child, std::size_t at) {
     std::uint64_t x = (child * 1'000'003 + at) * 0x9e3779b97f4a7c15U;
@@ -453,6 +474,8 @@ int main(int argc, char** argv) {
         manyMappings(number(2));
     } else if (what == "churn") {
         churn();
+    } else if (what == "breathe") {
+        breathe();
     } else if (what == "family" && argc > 4) {
         family(number(2), number(3), argv[4]);
     } else if (what == "memory") {

@@ -1,0 +1,235 @@
+// The documents of real runs: that they are valid and say what the text says, however a run ends.
+
+#include "linux/Agreement.h"
+#include "linux/Puppet.h"
+
+#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
+#include <unistd.h>
+
+#include <chrono>
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <random>
+#include <sstream>
+#include <thread>
+
+namespace tally::test {
+namespace {
+
+using Words = std::vector<std::string>;
+
+std::string pidOf(const Puppet& puppet) { return std::to_string(puppet.pid()); }
+
+/// A run with all three outputs in its folder.
+Words commandWith(const Words& more) {
+    Words command{TALLY_PROGRAM, "-f", "bytes", "-w", "-v", "-j", "x.json", "--benchlog", "x.blj"};
+    command.insert(command.end(), more.begin(), more.end());
+    return command;
+}
+
+std::size_t expectAgreementIn(const std::string& folder) {
+    return expectAgreement(contentsOf(folder + "/out"), contentsOf(folder + "/x.json"),
+                           contentsOf(folder + "/x.blj"));
+}
+
+bool holds(const std::string& text, const std::string& part) { return text.find(part) != text.npos; }
+
+TEST(Documents, SayWhatTheTextSays) {
+    const Puppet zoo({"zoo"});
+    const Puppet family({"family", "22", "200", "half"}); // more sharers than the text names
+    const std::string shared = "/dev/shm/tally-test-documents-" + std::to_string(getpid());
+    { std::ofstream(shared) << std::string(64 * 4096, 'x'); }
+    const Puppet writer({"fill", shared, "40"});
+    const Puppet reader({"share", shared});
+    std::filesystem::remove(shared);
+    const TemporaryFolder folder;
+    for (const Words& more :
+         {Words{"-t", "--pid", pidOf(zoo), "--pid", pidOf(family), "--pid", pidOf(writer), "--pid",
+                pidOf(reader)},
+          Words{"--vmObjectDirty", "--pid", pidOf(zoo), "--pid", pidOf(writer), "--pid", pidOf(reader)},
+          Words{"--pid", pidOf(reader)}}) {
+        EXPECT_EQ(Background(commandWith(more), folder.path()).wait(), 0)
+            << contentsOf(folder.path() + "/err");
+        EXPECT_EQ(expectAgreementIn(folder.path()), 1U);
+        expectValid({folder.path() + "/x.json"});
+    }
+}
+
+TEST(Documents, GoWhereverAPathLeads) {
+    const Puppet puppet({"idle"});
+    const TemporaryFolder folder;
+    const auto shell = [&](const std::string& before, const std::string& after) {
+        return run({"/bin/sh", "-c", before + " " TALLY_PROGRAM " --pid " + pidOf(puppet) + " " + after},
+                   folder.path());
+    };
+    using nlohmann::json;
+    const Outcome piped = shell("", "-j /dev/stdout | tail -n 1"); // after the text, in one line
+    EXPECT_TRUE(json::accept(piped.output)) << piped.output;
+    shell("", "-j out >out"); // both to one file
+    EXPECT_TRUE(json::accept(
+        contentsOf(folder.path() + "/out").substr(contentsOf(folder.path() + "/out").rfind('\n'))));
+    const Outcome fifo = shell("mkfifo f; cat f & exec", "-j f >/dev/null");
+    EXPECT_TRUE(json::accept(fifo.output)) << fifo.output;
+    EXPECT_EQ(shell("", "-j closed.json >&- 2>&-").status, 0);
+    EXPECT_TRUE(json::accept(contentsOf(folder.path() + "/closed.json")));
+    const Outcome busy = run({TALLY_PROGRAM, "--pid", pidOf(puppet), "-j", TALLY_PROGRAM});
+    EXPECT_EQ(busy.status, 1);
+    EXPECT_EQ(busy.errors, "Unable to open JSON writer: Text file busy\nUnable to create JSON output\n");
+}
+
+TEST(Documents, AFullDiskIsSaidAndLeavesWholeLines) {
+    const Puppet puppet({"maps", "3000"});
+    const Outcome outcome = run({"/usr/bin/unshare", "-m", "/bin/sh", "-c",
+                                 "mount -t tmpfs -o size=64k none /mnt || exit 77; cd /mnt; " TALLY_PROGRAM
+                                 " -v -j x.json --benchlog x.blj"
+                                 " --pid $0 >/dev/null; echo $?; " TALLY_PROGRAM
+                                 " --sample 0.001 --benchlog y.blj --pid $0 >/dev/null &"
+                                 "while [ $(stat -c %s y.blj) -lt 20000 ]; do :; done; rm x.*; sleep 0.2; "
+                                 "kill -INT $!; wait $!; echo $?;"
+                                 "tail -c 1 y.blj | od -An -c; df . | grep -c 100%",
+                                 pidOf(puppet)});
+    if (outcome.status == 77 || geteuid() != 0) {
+        GTEST_SKIP() << "no file system can be mounted here";
+    }
+    EXPECT_TRUE(holds(outcome.errors,
+                      "Unable to write all of x.json, which is incomplete: No space left on device\n"));
+    EXPECT_TRUE(holds(outcome.errors,
+                      "Unable to write all of y.blj, which is incomplete: No space left on device\n"));
+    EXPECT_EQ(outcome.output, "1\n1\n  \\n\n1\n") << outcome.errors;
+}
+
+/// Samples a puppet that grows, shrinks, forks and, at last, ends.
+void followAPuppet(std::chrono::seconds time) {
+    auto puppet = std::make_unique<Puppet>(Words{"breathe"});
+    const TemporaryFolder folder;
+    const std::string text = folder.path() + "/out";
+    const auto samples = [&] {
+        const std::string now = contentsOf(text);
+        std::size_t count = 0;
+        for (std::size_t at = 0; (at = now.find("Time: ", at)) != now.npos; ++at) {
+            ++count;
+        }
+        return count;
+    };
+    Background sampling(commandWith({"--sample", "0.1", "-t", "--pid", pidOf(*puppet)}), folder.path());
+    const auto anonymous = [&] {
+        std::ifstream status("/proc/" + std::to_string(sampling.pid()) + "/status");
+        for (std::string line; std::getline(status, line);) {
+            if (line.starts_with("RssAnon:")) {
+                return std::stol(line.substr(8));
+            }
+        }
+        return -1L;
+    };
+    const auto pause = [] { std::this_thread::sleep_for(std::chrono::milliseconds(20)); };
+    while (samples() < 10) {
+        pause();
+    }
+    const long early = anonymous();
+    std::this_thread::sleep_for(time);
+    const long late = anonymous();
+    puppet.reset();
+    for (const std::size_t before = samples(); samples() < before + 8;) { // its children last a little longer
+        pause();
+    }
+    kill(sampling.pid(), SIGINT);
+    EXPECT_EQ(sampling.wait(), 0);
+    const std::string errors = contentsOf(folder.path() + "/err");
+    EXPECT_TRUE(errors.ends_with("\nStopping...\nAnalyzing and writing output...\n"));
+
+    EXPECT_GE(expectAgreementIn(folder.path()), 18U);
+    expectValid({folder.path() + "/x.json"});
+    std::int64_t end = 0;
+    std::set<std::int64_t> totals;
+    std::set<std::size_t> sizes;
+    const auto document = nlohmann::json::parse(contentsOf(folder.path() + "/x.json"));
+    for (const auto& sample : document["samples"]) {
+        const std::int64_t start = sample["start_time"]["mach_absolute_time_ns"];
+        EXPECT_GT(start, end);
+        end = sample["end_time"]["mach_absolute_time_ns"];
+        EXPECT_GE(end, start);
+        totals.insert(sample["total tally"].get<std::int64_t>());
+        sizes.insert(sample["processes"].size());
+    }
+    EXPECT_GE(totals.size(), 10U); // it was followed, not remembered
+    EXPECT_TRUE(sizes.contains(1) && sizes.contains(2));
+    EXPECT_EQ(document["samples"].back()["total tally"], 0); // nothing is left, but for zombies
+#ifndef __SANITIZE_ADDRESS__
+    EXPECT_LE(late - early, 1024) << "KiB";
+#endif
+}
+
+TEST(Documents, FollowAProcessThatChanges) { followAPuppet(std::chrono::seconds(3)); }
+TEST(LongDocuments, FollowAProcessForAMinute) { followAPuppet(std::chrono::seconds(60)); }
+
+/// Interrupts runs at random moments: what exits with 0 has left whole documents, and no run that has begun
+/// to listen is killed.
+void interruptRuns(int runs) {
+    const Puppet family({"family", "8", "4000", "random"});
+    const TemporaryFolder folder;
+    Words once{"-t", "--pid", pidOf(family)};
+    Words sampled{"--sample", "0.02", "-t", "--pid", pidOf(family)};
+    const auto begin = std::chrono::steady_clock::now();
+    ASSERT_EQ(Background(commandWith(once), folder.path()).wait(), 0);
+    const auto length = std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+
+    std::mt19937 random(static_cast<unsigned>(getpid()));
+    std::uniform_real_distribution<double> part(0, 1);
+    std::vector<std::string> valid;
+    std::map<std::string, int> endings;
+    for (int i = 0; i < runs; ++i) {
+        const bool isSampled = i % 2 == 0;
+        const int signal = i % 3 == 0 ? SIGTERM : SIGINT;
+        const double moment = part(random) * (isSampled ? 5 : 1.3) * length;
+        SCOPED_TRACE((isSampled ? "sampling" : "one report") + std::string(" ended by signal ") +
+                     std::to_string(signal) + " after " + std::to_string(moment) + " s");
+        Background tally(commandWith(isSampled ? sampled : once), folder.path());
+        std::this_thread::sleep_for(std::chrono::duration<double>(moment));
+        kill(tally.pid(), signal);
+        const int status = tally.wait();
+        const std::string errors = contentsOf(folder.path() + "/err");
+        const bool hasListened = holds(errors, isSampled ? "Sampling at" : "Exiting early");
+        ++endings[std::string(isSampled ? "sampling " : "once ") + (hasListened ? "heard " : "") +
+                  std::to_string(status)];
+        if (status == 0) {
+            expectAgreementIn(folder.path());
+            valid.push_back(folder.path() + "/" + std::to_string(i) + ".json");
+            std::filesystem::rename(folder.path() + "/x.json", valid.back());
+        } else {
+            EXPECT_EQ(status, 128 + signal) << errors;
+            EXPECT_FALSE(hasListened) << errors;
+        }
+    }
+    ASSERT_FALSE(valid.empty());
+    expectValid(valid);
+    for (const auto& [ending, count] : endings) {
+        std::printf("%s: %d\n", ending.c_str(), count);
+    }
+}
+
+TEST(Documents, SurviveInterrupts) { interruptRuns(20); }
+TEST(LongDocuments, SurviveManyInterrupts) { interruptRuns(200); }
+
+TEST(Documents, EndWholeUnderTimeoutAndNohup) {
+    const Puppet puppet({"idle"});
+    const TemporaryFolder folder;
+    const std::string sampling = TALLY_PROGRAM " --sample 0.05 -j x.json --pid " + pidOf(puppet);
+    const std::string endings[] = {
+        "timeout --preserve-status -s INT 0.5 " + sampling,
+        "timeout --preserve-status -s TERM 0.5 " + sampling,
+        "timeout --preserve-status -s HUP 0.5 " + sampling,
+        // A hang-up that was ignored from the start ends nothing.
+        "(trap '' HUP; exec " + sampling + ") & sleep 0.3; kill -HUP $!; sleep 0.3; kill -INT $!; wait $!",
+    };
+    for (const std::string& ending : endings) {
+        const Outcome outcome = run({"/bin/sh", "-c", ending + " >/dev/null"}, folder.path());
+        EXPECT_EQ(outcome.status, 0) << ending << outcome.errors;
+        const auto document = nlohmann::json::parse(contentsOf(folder.path() + "/x.json"), nullptr, false);
+        EXPECT_TRUE(document.is_object()) << ending;
+    }
+}
+
+} // namespace
+} // namespace tally::test
