@@ -5,6 +5,8 @@
 #include <nlohmann/json.hpp>
 
 #include <algorithm>
+#include <array>
+#include <cstdio>
 #include <fstream>
 #include <map>
 #include <regex>
@@ -43,12 +45,12 @@ class TextReader {
 
   private:
     void readLine(const std::string& line) {
+        if (readRow(line) || readRegion(line)) {
+            return;
+        }
         static const std::regex listing(R"((.*) \[(\d+)\])");
-        static const std::regex region(
-            R"( *(\w+) - +(\w+) \[ *(\w+)\] +(\d+) +(\d+) +(\d+) +(\d+) +(\d+) +(\d+)   (.*))");
         static const std::regex header(R"((.*) \[(\d+)\]: (?:64|32)-bit.*)");
         static const std::regex total(R"(.*\tTally: (\d+) B \(\d+ bytes per page\))"); // below warnings
-        static const std::regex row(R"( *(\d+) B +(\d+) B +(\d+) B +(\d+) B +(\d+) B +(\d+)    (.*))");
         static const std::regex summary(R"(Summary Tally: (\d+) B.*)");
         static const std::regex auxiliary("(\t+)(.*?):(?: (-?\\d+) B)?");
         std::smatch match;
@@ -57,41 +59,51 @@ class TextReader {
             where_ = pid_ + " own";
         }
         if (std::regex_match(line, match, total)) {
-            add(pid_ + " total", {match, 1, 2});
-        } else if (std::regex_match(line, match, region)) {
-            const std::string end = match[1] == "unmapped" ? "unmapped" : match[2].str();
-            add(pid_ + " region " + match[1].str() + " " + end + " " + match[3].str() + " " + match[10].str(),
-                {match, 4, 10});
-        } else if (std::regex_match(line, match, row)) {
-            if (match[7] != "TOTAL" || where_ == "summary") {
-                add(where_ + " " + match[7].str(), {match, 1, 7});
-            }
+            facts_.push_back(pid_ + " total: " + match[1].str());
         } else if (std::regex_match(line, match, listing)) {
             pid_ = match[2];
         } else if (line.starts_with("Shared with ")) {
             where_ = pid_ + " shared" + sharers(line);
         } else if (std::regex_match(line, match, summary)) {
             where_ = pid_ = "summary";
-            add("summary total", {match, 1, 2});
+            facts_.push_back("summary total: " + match[1].str());
         } else if (std::regex_match(line, match, auxiliary)) {
             path_.resize(match[1].length() - 1);
             path_.push_back(match[2]);
             if (match[3].matched) {
-                add(pid_ + " auxiliary" + joined(path_), {match, 3, 4});
+                facts_.push_back(pid_ + " auxiliary" + joined(path_) + ": " + match[3].str());
             }
         }
     }
 
-    struct Groups {
-        const std::smatch& match;
-        std::size_t from, to;
-    };
-    void add(const std::string& place, Groups groups) {
-        std::string fact = place + ":";
-        for (std::size_t i = groups.from; i < groups.to; ++i) {
-            fact += " " + groups.match[i].str();
+    using Figures = std::array<unsigned long long, 6>;
+
+    bool readRow(const std::string& line) {
+        Figures n{};
+        int name = 0;
+        std::sscanf(line.c_str(), "%llu B %llu B %llu B %llu B %llu B %llu %n", &n[0], &n[1], &n[2], &n[3],
+                    &n[4], &n[5], &name);
+        if (name == 0) {
+            return false;
         }
-        facts_.push_back(fact);
+        if (line.substr(name) != "TOTAL" || where_ == "summary") { // no other sum is in the document
+            facts_.push_back(where_ + " " + line.substr(name) + ":" + joined(n));
+        }
+        return true;
+    }
+
+    bool readRegion(const std::string& line) {
+        Figures n{};
+        std::array<char, 24> start{}, end{}, id{};
+        int name = 0;
+        std::sscanf(line.c_str(), "%23s - %23s [ %23[0-9a-f]] %llu %llu %llu %llu %llu %llu %n", start.data(),
+                    end.data(), id.data(), &n[0], &n[1], &n[2], &n[3], &n[4], &n[5], &name);
+        if (name == 0) {
+            return false;
+        }
+        facts_.push_back(pid_ + " region " + start.data() + " " + end.data() + " " + id.data() + " " +
+                         line.substr(name) + ":" + joined(n));
+        return true;
     }
 
     std::string sharers(const std::string& line) const {
