@@ -10,6 +10,7 @@
 #include "process/TLUserProcess.h"
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <limits>
@@ -25,6 +26,10 @@ using namespace platform;
 namespace {
 
 constexpr double nanosecondsPerSecond = 1e9;
+
+// Gathered samples that wait for their report. Where reports take longer than the interval, or nobody reads
+// them, ticks are missed then, instead of memory being used up.
+constexpr int mostWaitingSamples = 16;
 
 std::uint64_t nanoseconds(double seconds) {
     const double exact = seconds * nanosecondsPerSecond;
@@ -90,6 +95,8 @@ class Sampler {
     std::mutex lastTallyMutex_;
     std::weak_ptr<TLTally> lastTally_; // alive while its analysis is queued or running
 
+    Semaphore freePlaces_; // for samples that wait
+    std::atomic<bool> isStopping_ = false;
     Semaphore finished_;
     SerialQueue analysisQueue_{std::string(subsystemIdentifier) + ".sample-analysis", QOS_CLASS_UTILITY};
     SerialQueue timerQueue_{std::string(subsystemIdentifier) + ".sample-timer"};
@@ -100,6 +107,9 @@ class Sampler {
 Sampler::Sampler(TLTallyArgs& args, const OutputFiles& outputs) : args_(args), outputs_(outputs) {
     if (!timer_) {
         throw std::system_error(errno, std::generic_category());
+    }
+    for (int i = 0; i < mostWaitingSamples; ++i) {
+        freePlaces_.signal();
     }
 }
 
@@ -127,6 +137,8 @@ void Sampler::run() {
 
 void Sampler::stop() {
     timer_->cancel();
+    isStopping_ = true;
+    freePlaces_.signal(); // a sample may be waiting for one
     if (const std::shared_ptr<TLTally> last = lastTally()) {
         last->earlyExit = true;
     }
@@ -154,7 +166,10 @@ void Sampler::takeSample(std::uint64_t ticks) {
         stretchInterval(now);
     }
     lastFireTime_ = now;
-
+    freePlaces_.wait();
+    if (isStopping_) {
+        return;
+    }
     TLProcessTable targets = targetProcessesForArgs(args_, nullptr).value_or(TLProcessTable());
     if (const std::shared_ptr<TLTally> last = lastTally()) {
         carryUnchangedOver(*last, targets);
@@ -167,7 +182,10 @@ void Sampler::takeSample(std::uint64_t ticks) {
         lastTally_ = tally;
     }
     if (!tally->gatherAllProcesses()) {
-        analysisQueue_.async([this, tally] { report(*tally); });
+        analysisQueue_.async([this, tally] {
+            report(*tally);
+            freePlaces_.signal();
+        });
     }
 }
 

@@ -254,6 +254,28 @@ TEST_F(ThreadSampling, DropsTheInterruptedSampleAndReportsAllBefore) {
     EXPECT_TRUE(messages.ends_with("\nStopping...\nAnalyzing and writing output...\n")) << messages;
 }
 
+TEST_F(ThreadSampling, WaitsForReportsInsteadOfKeepingSamplesWithoutEnd) {
+    addServer(7);
+    recorder->held = {1};
+    for (const bool isInterrupted : {false, true}) { // while a sample waits for its place
+        recorder->samples.clear();
+        const std::size_t gathers = kernel.callCount("GatherScope");
+        sampleWhile([&] {
+            for (int i = 0; i < 16; ++i) {
+                kernel.fireTimer();
+            }
+            const std::size_t begun = kernel.callCount("clock_uptime_raw_approx_ns");
+            std::thread late([&] { kernel.fireTimer(); });
+            kernel.awaitCall("clock_uptime_raw_approx_ns", begun + 1);
+            EXPECT_EQ(kernel.callCount("GatherScope") - gathers, 16U);
+            EXPECT_TRUE(!isInterrupted || kernel.interrupt());
+            recorder->gate.signal();
+            late.join();
+        });
+        EXPECT_EQ(recorder->samples.size(), isInterrupted ? 16U : 17U);
+    }
+}
+
 TEST_F(ThreadSampling, EndsOnTerminationToo) {
     addServer(7);
     sampleWhile([&] {
