@@ -39,7 +39,10 @@ class TargetBuilder {
     bool build();
 
     TLProcessTable takeTable() { return std::move(table_); }
+    /// Why it failed, if that can be told.
     const std::optional<TLError>& error() const { return error_; }
+    /// The strings that describe nothing.
+    const std::optional<TLError>& unresolved() const { return unresolved_; }
 
   private:
     bool openSnapshots();
@@ -65,7 +68,7 @@ class TargetBuilder {
     bool says_;                                    // notices
     std::map<std::int32_t, std::string> shadowed_; // notices by the pid that a file's name stood for
     TLProcessTable table_;
-    std::optional<TLError> error_;
+    std::optional<TLError> error_, unresolved_;
 };
 
 bool TargetBuilder::build() {
@@ -214,7 +217,7 @@ bool TargetBuilder::targetNamedProcesses(const TLPidSet& excluded) {
     return true;
 }
 
-/// Targets what the remaining strings describe. Those that describe nothing are an error which ends nothing.
+/// Targets what the remaining strings describe. Those that describe nothing end nothing.
 void TargetBuilder::resolveNames() {
     std::vector<std::string> errors;
     for (const auto& [pid, name] : resolved(args_.potentialTargetProcesses, &errors)) {
@@ -225,7 +228,7 @@ void TargetBuilder::resolveNames() {
         for (const std::string& error : errors) {
             message += (message.empty() ? "" : "\n") + printable(error);
         }
-        error_ = TLError{TLTallyErrorDomain, TLErrorBadPid, std::move(message)};
+        unresolved_ = TLError{TLTallyErrorDomain, TLErrorBadPid, std::move(message)};
     }
 }
 
@@ -293,7 +296,7 @@ std::optional<TLProcessTable> targetProcessesForArgs(TLTallyArgs& args, std::opt
     TargetBuilder builder(args, error != nullptr);
     const bool built = builder.build();
     if (error != nullptr) {
-        *error = builder.error();
+        *error = built ? builder.unresolved() : builder.error();
     }
     return built ? std::optional(builder.takeTable()) : std::nullopt;
 }
