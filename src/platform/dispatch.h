@@ -14,7 +14,7 @@
 
 namespace tally::platform {
 
-// Quality-of-service classes of a queue.
+// Quality-of-service classes of a queue. Nothing on Linux follows them.
 inline constexpr std::uint32_t QOS_CLASS_UTILITY = 0x11;
 inline constexpr std::uint32_t QOS_CLASS_DEFAULT = 0x15;
 inline constexpr std::uint32_t QOS_CLASS_USER_INITIATED = 0x19;
