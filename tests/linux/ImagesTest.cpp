@@ -64,7 +64,7 @@ TEST(ElfLayout, ReadsBothClassesAndRefusesWhatNoLoaderTakes) {
     EXPECT_EQ(readElfLayout(Descriptor()), std::nullopt);
 }
 
-/// One mapping of a process, with the segment it must be in; "" for none.
+/// A mapping of a process, with the segment it must be in; "" for none.
 struct Mapped {
     std::uint64_t start;
     std::uint64_t end;
@@ -74,92 +74,80 @@ struct Mapped {
     std::string_view segment;
 };
 
-void expectSegments(const ElfLayout& layout, const std::vector<Mapped>& process) {
+void expectSegments(const char* file, const std::vector<Mapped>& process) {
+    const ElfLayout layout = layoutOf(readSystemFile(files + file).value_or("")).value_or(ElfLayout());
     std::vector<Mapping> mappings;
     for (const Mapped& m : process) {
-        mappings.push_back({.start = m.start,
-                            .end = m.end,
-                            .fileOffset = m.offset,
-                            .inode = m.name[0] == '/' ? static_cast<std::uint64_t>(m.name[1]) : 0,
-                            .readable = m.rights[0] == 'r',
-                            .writable = m.rights[1] == 'w',
-                            .executable = m.rights[2] == 'x',
-                            .name = m.name});
+        Mapping mapping{.start = m.start, .end = m.end, .fileOffset = m.offset, .name = m.name};
+        mapping.inode = m.name[0] == '/' ? static_cast<std::uint64_t>(m.name[1]) : 0;
+        mapping.executable = m.rights[2] == 'x';
+        mappings.push_back(mapping);
     }
     const auto code = std::ranges::find(mappings, true, &Mapping::executable);
     const auto segments = segmentsOf(layout, biasOf(layout, *code).value_or(0), *code, mappings);
-    for (std::size_t i = 0; i < mappings.size(); ++i) {
-        std::string_view found;
-        for (const RKSegment& segment : segments) {
-            if (segment.start < mappings[i].end && mappings[i].start < segment.start + segment.size) {
-                found = segment.name;
-            }
-        }
-        EXPECT_EQ(found, process[i].segment) << i;
+    for (const Mapped& m : process) {
+        const auto found = std::ranges::find_if(segments, [&](const RKSegment& segment) {
+            return segment.start < m.end && m.start < segment.start + segment.size;
+        });
+        EXPECT_EQ(found == segments.end() ? "" : found->name, m.segment) << file << ' ' << m.start;
     }
 }
 
 TEST(ImageSegments, EveryMappingOfAnImageHasItsName) {
     // Linker data, code, constants, and data of which the first page is relocated.
-    const ElfLayout layout = layoutOf(usual).value_or(ElfLayout());
-    expectSegments(layout, {{0x70000000, 0x70001000, "rw-", 0, "", ""},
-                            {0x70001000, 0x70003000, "r--", 0x0, "/a", "__LINKEDIT"},
-                            {0x70003000, 0x70006000, "r-x", 0x2000, "/a", "__TEXT"},
-                            {0x70006000, 0x70007000, "r--", 0x5000, "/a", "__TEXT"},
-                            {0x70007000, 0x70008000, "r--", 0x5000, "/a", "__DATA_CONST"},
-                            {0x70008000, 0x7000a000, "rw-", 0x6000, "/a", "__DATA"},
-                            {0x7000a000, 0x7000e000, "rw-", 0, "", "__BSS"},
-                            {0x7000e000, 0x7000f000, "rw-", 0, "", ""},
-                            {0x70010000, 0x70013000, "r--", 0x0, "/a", ""}}); // mapped again as data
+    expectSegments("/usual-64", {{0x70000000, 0x70001000, "rw-", 0, "", ""},
+                                 {0x70001000, 0x70003000, "r--", 0x0, "/a", "__LINKEDIT"},
+                                 {0x70003000, 0x70006000, "r-x", 0x2000, "/a", "__TEXT"},
+                                 {0x70006000, 0x70007000, "r--", 0x5000, "/a", "__TEXT"},
+                                 {0x70007000, 0x70008000, "r--", 0x5000, "/a", "__DATA_CONST"},
+                                 {0x70008000, 0x7000a000, "rw-", 0x6000, "/a", "__DATA"},
+                                 {0x7000a000, 0x7000e000, "rw-", 0, "", "__BSS"},
+                                 {0x7000e000, 0x7000f000, "rw-", 0, "", ""},
+                                 {0x70010000, 0x70013000, "r--", 0x0, "/a", ""}}); // mapped again as data
     // Not relocated yet; code replaced by huge pages; memory behind the data merged with a little more.
-    expectSegments(layout, {{0x70003000, 0x70004000, "r-x", 0x2000, "/a", "__TEXT"},
-                            {0x70004000, 0x70005000, "r-x", 0, "", "__TEXT"},
-                            {0x70007000, 0x7000a000, "rw-", 0x5000, "/a", "__DATA"},
-                            {0x7000a000, 0x70011000, "rw-", 0, "", "__BSS"}});
+    expectSegments("/usual-64", {{0x70003000, 0x70004000, "r-x", 0x2000, "/a", "__TEXT"},
+                                 {0x70004000, 0x70005000, "r-x", 0, "", "__TEXT"},
+                                 {0x70007000, 0x7000a000, "rw-", 0x5000, "/a", "__DATA"},
+                                 {0x7000a000, 0x70011000, "rw-", 0, "", "__BSS"}});
     // What lies behind the data is the heap, another file, away from it, or much more than the image's own.
     const std::vector<Mapped> others{{0x7000a000, 0x7000e000, "rw-", 0, "[heap]", ""},
                                      {0x7000a000, 0x7000e000, "rw-", 0x8000, "/b", ""},
                                      {0x7000b000, 0x7000c000, "rw-", 0, "", ""},
                                      {0x7000a000, 0x70020000, "rw-", 0, "", ""}};
     for (const Mapped& other : others) {
-        expectSegments(layout, {{0x70003000, 0x70006000, "r-x", 0x2000, "/a", "__TEXT"},
-                                {0x70008000, 0x7000a000, "rw-", 0x6000, "/a", "__DATA"},
-                                other});
+        expectSegments("/usual-64", {{0x70003000, 0x70006000, "r-x", 0x2000, "/a", "__TEXT"},
+                                     {0x70008000, 0x7000a000, "rw-", 0x6000, "/a", "__DATA"},
+                                     other});
     }
     // Other linkers: the relocated part is a segment of its own and constants come first; or code comes
     // first, is not moved, and lies more than 4 GiB below memory that the file has nothing of.
-    expectSegments(layoutOf(readSystemFile(files + "/relocated-apart-64").value_or("")).value_or(ElfLayout()),
-                   {{0x10000, 0x11000, "r--", 0x0, "/a", "__TEXT"},
-                    {0x11000, 0x12000, "---", 0x0, "/a", ""},
-                    {0x12000, 0x13000, "r-x", 0x1000, "/a", "__TEXT"},
-                    {0x14000, 0x15000, "r--", 0x2000, "/a", "__DATA_CONST"},
-                    {0x16000, 0x17000, "rw-", 0x3000, "/a", "__DATA"},
-                    {0x17000, 0x19000, "rw-", 0, "", "__BSS"}});
-    expectSegments(layoutOf(readSystemFile(files + "/code-first-64").value_or("")).value_or(ElfLayout()),
-                   {{0x400000, 0x402000, "r-x", 0x0, "/a", "__TEXT"},
-                    {0x402000, 0x403000, "rw-", 0, "", ""},
-                    {0x100000000, 0x100001000, "r-x", 0x0, "/b", ""},
-                    {0x500000000, 0x500001000, "r--", 0x2000, "/a", "__TEXT"},
-                    {0x600000000, 0x600002000, "rw-", 0, "", "__BSS"}});
+    expectSegments("/relocated-apart-64", {{0x10000, 0x11000, "r--", 0x0, "/a", "__TEXT"},
+                                           {0x11000, 0x12000, "---", 0x0, "/a", ""},
+                                           {0x12000, 0x13000, "r-x", 0x1000, "/a", "__TEXT"},
+                                           {0x14000, 0x15000, "r--", 0x2000, "/a", "__DATA_CONST"},
+                                           {0x16000, 0x17000, "rw-", 0x3000, "/a", "__DATA"},
+                                           {0x17000, 0x19000, "rw-", 0, "", "__BSS"}});
+    expectSegments("/code-first-64", {{0x400000, 0x402000, "r-x", 0x0, "/a", "__TEXT"},
+                                      {0x402000, 0x403000, "rw-", 0, "", ""},
+                                      {0x100000000, 0x100001000, "r-x", 0x0, "/b", ""},
+                                      {0x500000000, 0x500001000, "r--", 0x2000, "/a", "__TEXT"},
+                                      {0x600000000, 0x600002000, "rw-", 0, "", "__BSS"}});
 }
 
-/// The segments of a process's images, by where they end, and the images' paths.
-struct Images {
+/// The segments of a process's images, by where they end; `paths` of the images.
+std::map<std::uint64_t, std::string> imagesOf(const test::Puppet& puppet, std::set<std::string>* paths) {
+    mach_port_t port = MACH_PORT_NULL;
+    EXPECT_EQ(task_read_for_pid(puppet.pid(), &port), KERN_SUCCESS);
+    const PortRight task(port);
     std::map<std::uint64_t, std::string> segments;
-    std::set<std::string> paths;
-
-    explicit Images(const test::Puppet& puppet) {
-        mach_port_t port = MACH_PORT_NULL;
-        EXPECT_EQ(task_read_for_pid(puppet.pid(), &port), KERN_SUCCESS);
-        const PortRight task(port);
-        RKForeachSymbolOwner(port, [&](const RKSymbolOwner& owner) {
-            paths.insert(owner.path);
-            for (const RKSegment& segment : owner.segments) {
-                segments[segment.start + segment.size] = segment.name;
-            }
-        });
-    }
-};
+    RKForeachSymbolOwner(port, [&](const RKSymbolOwner& owner) {
+        paths->insert(owner.path);
+        for (const RKSegment& segment : owner.segments) {
+            segments[segment.start + segment.size] = segment.name;
+        }
+    });
+    return segments;
+}
 
 TEST(Images, NothingThatAProcessMapsOfAnImageIsWithoutItsName) {
     const test::TemporaryFolder folder;
@@ -169,16 +157,17 @@ TEST(Images, NothingThatAProcessMapsOfAnImageIsWithoutItsName) {
     std::filesystem::remove(path);
     std::filesystem::copy_file(files + "/cut-64", path); // something else takes its place
 
-    const Images images(puppet);
-    EXPECT_TRUE(images.paths.contains("[vdso]"));
-    EXPECT_EQ(images.paths.contains(path + " (deleted)"), geteuid() == 0); // only root can still open it
+    std::set<std::string> paths;
+    const auto segments = imagesOf(puppet, &paths);
+    EXPECT_TRUE(paths.contains("[vdso]"));
+    EXPECT_EQ(paths.contains(path + " (deleted)"), geteuid() == 0); // only root can still open it
     std::set<std::string> seen;
     std::vector<Mapping> mappings;
     decodeMaps(readSystemFile(processFolder(puppet.pid()) + "/maps").value_or(""), &mappings);
     for (const Mapping& mapping : mappings) {
-        if (images.paths.contains(mapping.name)) {
-            const auto segment = images.segments.upper_bound(mapping.start);
-            ASSERT_NE(segment, images.segments.end());
+        if (paths.contains(mapping.name)) {
+            const auto segment = segments.upper_bound(mapping.start);
+            ASSERT_NE(segment, segments.end());
             EXPECT_EQ(mapping.writable, segment->second == "__DATA");
             EXPECT_TRUE(!mapping.executable || segment->second == "__TEXT");
             seen.insert(segment->second);
@@ -188,7 +177,8 @@ TEST(Images, NothingThatAProcessMapsOfAnImageIsWithoutItsName) {
 
     const std::string inMemory = "/dev/shm/tally-test-image-" + std::to_string(getpid());
     std::filesystem::copy_file(PUPPET_PROGRAM, inMemory);
-    EXPECT_FALSE(Images(test::Puppet({"idle"}, inMemory)).paths.contains(inMemory)) << "it is shared memory";
+    imagesOf(test::Puppet({"idle"}, inMemory), &paths);
+    EXPECT_FALSE(paths.contains(inMemory)) << "it is shared memory";
     std::filesystem::remove(inMemory);
 }
 
@@ -197,28 +187,26 @@ TEST(ThreadLayoutTable, AFileIsReadByOneOfManyAndAgainWhenItHasChanged) {
     const std::string path = folder.path() + "/map_files/0-0";
     std::filesystem::create_directory(folder.path() + "/map_files");
     std::filesystem::copy_file(files + "/usual-64", path);
-    const BackingObject object{.device = 0x4711};
-    const auto read = [&] { return layoutOfFile(object, folder.path(), Mapping()); };
+    const auto read = [&] { return layoutOfFile({.device = 0x4711}, folder.path(), Mapping()); };
     std::vector<std::shared_ptr<const ElfLayout>> layouts(8);
-    std::vector<std::thread> threads;
-    for (auto& layout : layouts) {
-        threads.emplace_back([&] { layout = read(); });
+    {
+        std::vector<std::jthread> threads;
+        for (auto& layout : layouts) {
+            threads.emplace_back([&] { layout = read(); });
+        }
     }
-    for (std::thread& thread : threads) {
-        thread.join();
-    }
-    ASSERT_TRUE(layouts[0]);
-    EXPECT_EQ(std::ranges::count(layouts, layouts[0]), 8);
-
+    const auto first = layouts[0];
+    ASSERT_TRUE(first);
+    EXPECT_EQ(std::ranges::count(layouts, first), 8);
     std::filesystem::rename(path, path + "-away");
-    EXPECT_EQ(read(), layouts[0]) << "not asked for again in the same gather";
+    EXPECT_EQ(read(), first) << "not asked for again in the same gather";
     beginLayouts();
     EXPECT_EQ(read(), nullptr) << "not there now";
     std::filesystem::rename(path + "-away", path);
-    EXPECT_EQ(read(), layouts[0]) << "the same file as before";
+    EXPECT_EQ(read(), first) << "the same file as before";
     beginLayouts();
     std::filesystem::last_write_time(path, std::filesystem::file_time_type());
-    EXPECT_NE(read(), layouts[0]);
+    EXPECT_NE(read(), first);
 }
 
 } // namespace

@@ -4,28 +4,33 @@
 #include "linux/Puppet.h"
 #include "platform/bsd_process.h"
 #include "platform/gather.h"
+#include "platform/linux/io/Descriptor.h"
 #include "platform/linux/owned/HeldFiles.h"
 #include "platform/linux/owned/OwnedGather.h"
+#include "platform/linux/walk/Mapping.h"
 #include "platform/mach_task.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <sys/shm.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
+#include <array>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <map>
+#include <set>
 
 namespace tally::platform {
 namespace {
 
 using test::Puppet;
 
-std::vector<OwnedRecord> ownedBy(const Puppet& puppet) {
+std::vector<OwnedRecord> ownedBy(std::int32_t pid) {
     mach_port_t task = MACH_PORT_NULL;
-    EXPECT_EQ(task_read_for_pid(puppet.pid(), &task), KERN_SUCCESS);
+    EXPECT_EQ(task_read_for_pid(pid, &task), KERN_SUCCESS);
     const PortRight right(task);
     std::size_t length = 0;
     EXPECT_EQ(sysctl_owned_vmobjects(task, {}, &length), 0);
@@ -41,38 +46,57 @@ std::vector<OwnedRecord> ownedBy(const Puppet& puppet) {
     return records;
 }
 
+/// A file of `size` bytes of which the first `pages` are there.
+Descriptor filled(int number, off_t size, std::size_t pages) {
+    const std::string bytes(pages * basePage, 'x');
+    EXPECT_EQ(ftruncate(number, size), 0);
+    EXPECT_EQ(pwrite(number, bytes.data(), bytes.size(), 0), static_cast<ssize_t>(bytes.size()));
+    return Descriptor(number);
+}
+
+int deletedFile(std::string path) {
+    const int file = mkostemp(path.data(), O_CLOEXEC);
+    unlink(path.c_str());
+    return file;
+}
+
 TEST(Owned, WhatADescriptorOrASegmentAloneKeepsIsListedToTheByte) {
-    const test::HugePagePool pool(1);
     const test::TemporaryFolder folder;
-    const std::filesystem::path before = std::filesystem::current_path();
-    std::filesystem::current_path(folder.path());
-    const Puppet puppet({"hold"}, LAYOUTS_PROGRAM);
-    std::filesystem::current_path(before);
-    std::vector<OwnedRecord> records = ownedBy(puppet);
-    EXPECT_EQ(segmentsCreatedBy(puppet.pid(), 0).size(), 1U);
-    EXPECT_TRUE(segmentsCreatedBy(puppet.pid(), 1ULL << 40).empty()) << "another, that has the pid again";
-    bool hasMap = false;
-    for (const Puppet::Entry& entry : puppet.ledger()) {
-        const auto figure = [&](const char* key) {
-            return entry.figures.contains(key) ? std::stoull(entry.figures.at(key)) : 0;
-        };
-        if (entry.name == "bpf") {
-            hasMap = true;
-            continue; // the kernel alone knows how much it is
-        }
-        if (entry.name == "segment") {
-            shmctl(static_cast<int>(entry.address), IPC_RMID, nullptr);
-        }
-        const auto record = std::ranges::find_if(records, [&](const OwnedRecord& r) {
-            return r.residentSize == entry.size && r.virtualSize == figure("size") &&
-                   r.wiredSize == figure("wired") && r.compressedSize + r.reusableSize == 0 && r.flags == 48;
-        });
-        EXPECT_EQ(record != records.end(), entry.figures.at("listed") == "yes") << entry.name;
-        if (record != records.end()) {
-            records.erase(record);
-        }
+    ASSERT_EQ(mkfifo((folder.path() + "/fifo").c_str(), 0600), 0);
+    const Descriptor fifo(open((folder.path() + "/fifo").c_str(), O_RDWR | O_CLOEXEC));
+    const Descriptor memfd = filled(memfd_create("held", MFD_CLOEXEC), 0x10000, 12);
+    const Descriptor again(fcntl(memfd.number(), F_DUPFD_CLOEXEC, 0));
+    const Descriptor sparse = filled(memfd_create("sparse", MFD_CLOEXEC), 1LL << 40, 1);
+    const Descriptor empty = filled(memfd_create("empty", MFD_CLOEXEC), 0x8000, 0);
+    const Descriptor deleted = filled(deletedFile("/dev/shm/tally-test-XXXXXX"), 9 * 0x1000, 9);
+    const Descriptor onDisk = filled(deletedFile("/var/tmp/tally-test-XXXXXX"), 11 * 0x1000, 11);
+    const Descriptor mapped = filled(memfd_create("mapped", MFD_CLOEXEC), 0x8000, 5);
+    mmap(nullptr, basePage, PROT_READ, MAP_SHARED, mapped.number(), 0);
+    const int segment = shmget(IPC_PRIVATE, 20 * 0x1000, 0600 | IPC_CREAT);
+    auto* const memory = static_cast<char*>(shmat(segment, nullptr, 0));
+    memory[0] = memory[5 * 0x1000] = 1;
+    shmdt(memory);
+    using Sizes = std::multiset<std::array<std::uint64_t, 3>>; // virtual, resident, wired
+    Sizes expected{{0x10000, 0xc000, 0}, {1ULL << 40, 0x1000, 0}, {0x9000, 0x9000, 0}, {0x14000, 0x2000, 0}};
+    const test::HugePagePool pool(1);
+    const Descriptor huge(memfd_create("huge", MFD_CLOEXEC | MFD_HUGETLB));
+    if (fallocate(huge.number(), 0, 0, 2 << 20) == 0) {
+        expected.insert({2 << 20, 2 << 20, 2 << 20});
     }
-    EXPECT_EQ(records.size(), hasMap ? 1U : 0U);
+    Sizes found;
+    for (const OwnedRecord& r : ownedBy(getpid())) {
+        found.insert({r.virtualSize, r.residentSize, r.wiredSize});
+        EXPECT_EQ(r.flags, OwnedRecord::notPurgeable);
+        EXPECT_EQ(r.reusableSize + r.compressedSize, 0U);
+    }
+    EXPECT_EQ(segmentsCreatedBy(getpid(), 0).size(), 1U);
+    EXPECT_TRUE(segmentsCreatedBy(getpid(), 1ULL << 40).empty()) << "a process that has the pid again";
+    shmctl(segment, IPC_RMID, nullptr);
+    for (const auto& sizes : expected) {
+        EXPECT_EQ(found.count(sizes), 1U) << sizes[0];
+    }
+    EXPECT_EQ(found.count({0x8000, 0x5000, 0}) + found.count({0x8000, 0, 0}), 0U) << "mapped, empty";
+    EXPECT_EQ(found.count({0xb000, 0xb000, 0}), 0U) << "on disk";
     if (pool.granted() == 0) {
         GTEST_SKIP() << "this machine grants no huge pages: no memfd of huge pages was held";
     }
@@ -90,15 +114,15 @@ TEST(Owned, OfSeveralHoldersTheFirstThatAsksListsAnObjectInAGather) {
     const Puppet one({"open", file.path}, LAYOUTS_PROGRAM);
     const Puppet two({"open", file.path}, LAYOUTS_PROGRAM);
     const Puppet mapper({"fill", file.path, "6"});
-    EXPECT_TRUE(ownedBy(one).empty()) << "the file has a path as yet, which keeps it";
+    EXPECT_TRUE(ownedBy(one.pid()).empty()) << "the file has a path as yet, which keeps it";
     unlink(file.path.c_str());
-    EXPECT_EQ(ownedBy(one).size() + ownedBy(two).size(), 2U) << "no gather: everyone holds it";
+    EXPECT_EQ(ownedBy(one.pid()).size() + ownedBy(two.pid()).size(), 2U) << "no gather: everyone holds it";
     for (const bool turned : {false, true}) {
         const GatherScope gather;
-        EXPECT_EQ(ownedBy(turned ? two : one).size(), 1U);
-        EXPECT_EQ(ownedBy(turned ? one : two).size(), 0U);
-        EXPECT_EQ(ownedBy(turned ? two : one).size(), 1U) << "asked again";
-        EXPECT_TRUE(ownedBy(mapper).empty());
+        EXPECT_EQ(ownedBy((turned ? two : one).pid()).size(), 1U);
+        EXPECT_EQ(ownedBy((turned ? one : two).pid()).size(), 0U);
+        EXPECT_EQ(ownedBy((turned ? two : one).pid()).size(), 1U) << "asked again";
+        EXPECT_TRUE(ownedBy(mapper.pid()).empty());
     }
 }
 
@@ -112,34 +136,33 @@ TEST(Owned, TheHolderPaysForWhatOthersMapAndASearchFindsThem) {
     unlink(file.path.c_str());
     const std::string held = std::to_string(holder.pid());
     const std::string mapped = std::to_string(mapper.pid());
-    /// The dirty bytes of the file in the section that begins with `title`.
-    const auto bytesIn = [&](const std::string& title, std::vector<std::string> arguments) {
+    const auto report = [&](std::vector<std::string> arguments) {
         arguments.insert(arguments.begin(), {TALLY_PROGRAM, "-w", "-v", "-f", "bytes", "--pid", held});
-        const std::string report = test::run(arguments).output;
-        const std::size_t section = report.find(title);
-        EXPECT_NE(section, std::string::npos) << report;
-        const std::size_t row = report.find("    mapped file " + file.path + " (deleted)\n", section);
-        EXPECT_NE(row, std::string::npos) << report;
-        return std::stoll(report.substr(report.rfind('\n', row) + 1));
+        return test::run(arguments).output;
     };
-    EXPECT_EQ(bytesIn("Shared with puppet [" + mapped + "]", {"--pid", mapped}), 16 * 4096);
-    EXPECT_EQ(bytesIn("Shared with layouts [" + held + "]", {"--pid", mapped}), 0);
-    EXPECT_EQ(bytesIn("Summary Tally", {"--pid", mapped}), 16 * 4096);
-    EXPECT_EQ(bytesIn("Shared with puppet [" + mapped + "]", {"--unmapped"}), 16 * 4096);
+    /// The dirty bytes of the file in the section that begins with `title`.
+    const auto bytesIn = [&](const std::string& text, const std::string& title) {
+        const std::size_t row = text.find("    mapped file " + file.path + " (deleted)\n", text.find(title));
+        EXPECT_NE(row, std::string::npos) << text;
+        return std::atoi(text.c_str() + text.rfind('\n', row) + 1);
+    };
+    const std::string both = report({"--pid", mapped});
+    EXPECT_EQ(bytesIn(both, "Shared with puppet [" + mapped + "]"), 16 * 4096);
+    EXPECT_EQ(bytesIn(both, "Shared with layouts [" + held + "]"), 0);
+    EXPECT_EQ(bytesIn(both, "Summary Tally"), 16 * 4096);
+    EXPECT_EQ(bytesIn(report({"--unmapped"}), "Shared with puppet [" + mapped + "]"), 16 * 4096);
 }
 
 TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
     const test::TemporaryFolder folder;
-    const auto fd = std::filesystem::path(folder.path()) / "fd";
-    const auto fdinfo = std::filesystem::path(folder.path()) / "fdinfo";
-    std::filesystem::create_directory(fd);
-    std::filesystem::create_directory(fdinfo);
+    std::filesystem::create_directory(folder.path() + "/fd");
+    std::filesystem::create_directory(folder.path() + "/fdinfo");
+    const std::string card = "/dev/dri/renderD128";
     struct Case {
         std::string link;
         const char* info;
         std::vector<std::uint64_t> record; // flags, virtual, resident, wired, reusable size; empty: none
     };
-    const std::string card = "/dev/dri/renderD128";
     const Case cases[] = {
         {"/dmabuf:",
          "pos:\t0\nino:\t91\nsize:\t65536\nexp_name:\tsystem\nname:\ta: b\n",
@@ -147,11 +170,9 @@ TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
         {"/dmabuf:", "ino:\t92\nsize:\t4096\nexp_name:\tudmabuf\n", {}}, // a memfd has these pages
         {"/dmabuf:", "size:\t4096\n", {}},                               // no telling it from others
         {"/dmabuf:", "ino:\t93\nsize:\tmany\n", {}},
-        {"/dmabuf:", "", {}},
         {card,
-         "drm-driver:\tx\ndrm-client-id:\t7\ndrm-total-system0:\t9 MiB\ndrm-shared-system0:\t2048 KiB\n"
-         "drm-resident-system0:\t5 MiB\ndrm-purgeable-system0:\t4096\ndrm-engine-render:\t123 ns\n"
-         "drm-total-vram0:\t64 MiB\ndrm-resident-vram0:\t64 MiB\n",
+         "drm-client-id:\t7\ndrm-total-system0:\t9 MiB\ndrm-shared-system0:\t2048 KiB\ndrm-engine-x:\t1 ns\n"
+         "drm-resident-system0:\t5 MiB\ndrm-purgeable-system0:\t4096\ndrm-resident-vram0:\t64 MiB\n",
          {56, 7 << 20, 3 << 20, 0, 4096}},
         {card,
          "drm-client-id: 8\ndrm-memory-gtt: 100 KiB\ndrm-memory-cpu: 4 KiB\n",
@@ -162,32 +183,20 @@ TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
         {"anon_inode:bpf-map",
          "max_entries:\t2\nmemlock:\t36864\nmap_id:\t3\n",
          {49, 36864, 36864, 36864, 0}},
-        {"anon_inode:bpf-map", "memlock:\t36864\n", {}},
         {"anon_inode:[eventfd]", "memlock:\t36864\nmap_id:\t4\n", {}},
         {"/" + std::string(4000, 'x') + " (deleted)", "ino:\t91\nsize:\t65536\n", {}},
     };
     for (const Case& c : cases) {
-        std::filesystem::create_symlink(c.link, fd / "3");
-        std::ofstream(fdinfo / "3") << c.info;
+        std::filesystem::create_symlink(c.link, folder.path() + "/fd/3");
+        std::ofstream(folder.path() + "/fdinfo/3") << c.info;
         std::vector<std::uint64_t> record;
         EXPECT_TRUE(forEachHeldObject(folder.path(), [&](const OwnedRecord& r) {
             record = {r.flags, r.virtualSize, r.residentSize, r.wiredSize, r.reusableSize};
         }));
         EXPECT_EQ(record, c.record) << c.info;
-        std::filesystem::remove(fd / "3");
+        std::filesystem::remove(folder.path() + "/fd/3");
     }
     EXPECT_FALSE(forEachHeldObject(folder.path() + "/none", [](const OwnedRecord&) {}));
-}
-
-TEST(Owned, SegmentsAreReadFromTheKernelsTable) {
-    const auto segments = decodeSysVSegments(
-        "       key      shmid perms                  size  cpid  lpid nattch   uid   gid  cuid  cgid\n"
-        "        -1         32  1600               6291456  7786 1 0 0 0 0 0 1 2 1790000000  6287360 4096\n"
-        "         0         33  1600                  4096     1 1 0 0 0 0 0 1 2 3           4096\n");
-    ASSERT_EQ(segments.size(), 1U);
-    EXPECT_TRUE(segments[0].id == 32 && segments[0].creator == 7786 && segments[0].changed == 1790000000);
-    EXPECT_TRUE(segments[0].size == 6291456 && segments[0].resident == 6287360 &&
-                segments[0].swapped == 4096);
 }
 
 } // namespace
