@@ -58,8 +58,14 @@ TEST(ElfLayout, ReadsBothClassesAndRefusesWhatNoLoaderTakes) {
     for (std::size_t length = 0; length < usual.size(); ++length) {
         EXPECT_EQ(layoutOf(usual.substr(0, length)), std::nullopt) << length;
     }
-    // As many headers as a huge file could hold.
+    // As many headers, or sections, as a huge file could hold.
     EXPECT_EQ(layoutOf(readSystemFile(files + "/many-headers-64").value_or(""), 1LL << 40), std::nullopt);
+    std::string sections = usual + std::string(sizeof(Elf64_Shdr), '\0');
+    auto* header = reinterpret_cast<Elf64_Ehdr*>(sections.data());
+    header->e_shoff = usual.size();
+    header->e_shnum = 0;
+    reinterpret_cast<Elf64_Shdr*>(sections.data() + usual.size())->sh_size = 1ULL << 40;
+    EXPECT_TRUE(layoutOf(sections, 1LL << 50)) << "only what is loaded matters";
     EXPECT_EQ(layoutOf("!<arch>\n"), std::nullopt);
     EXPECT_EQ(readElfLayout(Descriptor()), std::nullopt);
 }

@@ -1,5 +1,6 @@
 #include "platform/linux/images/ElfLayout.h"
 
+#include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/walk/Mapping.h"
 
 #include <gelf.h>
@@ -9,6 +10,7 @@
 #include <cstddef>
 #include <limits>
 #include <memory>
+#include <span>
 
 namespace tally::platform {
 
@@ -28,6 +30,41 @@ bool isMappable(const LoadSegment& load) {
            (load.fileSize == 0 || (load.address - load.fileOffset) % basePage == 0);
 }
 
+using ElfHandle = std::unique_ptr<Elf, int (*)(Elf*)>;
+
+ElfHandle elfOf(std::vector<char>& bytes) {
+    static const bool isReady = elf_version(EV_CURRENT) != EV_NONE;
+    return {isReady ? elf_memory(bytes.data(), bytes.size()) : nullptr, elf_end};
+}
+
+/// None when they cannot be read. The library is given a copy of the headers alone: of a whole file it makes
+/// a record of every section too, and a file of 4 KiB can claim billions.
+std::vector<GElf_Phdr> programHeaders(const Descriptor& file) {
+    std::vector<char> bytes(sizeof(Elf64_Ehdr)); // of both classes: a file with something to load is longer
+    GElf_Ehdr header;
+    if (!readExactly(file, 0, std::as_writable_bytes(std::span(bytes))) ||
+        gelf_getehdr(elfOf(bytes).get(), &header) == nullptr || header.e_phnum > mostHeaders) {
+        return {};
+    }
+    const std::size_t start = bytes.size();
+    const std::size_t size = gelf_fsize(elfOf(bytes).get(), ELF_T_PHDR, header.e_phnum, EV_CURRENT);
+    bytes.resize(start + size);
+    const ElfHandle elf = elfOf(bytes);
+    const bool isRead =
+        readExactly(file, header.e_phoff, std::as_writable_bytes(std::span(bytes).subspan(start)));
+    header.e_phoff = start;
+    if (!isRead || gelf_update_ehdr(elf.get(), &header) == 0) {
+        return {};
+    }
+    std::vector<GElf_Phdr> headers(header.e_phnum);
+    for (int i = 0; i < header.e_phnum; ++i) {
+        if (gelf_getphdr(elf.get(), i, &headers[i]) == nullptr) {
+            return {};
+        }
+    }
+    return headers;
+}
+
 bool areApart(const std::vector<LoadSegment>& loads) {
     return std::adjacent_find(loads.begin(), loads.end(), [](const LoadSegment& a, const LoadSegment& b) {
                return b.address < a.address + a.memorySize;
@@ -43,20 +80,8 @@ std::uint64_t LoadSegment::endOfFilePages() const {
 std::uint64_t LoadSegment::endPage() const { return pageAbove(address + memorySize); }
 
 std::optional<ElfLayout> readElfLayout(const Descriptor& file) {
-    static const bool isReady = elf_version(EV_CURRENT) != EV_NONE;
-    const std::unique_ptr<Elf, int (*)(Elf*)> elf(
-        isReady ? elf_begin(file.number(), ELF_C_READ, nullptr) : nullptr, elf_end);
-    std::size_t count = 0;
-    if (!elf || elf_kind(elf.get()) != ELF_K_ELF || elf_getphdrnum(elf.get(), &count) != 0 ||
-        count > mostHeaders) {
-        return std::nullopt;
-    }
     ElfLayout layout;
-    for (std::size_t i = 0; i < count; ++i) {
-        GElf_Phdr header;
-        if (gelf_getphdr(elf.get(), static_cast<int>(i), &header) == nullptr) {
-            return std::nullopt;
-        }
+    for (const GElf_Phdr& header : programHeaders(file)) {
         if (header.p_type == PT_LOAD && header.p_memsz != 0) {
             layout.loads.push_back({.address = header.p_vaddr,
                                     .memorySize = header.p_memsz,

@@ -72,6 +72,11 @@ bool readLines(const Descriptor& file, const std::function<void(std::string_view
     return isWhole;
 }
 
+bool readExactly(const Descriptor& file, std::uint64_t offset, std::span<std::byte> bytes) {
+    return pread(file.number(), bytes.data(), bytes.size(), static_cast<off_t>(offset)) ==
+           static_cast<ssize_t>(bytes.size());
+}
+
 std::optional<std::string> readSystemFile(const std::string& path) {
     const Descriptor file = openForReading(path);
     std::string text;

@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <functional>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -36,6 +37,10 @@ bool readToEnd(const Descriptor& file, std::string& text);
 /// Reads from `file` to its end and hands on what it reads, a block of whole lines at a time: for texts that
 /// grow with the process that they tell of. @return as readToEnd.
 bool readLines(const Descriptor& file, const std::function<void(std::string_view lines)>& take);
+
+/// Fills `bytes` with what stands in `file` from `offset` on. @return false when it cannot be read or ends
+/// before.
+bool readExactly(const Descriptor& file, std::uint64_t offset, std::span<std::byte> bytes);
 
 /// The whole file at `path`; absent on failure, with errno.
 std::optional<std::string> readSystemFile(const std::string& path);

@@ -3,19 +3,11 @@
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/walk/Mapping.h"
 
-#include <unistd.h>
-
 namespace tally::platform {
 
 namespace {
 
 constexpr std::uint64_t pagemapPresent = std::uint64_t{1} << 63;
-
-template <typename Word>
-bool readExactly(const Descriptor& file, std::uint64_t offset, std::span<Word> words) {
-    return pread(file.number(), words.data(), words.size_bytes(), static_cast<off_t>(offset)) ==
-           static_cast<ssize_t>(words.size_bytes());
-}
 
 } // namespace
 
@@ -31,8 +23,9 @@ bool PresentMemory::open() {
 bool PresentMemory::read(std::uint64_t address, std::span<std::uint64_t> words) {
     std::uint64_t entry = 0;
     return open() &&
-           readExactly(pagemap_, address / basePage * sizeof entry, std::span<std::uint64_t>(&entry, 1)) &&
-           (entry & pagemapPresent) != 0 && readExactly(memory_, address, words);
+           readExactly(pagemap_, address / basePage * sizeof entry,
+                       std::as_writable_bytes(std::span(&entry, 1))) &&
+           (entry & pagemapPresent) != 0 && readExactly(memory_, address, std::as_writable_bytes(words));
 }
 
 } // namespace tally::platform
