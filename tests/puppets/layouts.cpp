@@ -101,7 +101,7 @@ void runtimes(const std::string& library) {
     tell("above-go", memoryAt(0xc100000000 + page), 0);
     tell("java", memoryAt(0x600000000 + page), java);
     tell("aligned", memoryAt(0x900000000), library.ends_with("libjemalloc.so.2") ? 106 : 0);
-    tell("generated-code", memoryAt(0xa00000000, PROT_EXEC), java != 0 ? java : 64);
+    tell("generated-code", memoryAt(0xa00000000, PROT_EXEC), java != 0 ? java : 107);
 }
 
 } // namespace

@@ -26,6 +26,7 @@ constexpr Description ownTags[] = {
     {tags::kernelPages, "kernel pages for user code"},
     {tags::goHeap, "Go heap"},
     {tags::jemalloc, "jemalloc"},
+    {tags::generatedCode, "generated code"},
     {tags::otherNamed, "other named memory"},
 };
 
@@ -46,7 +47,7 @@ constexpr KnownName knownNames[] = {
     {"scudo:secondary", tags::mallocLarge},
     {"dalvik-jit-code", tags::generatedCode},
     {"dalvik-", tags::java},
-    {"js-executable-memory", tags::generatedCode},
+    {"js-executable-memory", tags::scriptCode},
     {"Go: heap", tags::goHeap},
 };
 

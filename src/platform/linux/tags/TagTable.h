@@ -22,7 +22,7 @@ inline constexpr std::uint32_t stack = 30;
 inline constexpr std::uint32_t guard = 31;
 inline constexpr std::uint32_t java = 44;
 inline constexpr std::uint32_t loaderMalloc = 61;
-inline constexpr std::uint32_t generatedCode = 64;
+inline constexpr std::uint32_t scriptCode = 64;
 
 // Of this system.
 inline constexpr std::uint32_t sharedAnonymous = 100;
@@ -32,7 +32,8 @@ inline constexpr std::uint32_t hugePagePool = 103;
 inline constexpr std::uint32_t kernelPages = 104;
 inline constexpr std::uint32_t goHeap = 105;
 inline constexpr std::uint32_t jemalloc = 106;
-inline constexpr std::uint32_t otherNamed = 109; // when there are more names than slots
+inline constexpr std::uint32_t generatedCode = 107; // by whatever program: also for patterns or foreign calls
+inline constexpr std::uint32_t otherNamed = 109;    // when there are more names than slots
 inline constexpr std::uint32_t firstNamed = 110;
 inline constexpr std::uint32_t lastNamed = 239;
 
