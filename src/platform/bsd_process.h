@@ -21,10 +21,9 @@ struct proc_bsdinfo {
     std::uint32_t pbi_status = 0; // SZOMB or another state
     std::uint32_t pbi_pid = 0;
     std::uint32_t pbi_ppid = 0;
-    char pbi_comm[16] = {};            // command name
-    char pbi_name[32] = {};            // process name, empty when there is none
-    std::uint64_t pbi_start_ticks = 0; // start time, in clock ticks since boot
-    char reserved[64] = {};
+    char pbi_comm[16] = {}; // command name
+    char pbi_name[32] = {}; // process name, empty when there is none
+    char reserved[72] = {};
 };
 static_assert(sizeof(proc_bsdinfo) == 136);
 

@@ -28,7 +28,7 @@ struct TLImage {
 TLSegmentKind segmentKindForName(std::string_view name);
 
 /// A cursor over images sorted by start; it only moves forward, so it is asked in rising address order.
-/// The list may grow behind the cursor while it is used.
+/// The list may grow at its end meanwhile.
 class TLImageEnumerator {
   public:
     explicit TLImageEnumerator(const std::vector<TLImage>& images) : images_(&images) {}

@@ -1,7 +1,7 @@
 // TLMemoryRegion: one mapped range of a process, a piece of one, or memory that is charged to it unmapped.
 //
 // A plain record of at most 160 bytes: a process can have 100,000 of them. Its walk makes and sizes it; the
-// analysis adds it to one memory object; afterwards it is only read.
+// analysis adds it to one memory object, whose name one that is not mapped takes; afterwards it is only read.
 
 #pragma once
 
@@ -24,7 +24,7 @@ inline constexpr std::uint64_t TLNotSet = ~std::uint64_t{0};
 
 /// Which kind of image segment covers a region.
 enum class TLSegmentKind : std::uint8_t {
-    notSet = 0,   // pseudo-regions, gaps of the shared cache before any image
+    notSet = 0,   // pseudo-regions, shared cache without an image on either side
     none = 1,     // an ordinary mapping that no image segment covers
     text = 2,     // "__TEXT...", "__OBJC_RO...", image headers
     data = 3,     // any other segment whose name begins "__"
@@ -57,7 +57,7 @@ struct TLMemoryRegion {
     std::uint64_t swappedSize = 0;
     std::uint64_t cleanNonSpecSize = 0;
     std::uint64_t object_id = 0;               // 0: no object; TLNotSet: the page tables
-    std::unique_ptr<TLRangeList> subrangeList; // handed over when the region is added to its object
+    std::unique_ptr<TLRangeList> subrangeList; // dropped once its object has merged it
 
     /// `start` + `size`; TLNotSet for a region that is not mapped.
     std::uint64_t end() const { return start == TLNotSet ? TLNotSet : start + size; }

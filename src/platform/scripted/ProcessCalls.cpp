@@ -89,7 +89,6 @@ int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
     info->pbi_ppid = task->parent;
     fillField(info->pbi_comm, commandName(*task));
     fillField(info->pbi_name, task->name);
-    info->pbi_start_ticks = task->startTicks;
     return sizeof *info;
 }
 

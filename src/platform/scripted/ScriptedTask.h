@@ -109,7 +109,6 @@ struct TaskRecord {
     std::string name{};                // process name; the record takes its first 32 bytes
     std::optional<std::string> comm{}; // command name; absent: the name. The record takes its first 16 bytes
     std::uint32_t flags = PROC_FLAG_LP64;
-    std::uint64_t startTicks = 0;
     TaskState state = TaskState::alive;
 
     std::string path{};                           // of the executable; empty: "/bin/<name>"

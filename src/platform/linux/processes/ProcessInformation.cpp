@@ -119,7 +119,6 @@ int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
     info->pbi_status = stat->isZombie() ? SZOMB : SRUN;
     info->pbi_pid = static_cast<std::uint32_t>(pid);
     info->pbi_ppid = static_cast<std::uint32_t>(stat->parent);
-    info->pbi_start_ticks = stat->startTicks;
     copyName(info->pbi_comm, stat->comm);
     copyName(info->pbi_name, nameFromArguments(pid, stat->comm));
     return sizeof(proc_bsdinfo);
