@@ -35,6 +35,8 @@ std::vector<OwnedRecord> ownedBy(std::int32_t pid) {
     std::size_t length = 0;
     EXPECT_EQ(sysctl_owned_vmobjects(task, {}, &length), 0);
     std::vector<std::byte> reply(length + sizeof(OwnedRecord));
+    EXPECT_EQ(sysctl_owned_vmobjects(task, std::span(reply).first(4), &length), 0);
+    EXPECT_EQ(length, 4U);
     EXPECT_EQ(sysctl_owned_vmobjects(task, reply, &length), 0);
     std::uint64_t count = 0;
     std::memcpy(&count, reply.data(), sizeof count);

@@ -56,25 +56,6 @@ TEST(Program, KernelsWithoutTheNewQueriesGiveTheSameReport) {
     }
 }
 
-TEST(Program, UnrelatedProcessesShareOneObjectAndTheSummaryCountsItOnce) {
-    const std::string path = "/dev/shm/tally-test-share-" + std::to_string(getpid());
-    {
-        std::ofstream file(path);
-        const std::string bytes(64 * 4096, 'x');
-        file << bytes;
-    }
-    const Puppet writer({"fill", path, "40"}); // pages 0 to 39
-    const Puppet reader({"share", path});      // all 64
-    const Outcome outcome =
-        tallyOf({"-f", "bytes", "--pid", pidOf(writer), "--pid", pidOf(reader), "-v", "-w"});
-    std::filesystem::remove(path);
-    ASSERT_EQ(outcome.status, 0);
-    const std::string row = "mapped file " + path;
-    EXPECT_EQ(bytesOf(outcome.output, "Shared with puppet [" + pidOf(reader) + "]", row), 40 * 4096);
-    EXPECT_EQ(bytesOf(outcome.output, "Shared with puppet [" + pidOf(writer) + "]", row), 64 * 4096);
-    EXPECT_EQ(bytesOf(outcome.output, "Summary Tally", row), 64 * 4096);
-}
-
 TEST(Program, AProcessIsChargedWhatTheKernelSays) {
     const Puppet puppet({"big", "32"});
     const Outcome outcome = tallyOf({"-f", "bytes", "--pid", pidOf(puppet)});
@@ -169,20 +150,6 @@ TEST(Program, ClosedStreamsAndAClosedPipeEndNothing) {
               1);
     EXPECT_EQ(run({"/bin/sh", "-c", "{ " + command + " -v; echo $? >&2; } | true"}).errors, "0\n");
     EXPECT_EQ(run({"/bin/sh", "-c", command + " >/dev/full"}).status, 0);
-}
-
-TEST(Program, AFileThatBearsTheNameOfProcessesIsNoticed) {
-    const Puppet first({"idle"});
-    const Puppet second({"idle"});
-    const TemporaryFolder folder;
-    { std::ofstream file(folder.path() + "/puppet"); }
-    const Outcome outcome = tallyOf({"puppet"}, folder.path());
-    EXPECT_EQ(outcome.status, 0);
-    EXPECT_TRUE(outcome.errors.starts_with("NOTICE: ")) << outcome.errors;
-    { std::ofstream file(folder.path() + "/no-such-name"); }
-    const Outcome neither = tallyOf({"no-such-name"}, folder.path());
-    EXPECT_EQ(neither.status, 1);
-    EXPECT_TRUE(neither.errors.starts_with("Error opening heapsnap ")) << neither.errors;
 }
 
 TEST(Program, ProcessesThatComeAndGoDisturbNothing) {

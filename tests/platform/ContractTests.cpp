@@ -342,33 +342,14 @@ TEST_F(Contract, TheAccountingSwitchIsRememberedAndNoOtherIsThere) {
     }
 }
 
-TEST_F(Contract, TheOwnedListHasRoomForWhatItCounts) {
-    const PortRight port = portOf(pid);
-    std::size_t needed = 0;
-    if (sysctl_owned_vmobjects(port.name(), {}, &needed) != 0) {
-        EXPECT_EQ(errno, ENOENT) << "a platform without the list says so";
-        return;
-    }
-    std::vector<std::byte> reply(needed + 896);
-    std::size_t length = 0;
-    ASSERT_EQ(sysctl_owned_vmobjects(port.name(), reply, &length), 0);
-    if (length != 0) {
-        std::uint64_t records = 0;
-        ASSERT_GE(length, sizeof records);
-        std::memcpy(&records, reply.data(), sizeof records);
-        EXPECT_EQ(length, sizeof records + records * 56);
-        std::vector<std::byte> little(8);
-        EXPECT_EQ(sysctl_owned_vmobjects(port.name(), little, &length), 0);
-        EXPECT_EQ(length, 8);
-    }
-}
-
 TEST_F(Contract, APortLivesAsLongAsItsReferences) {
     mach_port_t task = MACH_PORT_NULL;
     ASSERT_EQ(task_read_for_pid(pid, &task), KERN_SUCCESS);
     ASSERT_EQ(mach_port_retain(task), KERN_SUCCESS);
     ASSERT_EQ(mach_port_deallocate(task), KERN_SUCCESS);
     EXPECT_EQ(regionAt(task, 0).status, KERN_SUCCESS);
+    EXPECT_FALSE(task_has_relatives(portOf(pid).name())) << "a process is none of its own";
+    EXPECT_TRUE(task_has_relatives(MACH_PORT_NULL)) << "as far as can be told";
     {
         const GatherScope gather;
         EXPECT_EQ(regionAt(task, 0).status, KERN_SUCCESS);
@@ -418,27 +399,6 @@ TEST_F(Contract, AnApplyRunsEveryIndexOnce) {
     std::thread::id only;
     dispatch_apply(1, {}, [&](std::size_t) { only = std::this_thread::get_id(); });
     EXPECT_EQ(only, std::this_thread::get_id());
-}
-
-TEST_F(Contract, DifferentTasksAreAskedAtOnce) {
-    const std::int32_t pids[] = {pid, ownPid()};
-    const GatherScope gather;
-    dispatch_apply(2, {}, [&](std::size_t index) {
-        for (int round = 0; round < 3; ++round) {
-            const PortRight port = portOf(pids[index]);
-            EXPECT_FALSE(walk(port.name()).empty());
-            rusage_info_v5 usage;
-            EXPECT_EQ(proc_pid_rusage(pids[index], &usage), 0);
-        }
-    });
-}
-
-TEST_F(Contract, AProcessIsNoRelativeOfItself) {
-    const PortRight first = portOf(pid);
-    const PortRight second = portOf(pid);
-    EXPECT_FALSE(task_has_relatives(first.name()));
-    EXPECT_FALSE(task_has_relatives(second.name()));
-    EXPECT_TRUE(task_has_relatives(MACH_PORT_NULL)); // as far as can be told
 }
 
 TEST_F(Contract, ASignalSourceTakesInterruptsUntilItIsCancelled) {
