@@ -3,11 +3,11 @@
 
   bench.py TALLY PROGRAMS [NAME ...]
 
-TALLY is the tool, PROGRAMS the folder of puppet and latency. NAMEs choose among: population big mappings scaling latency
-(all). Commands that are compared run in turn, five times each after one run that does not count; figures are medians.
+TALLY is the tool, PROGRAMS the folder of puppet and latency. NAMEs choose among: population libraries big mappings scaling
+latency (all). Commands that are compared run in turn, five times each after one run that does not count; figures are medians.
 Everything that is started is ended by pid.
 """
-import json, os, platform, resource, shutil, signal, statistics, subprocess, sys, time
+import contextlib, json, os, platform, resource, shutil, signal, statistics, subprocess, sys, time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 RUNS = 5
@@ -84,6 +84,17 @@ def population(tally, programs):
         compare("The population (370 processes)", [("tally -a", [tally, "-a"])] + others() + [SMAPS_OF_ALL])
 
 
+# Modules with libraries of their own: some 150 mappings a process.
+INTERPRETER = "import ssl, sqlite3, ctypes, lzma, bz2, decimal, hashlib, asyncio, email, xml.etree.ElementTree, multiprocessing.shared_memory, sys; print('ready', flush=True); sys.stdin.read()"
+
+
+def libraries(tally, programs):
+    with contextlib.ExitStack() as interpreters:
+        for _ in range(200):
+            interpreters.enter_context(Child([sys.executable, "-c", INTERPRETER], "ready"))
+        compare("200 interpreters with many libraries", [("tally -a", [tally, "-a"]), SMAPS_OF_ALL])
+
+
 def big(tally, programs):
     with Child([programs + "/puppet", "big", "2048"], "ready") as child:
         pid = str(child.process.pid)
@@ -145,9 +156,9 @@ def latency(tally, programs):
 def main():
     tally, programs = sys.argv[1:3]
     print("Linux %s, %d processors, %s" % (platform.release(), os.cpu_count(), time.strftime("%Y-%m-%d")))
-    for name in sys.argv[3:] or ["population", "big", "mappings", "scaling", "latency"]:
-        {"population": population, "big": big, "mappings": mappings, "scaling": scaling, "latency": latency}[name](
-            os.path.abspath(tally), os.path.abspath(programs))
+    measurements = {each.__name__: each for each in (population, libraries, big, mappings, scaling, latency)}
+    for name in sys.argv[3:] or measurements:
+        measurements[name](os.path.abspath(tally), os.path.abspath(programs))
 
 
 if __name__ == "__main__":
