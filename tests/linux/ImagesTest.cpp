@@ -11,6 +11,8 @@
 #include <elf.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -213,6 +215,17 @@ TEST(ThreadLayoutTable, AFileIsReadByOneOfManyAndAgainWhenItHasChanged) {
     beginLayouts();
     std::filesystem::last_write_time(path, std::filesystem::file_time_type());
     EXPECT_NE(read(), first);
+
+    // Without the right to follow the link to what is mapped: by name, if that is still the same file.
+    std::filesystem::create_directory(folder.path() + "/root");
+    std::filesystem::rename(path, folder.path() + "/root/image");
+    struct stat status {};
+    stat((folder.path() + "/root/image").c_str(), &status);
+    Mapping mapping{
+        .deviceMajor = major(status.st_dev), .deviceMinor = minor(status.st_dev), .name = "/image"};
+    EXPECT_EQ(layoutOfFile({.device = 0x4712}, folder.path(), mapping), nullptr);
+    mapping.inode = status.st_ino;
+    EXPECT_NE(layoutOfFile({.device = 0x4712}, folder.path(), mapping), nullptr);
 }
 
 } // namespace

@@ -270,5 +270,14 @@ TEST(Walk, TenThousandMappingsAndMoreAreReadAsFewAre) {
     }
 }
 
+TEST(Ledger, TellsResidentAnonymousMemoryAndTheMostThereEverWas) {
+    const Puppet puppet({"big", "8"});
+    rusage_info_v5 usage;
+    ASSERT_EQ(proc_pid_rusage(puppet.pid(), &usage), 0);
+    EXPECT_GE(usage.ri_resident_anonymous, 8U << 20);
+    EXPECT_LT(usage.ri_resident_anonymous, usage.ri_phys_tally) << "without its page tables";
+    EXPECT_GT(usage.ri_lifetime_max_phys_tally, usage.ri_phys_tally) << "pages of files were resident, too";
+}
+
 } // namespace
 } // namespace tally::platform

@@ -48,11 +48,8 @@ class AllocatorRules {
             const bool isHeap = header.size != 0 && header.size <= header.usable &&
                                 header.usable <= heapSize &&
                                 (isFirstHeap(header, heap) || continuesArena(header));
-            if (!isHeap || heap + header.usable > mapping.end) {
-                return false;
-            }
-            if (heap + header.usable == mapping.end) {
-                return true;
+            if (!isHeap || heap + header.usable == mapping.end) {
+                return isHeap;
             }
         }
         return false;
