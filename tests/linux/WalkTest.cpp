@@ -239,6 +239,9 @@ TEST(Walk, AProcessWhoseFirstThreadHasEndedIsReadThroughAnother) {
     proc_bsdshortinfo info;
     ASSERT_EQ(proc_pidinfo(puppet.pid(), &info), 64);
     EXPECT_EQ(info.pbsi_status, SRUN);
+    rusage_info_v5 usage;
+    ASSERT_EQ(proc_pid_rusage(puppet.pid(), &usage), 0);
+    EXPECT_GT(usage.ri_phys_tally, 32 * vm_kernel_page_size());
 }
 
 TEST(Walk, AnAddressSpaceThatChangesMeanwhileIsReadInOrderAndToItsEnd) {

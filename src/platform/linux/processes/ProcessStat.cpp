@@ -5,6 +5,8 @@
 
 #include <array>
 #include <cerrno>
+#include <filesystem>
+#include <system_error>
 #include <utility>
 
 namespace tally::platform {
@@ -103,7 +105,20 @@ ProcessStatus decodeStatus(std::string_view text) {
 
 std::optional<ProcessStatus> readProcessStatus(std::int32_t pid) {
     const std::optional<std::string> text = readProcessFile(pid, "/status");
-    return text ? std::optional(decodeStatus(*text)) : std::nullopt;
+    std::optional<ProcessStatus> status = text ? std::optional(decodeStatus(*text)) : std::nullopt;
+    if (!status || status->hasAddressSpace) {
+        return status;
+    }
+    // A leader that ended before its threads shows no memory, while its threads do.
+    std::error_code error;
+    std::filesystem::directory_iterator thread(processFolder(pid) + "/task", error);
+    for (; !error && thread != std::filesystem::end(thread); thread.increment(error)) {
+        const auto ofThread = readSystemFile(thread->path().string() + "/status");
+        if (ProcessStatus other = decodeStatus(ofThread.value_or("")); other.hasAddressSpace) {
+            return other;
+        }
+    }
+    return status;
 }
 
 } // namespace tally::platform

@@ -45,7 +45,7 @@ struct ProcessStatus {
 
 ProcessStatus decodeStatus(std::string_view text);
 
-/// Reads /proc/PID/status; absent when that fails, with errno.
+/// Reads /proc/PID/status, of another thread where the first has ended; absent when that fails, with errno.
 std::optional<ProcessStatus> readProcessStatus(std::int32_t pid);
 
 } // namespace tally::platform
