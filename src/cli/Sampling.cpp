@@ -7,6 +7,7 @@
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/gather.h"
+#include "platform/system.h"
 #include "process/TLUserProcess.h"
 
 #include <algorithm>
@@ -121,6 +122,9 @@ void Sampler::run() {
             std::fprintf(stderr, "Selected output format (%s) does not support sampling mode\n",
                          formatter->className());
         }
+    }
+    if (!outputs_.hasFiles()) { // nothing is left to sample for where nobody reads the text
+        endWithClosedPipe();
     }
     timer_->setTimer(0, interval_, leeway_);
     const auto interrupts =

@@ -43,6 +43,8 @@ class OptionScanner {
 /// of ours takes their place, ignores the signal of a closed pipe, and has freed memory kept for what comes
 /// next.
 void prepareOwnProcess();
+/// Lets the signal of a closed pipe end the program again.
+void endWithClosedPipe();
 
 bool standardOutputIsTerminal();
 std::uint32_t effectiveUserId();

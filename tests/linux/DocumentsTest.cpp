@@ -247,5 +247,19 @@ TEST(Documents, EndWholeUnderTimeoutAndNohup) {
     }
 }
 
+TEST(Documents, AreCompletedWhenNobodyReadsTheText) {
+    const Puppet puppet({"idle"});
+    const TemporaryFolder folder;
+    for (const auto& [file, status] : {std::pair("-j x.json", "0\n"), {"", "141\n"}}) { // a text alone ends
+        run({"/bin/sh", "-c",
+             std::string("{ timeout --preserve-status -s INT 0.5 " TALLY_PROGRAM " --sample 0.02 ") + file +
+                 " --pid $0; echo $? >status; } | head -n 1",
+             pidOf(puppet)},
+            folder.path());
+        EXPECT_EQ(contentsOf(folder.path() + "/status"), status);
+    }
+    EXPECT_GE(nlohmann::json::parse(contentsOf(folder.path() + "/x.json"))["samples"].size(), 2U);
+}
+
 } // namespace
 } // namespace tally::test

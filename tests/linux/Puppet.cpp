@@ -46,6 +46,7 @@ int start(const std::vector<std::string>& command, int input, int output, int er
     if (pid == 0) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         signal(SIGINT, SIG_DFL); // what runs in the background of a shell has it ignored
+        signal(SIGPIPE, SIG_DFL);
         const std::array<int, 3> wanted{input, output, errors};
         for (int i = 0; i < 3; ++i) {
             if (wanted[i] >= 0) {

@@ -84,6 +84,7 @@ namespace tally::platform {
     &OptionScanner::argument,
     &OptionScanner::index,
     &prepareOwnProcess,
+    &endWithClosedPipe,
     &standardOutputIsTerminal,
     &effectiveUserId,
     &ownPid,

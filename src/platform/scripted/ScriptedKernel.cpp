@@ -56,11 +56,12 @@ constexpr std::array<std::string_view, 34> callsThatCanFail{
     "task_take_notices",
     "vm_deallocate",
 };
-constexpr std::array<std::string_view, 13> callsThatCannot{
+constexpr std::array<std::string_view, 14> callsThatCannot{
     "GatherScope",
     "QRYTagForRegionTypeDescription",
     "clock_uptime_raw_approx_ns",
     "effectiveUserId",
+    "endWithClosedPipe",
     "hasInternalContent",
     "mach_timebase_info",
     "ownPid",

@@ -102,6 +102,8 @@ std::unique_ptr<TimerSource> dispatch_source_timer(SerialQueue& queue,
 
 void prepareOwnProcess() { const Answer answer("prepareOwnProcess"); }
 
+void endWithClosedPipe() { const Answer answer("endWithClosedPipe"); }
+
 bool standardOutputIsTerminal() { return Answer("standardOutputIsTerminal").kernel.outputIsTerminal; }
 
 std::uint32_t effectiveUserId() { return Answer("effectiveUserId").kernel.effectiveUserId; }

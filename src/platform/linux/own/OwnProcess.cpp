@@ -25,6 +25,8 @@ void prepareOwnProcess() {
     mallopt(M_TRIM_THRESHOLD, 64 << 20);
 }
 
+void endWithClosedPipe() { std::signal(SIGPIPE, SIG_DFL); }
+
 bool standardOutputIsTerminal() { return isatty(STDOUT_FILENO) == 1; }
 
 std::uint32_t effectiveUserId() { return geteuid(); }
