@@ -19,15 +19,14 @@ inline std::string printed(const auto& print) {
 
 /// The text report of `processes`.
 inline std::string reportText(const TLTally::ProcessList& processes, TLSummaryFormat format,
-                              std::int64_t options, const char* sort, bool listing = false,
-                              bool summarize = false, int formatters = 1) {
+                              std::int64_t options, const char* sort, int formatters = 1) {
     return printed([&](std::FILE* file) {
         TLTally tally(processes);
         for (int i = 0; i < formatters; ++i) {
             tally.addOutputFormatter(std::make_shared<TLOutputFormatterText>(format, options, sort, file));
         }
         tally.analyzeMemoryObjects();
-        tally.printReport(listing, summarize);
+        tally.printReport(false, false);
     });
 }
 

@@ -13,8 +13,7 @@ using SharingReportTest = AnalysisTest;
 /// A line per process, sharing line and row; rows show pages dirty, clean, reclaimable, and regions. Checks
 /// that rows add up to their total.
 std::string told(const TLTally::ProcessList& processes, int formatters = 1) {
-    std::istringstream report(
-        reportText(processes, TLSummaryFormat::pages, 0, "Category", false, false, formatters));
+    std::istringstream report(reportText(processes, TLSummaryFormat::pages, 0, "Category", formatters));
     std::string lines = "\n";
     std::array<int, 4> sum{};
     for (std::string line; std::getline(report, line);) {
