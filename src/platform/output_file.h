@@ -13,7 +13,7 @@ class OutputFile {
   public:
     /// Creates the file of `path`, or empties the one that is there. Where that is the file to which standard
     /// output goes, nothing is emptied: the document is kept aside and follows the standard output at its
-    /// end, so that neither tears the other.
+    /// end, so that neither tears the other. A FIFO is waited for until somebody reads it.
     /// @return null, with errno, when that cannot be done.
     static std::unique_ptr<OutputFile> open(const std::string& path);
     /// Closes without a word.

@@ -2,6 +2,7 @@
 #include "cli/RunDriver.h"
 #include "platform/scripted/ScriptedKernel.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -52,10 +53,12 @@ TEST_F(OutputFiles, OfAFailedRunAreDeletedOnlyWhereTheyAreOurs) {
     write("target");
     fs::create_symlink(path("target"), path("link"));
     ASSERT_EQ(mkfifo(path("fifo").c_str(), 0600), 0);
+    const int reader = open(path("fifo").c_str(), O_RDONLY | O_NONBLOCK);
     for (const char* name : {"link", "fifo"}) {
         EXPECT_EQ(run("nobody -j " + path(name)), 1);
         EXPECT_TRUE(fs::exists(fs::symlink_status(path(name)))) << name;
     }
+    close(reader);
     EXPECT_EQ(run("nobody -j /dev/null --benchlog /dev/null"), 1);
     EXPECT_TRUE(fs::is_character_file("/dev/null"));
 

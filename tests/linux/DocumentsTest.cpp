@@ -70,7 +70,7 @@ TEST(Documents, GoWhereverAPathLeads) {
     shell("", "-j out >out"); // both to one file
     EXPECT_TRUE(json::accept(
         contentsOf(folder.path() + "/out").substr(contentsOf(folder.path() + "/out").rfind('\n'))));
-    const Outcome fifo = shell("mkfifo f; cat f & exec", "-j f >/dev/null");
+    const Outcome fifo = shell("mkfifo f; (sleep 0.2; cat f) & exec", "-j f >/dev/null");
     EXPECT_TRUE(json::accept(fifo.output)) << fifo.output;
     EXPECT_EQ(shell("", "-j closed.json >&- 2>&-").status, 0);
     EXPECT_TRUE(json::accept(contentsOf(folder.path() + "/closed.json")));

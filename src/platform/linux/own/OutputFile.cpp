@@ -118,7 +118,8 @@ std::unique_ptr<OutputFile> OutputFile::open(const std::string& path) {
         Descriptor aside = openUnnamedFile();
         return aside.isOpen() ? std::make_unique<FollowingFile>(std::move(aside)) : nullptr;
     }
-    Descriptor file(::open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOCTTY, 0666));
+    // Not for reading too: a FIFO would be opened before there is a reader, and what is in it then is lost.
+    Descriptor file(::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOCTTY, 0666));
     return file.isOpen() ? std::make_unique<NamedFile>(std::move(file), path) : nullptr;
 }
 
