@@ -228,37 +228,44 @@ void interruptRuns(int runs) {
 TEST(Documents, SurviveInterrupts) { interruptRuns(20); }
 TEST(LongDocuments, SurviveManyInterrupts) { interruptRuns(200); }
 
-TEST(Documents, EndWholeUnderTimeoutAndNohup) {
+TEST(Documents, AreWholeWhicheverSignalEndsSampling) {
     const Puppet puppet({"idle"});
     const TemporaryFolder folder;
-    const std::string sampling = TALLY_PROGRAM " --sample 0.05 -j x.json --pid " + pidOf(puppet);
-    const std::string endings[] = {
-        "timeout --preserve-status -s INT 0.5 " + sampling,
-        "timeout --preserve-status -s TERM 0.5 " + sampling,
-        "timeout --preserve-status -s HUP 0.5 " + sampling,
-        // A hang-up that was ignored from the start ends nothing.
-        "(trap '' HUP; exec " + sampling + ") & sleep 0.3; kill -HUP $!; sleep 0.3; kill -INT $!; wait $!",
+    const auto sampling = [&](const std::string& before) {
+        return Words{"/bin/sh", "-c", before + "exec " TALLY_PROGRAM " --sample 0.05 -j x.json --pid $0",
+                     pidOf(puppet)};
     };
-    for (const std::string& ending : endings) {
-        const Outcome outcome = run({"/bin/sh", "-c", ending + " >/dev/null"}, folder.path());
-        EXPECT_EQ(outcome.status, 0) << ending << outcome.errors;
+    for (const int signal : {SIGINT, SIGTERM, SIGHUP, 0}) {
+        Background tally(sampling(signal == 0 ? "trap '' HUP; " : ""), folder.path());
+        awaitSamples(folder.path(), 1);
+        if (signal == 0) { // a hang-up that was ignored from the start ends nothing
+            kill(tally.pid(), SIGHUP);
+            awaitSamples(folder.path(), 3);
+        }
+        kill(tally.pid(), signal == 0 ? SIGINT : signal);
+        EXPECT_EQ(tally.wait(), 0) << signal;
         const auto document = nlohmann::json::parse(contentsOf(folder.path() + "/x.json"), nullptr, false);
-        EXPECT_TRUE(document.is_object()) << ending;
+        EXPECT_TRUE(document.is_object()) << signal;
     }
 }
 
 TEST(Documents, AreCompletedWhenNobodyReadsTheText) {
     const Puppet puppet({"idle"});
     const TemporaryFolder folder;
-    for (const auto& [file, status] : {std::pair("-j x.json", "0\n"), {"", "141\n"}}) { // a text alone ends
+    const auto statusOf = [&](const std::string& words, const std::string& rest) {
         run({"/bin/sh", "-c",
-             std::string("{ timeout --preserve-status -s INT 0.5 " TALLY_PROGRAM " --sample 0.02 ") + file +
-                 " --pid $0; echo $? >status; } | head -n 1",
+             "{ " TALLY_PROGRAM " --sample 0.02 " + words +
+                 " --pid $0 & echo $! >pid; wait $!; echo $? >status; } | head -n 1 & " + rest + "wait",
              pidOf(puppet)},
             folder.path());
-        EXPECT_EQ(contentsOf(folder.path() + "/status"), status);
-    }
-    EXPECT_GE(nlohmann::json::parse(contentsOf(folder.path() + "/x.json"))["samples"].size(), 2U);
+        return contentsOf(folder.path() + "/status");
+    };
+    EXPECT_EQ(statusOf("", ""), "141\n"); // a text alone ends
+    EXPECT_EQ(
+        statusOf("-j x.json",
+                 "until [ 0$(stat -c %s x.json) -gt 20000 ]; do sleep 0.1; done; kill -INT $(cat pid); "),
+        "0\n");
+    EXPECT_TRUE(nlohmann::json::accept(contentsOf(folder.path() + "/x.json")));
 }
 
 } // namespace
