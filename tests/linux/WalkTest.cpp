@@ -4,7 +4,9 @@
 #include "platform/bsd_process.h"
 #include "platform/gather.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/DecodeMaps.h"
+#include "platform/linux/walk/PageSource.h"
 #include "platform/linux/walk/SmapsOfProcess.h"
 #include "platform/mach_task.h"
 #include "platform/mach_vm.h"
@@ -226,6 +228,20 @@ TEST(Walk, OneThatBeganGoesOnWhenItsProcessHasEnded) {
     const WholeWalk dead = walk(task.name(), puppet.pid());
     EXPECT_EQ(dead.status, KERN_INVALID_ARGUMENT);
     EXPECT_TRUE(dead.regions.empty());
+}
+
+TEST(Walk, PagesOfAProcessThatEndsMeanwhileAreNotTakenForThere) {
+    Puppet puppet({"big", "8"});
+    ProcessMemoryFiles files;
+    std::vector<Mapping> mappings;
+    const std::uint64_t started = readProcessStat(puppet.pid())->startTicks;
+    ASSERT_EQ(files.open(puppet.pid(), started, &mappings), KERN_SUCCESS);
+    puppet.end();
+    SmapsOfProcess smaps(files.folder);
+    PageSource source(files, mappings, smaps, PageDetail::counts);
+    PageStates states;
+    EXPECT_EQ(readPageStates(source, smaps, mappings, &states), KERN_INVALID_ARGUMENT);
+    EXPECT_TRUE(states.mappings.empty());
 }
 
 TEST(Walk, AProcessWhoseFirstThreadHasEndedIsReadThroughAnother) {

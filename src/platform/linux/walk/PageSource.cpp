@@ -92,12 +92,15 @@ int PageSource::scan(std::size_t first, std::size_t end, AddressRange window, bo
             error != 0) {
             return error;
         }
+        if (!isAlive()) {
+            return ESRCH; // of an address space that went away meanwhile a scan shows a part or nothing
+        }
         for (const PageRegion& region : step.regions) {
             // A region can reach over several mappings and what lies between them.
             while (mapping < end && mappings_[mapping].end <= region.start) {
                 ++mapping;
             }
-            const std::optional<PageKind> kind = kindOfRegion(region);
+            const std::optional<PageKind> kind = memoryOf(kindOfRegion(region));
             for (std::size_t at = mapping; kind && at < end && mappings_[at].start < region.end; ++at) {
                 sink(at, std::max(region.start, mappings_[at].start), std::min(region.end, mappings_[at].end),
                      *kind);
@@ -113,6 +116,16 @@ int PageSource::scan(std::size_t first, std::size_t end, AddressRange window, bo
     }
     *reached = end;
     return 0;
+}
+
+/// Without swap, what shows as swapped are marks that userfaultfd left where there is no memory.
+std::optional<PageKind> PageSource::memoryOf(std::optional<PageKind> kind) const {
+    return kind == PageKind::swapped && !swapInUse_ ? std::nullopt : kind;
+}
+
+bool PageSource::isAlive() const {
+    std::uint64_t entry = 0;
+    return readPagemapEntries(files_.pagemap, 0, std::span(&entry, 1)) == 1;
 }
 
 int PageSource::readOlder(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
@@ -149,7 +162,8 @@ bool PageSource::readPagemap(std::size_t index, AddressRange window, const PageR
             return false;
         }
         for (std::size_t i = 0; i < count; ++i, address += basePage) {
-            const std::optional<PageKind> kind = kindOfPagemapEntry(entries[i], mapping.isPrivateAnonymous());
+            const std::optional<PageKind> kind =
+                memoryOf(kindOfPagemapEntry(entries[i], mapping.isPrivateAnonymous()));
             if (kind) {
                 sink(index, address, address + basePage, *kind);
             }

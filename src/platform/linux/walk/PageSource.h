@@ -5,6 +5,7 @@
 
 #pragma once
 
+#include "platform/linux/gather/MachineState.h"
 #include "platform/linux/walk/Mapping.h"
 #include "platform/linux/walk/PageScan.h"
 #include "platform/linux/walk/PageStates.h"
@@ -15,6 +16,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <span>
 
 namespace tally::platform {
@@ -43,12 +45,15 @@ class PageSource {
              std::size_t* reached);
     int readOlder(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
                   std::size_t* reached);
+    std::optional<PageKind> memoryOf(std::optional<PageKind> kind) const;
+    bool isAlive() const;
     bool readPagemap(std::size_t index, AddressRange window, const PageRunSink& sink);
 
     const ProcessMemoryFiles& files_;
     std::span<const Mapping> mappings_;
     SmapsOfProcess& smaps_;
     PageDetail detail_;
+    bool swapInUse_ = machineState().swapInUse;
     std::array<PageRegion, 512> room_;
 };
 
