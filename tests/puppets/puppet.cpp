@@ -12,7 +12,8 @@
 //                                  one of same, half (every second page written), random (three pages in
 //                                  ten, drawn by the child's number), drop (the second half unmapped),
 //                                  huge (huge pages, the first 4 KiB of each written), grow (the parent's
-//                                  and the children's mappings grow apart), swapped (nothing changes: it was
+//                                  and the children's mappings grow apart), leaderless (nothing changes, the
+//                                  children's first threads end), swapped (nothing changes: it was
 //                                  swapped out before, and shared memory of as many pages with it)
 //   puppet memory PAGES            a memfd of PAGES pages, all written, of which only the first are mapped
 //                                  and touched
@@ -28,8 +29,10 @@
 #include <linux/audit.h>
 #include <linux/filter.h>
 #include <linux/seccomp.h>
+#include <linux/userfaultfd.h>
 #include <pthread.h>
 #include <sched.h>
+#include <sys/ioctl.h>
 #include <sys/ipc.h>
 #include <sys/mman.h>
 #include <sys/personality.h>
@@ -137,6 +140,19 @@ char* anonymous(std::size_t pages) {
     return address;
 }
 
+/// Has userfaultfd watch for writes to pages that were never touched: the kernel marks them, and there is no
+/// memory. @return false where it cannot be done.
+bool markUntouched(char* address, std::size_t pages) {
+    constexpr std::uint64_t watchesUntouched = 1 << 13; // Linux 6.4
+    const int faults = static_cast<int>(syscall(SYS_userfaultfd, O_CLOEXEC | UFFD_USER_MODE_ONLY));
+    uffdio_api api{UFFD_API, watchesUntouched, 0};
+    const uffdio_range range{reinterpret_cast<std::uintptr_t>(address), pages * page};
+    uffdio_register watched{range, UFFDIO_REGISTER_MODE_WP, 0};
+    uffdio_writeprotect mark{range, UFFDIO_WRITEPROTECT_MODE_WP};
+    return ioctl(faults, UFFDIO_API, &api) == 0 && ioctl(faults, UFFDIO_REGISTER, &watched) == 0 &&
+           ioctl(faults, UFFDIO_WRITEPROTECT, &mark) == 0;
+}
+
 void zooOfAnonymousMemory() {
     char* m = anonymous(64);
     write(m, 0, 40);
@@ -164,6 +180,10 @@ void zooOfAnonymousMemory() {
     write(m, 0, 8);
     if (madvise(m + 2 * page, 4 * page, MADV_GUARD_INSTALL) == 0) { // drops the pages and marks them
         tell("guards", m, 8, figure("dirty", 4));
+    }
+
+    if (char* marked = anonymous(16); markUntouched(marked, 16)) {
+        tell("marked-by-userfaultfd", marked, 16, figure("dirty", 0));
     }
 
     constexpr std::size_t hugePages = 512;
@@ -350,6 +370,15 @@ void change(char* m, std::size_t pages, const std::string& how, std::size_t chil
     }
 }
 
+/// Tells the parent through `pipe` that this child is ready, and waits.
+void* sayReady(void* pipe) {
+    usleep(gettid() == getpid() ? 0 : 20'000); // the first thread is gone by then
+    static_cast<void>(::write(*static_cast<int*>(pipe), "x", 1));
+    for (;;) {
+        pause();
+    }
+}
+
 void family(std::size_t kids, std::size_t pages, const std::string& how) {
     char* m = how == "huge" ? map((pages + 512) * page, readWrite, privateAnonymous) : anonymous(pages);
     if (how == "huge") {
@@ -375,10 +404,12 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
             alarm(600);
             change(m, pages, how, child);
-            static_cast<void>(::write(ready[1], "x", 1));
-            for (;;) {
-                pause();
+            if (how == "leaderless") {
+                pthread_t other{};
+                pthread_create(&other, nullptr, sayReady, &ready[1]);
+                pthread_exit(nullptr);
             }
+            sayReady(&ready[1]);
         }
         std::printf("child 0 %d\n", pid);
     }

@@ -187,7 +187,7 @@ std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity
     const auto member = std::lower_bound(own.members.begin(), own.members.end(), owner, isBefore);
     const auto index = static_cast<std::size_t>(member - own.members.begin());
     AddressSpace& space = own.spaces[index];
-    if (own.readers[index] == 0 || space.status == KERN_FAILURE) {
+    if (own.readers[index] == 0) {
         return std::nullopt;
     }
     return --own.readers[index] == 0 ? std::move(space) : space;

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <unordered_map>
+#include <unordered_set>
 
 namespace tally::platform {
 
@@ -12,12 +13,30 @@ namespace {
 
 constexpr std::size_t mostKeptSets = 16;
 constexpr std::uint64_t worthKeeping = (64 << 10) / basePage; // pages
+constexpr std::size_t mostSetsOfImage = 64;
+
+/// The clusters of which every set is kept: images whose copies make no more sets than a reader can make use
+/// of.
+std::vector<bool> clustersKeptWhole(const FamilySharing& family) {
+    std::vector<std::unordered_set<std::size_t>> sets(family.keepsAllSets.size());
+    for (const SetPages& count : family.counts) {
+        const std::size_t cluster = family.slots[count.slot].cluster;
+        if (family.keepsAllSets[cluster] != 0 && sets[cluster].size() <= mostSetsOfImage) {
+            sets[cluster].insert(count.set);
+        }
+    }
+    std::vector<bool> kept(sets.size());
+    for (std::size_t cluster = 0; cluster < sets.size(); ++cluster) {
+        kept[cluster] = family.keepsAllSets[cluster] != 0 && sets[cluster].size() <= mostSetsOfImage;
+    }
+    return kept;
+}
 
 /// The sets with the most memory, as far as they are worth a section of the report each.
-std::vector<bool> keptSets(const FamilySharing& family) {
+std::vector<bool> keptSets(const FamilySharing& family, const std::vector<bool>& keptWhole) {
     std::vector<std::uint64_t> pages(family.sets.size());
     for (const SetPages& count : family.counts) {
-        if (!family.keepsAllSets[family.slots[count.slot].cluster]) {
+        if (!keptWhole[family.slots[count.slot].cluster]) {
             pages[count.set] += count.resident + count.swapped;
         }
     }
@@ -82,7 +101,8 @@ std::uint64_t identityOfSet(const FamilySharing& family, const std::vector<std::
 
 std::vector<std::vector<SharedPart>> sharedParts(const FamilySharing& family,
                                                  std::span<const std::vector<MemberMapping>> mappings) {
-    const std::vector<bool> kept = keptSets(family);
+    const std::vector<bool> keptWhole = clustersKeptWhole(family);
+    const std::vector<bool> kept = keptSets(family, keptWhole);
     std::vector<std::uint64_t> setIdentities;
     setIdentities.reserve(family.sets.size());
     for (const std::vector<std::uint32_t>& set : family.sets) {
@@ -106,7 +126,7 @@ std::vector<std::vector<SharedPart>> sharedParts(const FamilySharing& family,
             }
             added.emplace_back(objectId, resident + swapped);
         };
-        if (kept[count.set] || family.keepsAllSets[slot.cluster]) {
+        if (kept[count.set] || keptWhole[slot.cluster]) {
             enter(objectIdOfSharedSet(setIdentities[count.set], slot.clusterStart), count.resident,
                   count.swapped);
         } else {

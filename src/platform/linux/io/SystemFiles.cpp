@@ -90,8 +90,13 @@ void allowDescriptors(std::size_t count) {
     constexpr rlim_t usual = 128;
     rlimit limit{};
     if (getrlimit(RLIMIT_NOFILE, &limit) == 0 && limit.rlim_cur < count + usual) {
-        limit.rlim_cur = std::min<rlim_t>(count + usual, limit.rlim_max);
-        setrlimit(RLIMIT_NOFILE, &limit);
+        const rlim_t most = limit.rlim_max;
+        limit.rlim_cur = count + usual;
+        limit.rlim_max = std::max(most, limit.rlim_cur);
+        if (setrlimit(RLIMIT_NOFILE, &limit) != 0) { // only root may go beyond the hard limit
+            limit = {std::min(limit.rlim_cur, most), most};
+            setrlimit(RLIMIT_NOFILE, &limit);
+        }
     }
 }
 

@@ -45,7 +45,7 @@ bool readExactly(const Descriptor& file, std::uint64_t offset, std::span<std::by
 /// The whole file at `path`; absent on failure, with errno.
 std::optional<std::string> readSystemFile(const std::string& path);
 
-/// Makes room for `count` more descriptors than are usual, as far as the hard limit goes.
+/// Makes room for `count` more descriptors than are usual; but for root, as far as the hard limit goes.
 void allowDescriptors(std::size_t count);
 
 /// Where the symbolic link at `path` points, up to 64 KiB; absent on failure, with errno.

@@ -109,16 +109,25 @@ std::optional<ProcessStatus> readProcessStatus(std::int32_t pid) {
     if (!status || status->hasAddressSpace) {
         return status;
     }
-    // A leader that ended before its threads shows no memory, while its threads do.
-    std::error_code error;
-    std::filesystem::directory_iterator thread(processFolder(pid) + "/task", error);
-    for (; !error && thread != std::filesystem::end(thread); thread.increment(error)) {
-        const auto ofThread = readSystemFile(thread->path().string() + "/status");
-        if (ProcessStatus other = decodeStatus(ofThread.value_or("")); other.hasAddressSpace) {
+    for (const std::string& thread : threadFolders(pid)) {
+        const ProcessStatus other = decodeStatus(readSystemFile(thread + "/status").value_or(""));
+        if (other.hasAddressSpace) {
             return other;
         }
     }
     return status;
+}
+
+std::vector<std::string> threadFolders(std::int32_t pid) {
+    std::vector<std::string> folders;
+    std::error_code error;
+    std::filesystem::directory_iterator thread(processFolder(pid) + "/task", error);
+    for (; !error && thread != std::filesystem::end(thread); thread.increment(error)) {
+        if (thread->path().filename() != std::to_string(pid)) {
+            folders.push_back(thread->path().string());
+        }
+    }
+    return folders;
 }
 
 } // namespace tally::platform

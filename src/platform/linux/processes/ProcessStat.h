@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace tally::platform {
 
@@ -47,5 +48,9 @@ ProcessStatus decodeStatus(std::string_view text);
 
 /// Reads /proc/PID/status, of another thread where the first has ended; absent when that fails, with errno.
 std::optional<ProcessStatus> readProcessStatus(std::int32_t pid);
+
+/// The folders of the threads of process `pid` but the first: a leader that ended before its threads shows no
+/// memory and no addresses, while they do.
+std::vector<std::string> threadFolders(std::int32_t pid);
 
 } // namespace tally::platform

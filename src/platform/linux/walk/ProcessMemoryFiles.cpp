@@ -4,32 +4,10 @@
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/ListMappings.h"
 
-#include <dirent.h>
-
 #include <cerrno>
-#include <memory>
+#include <utility>
 
 namespace tally::platform {
-
-namespace {
-
-std::vector<std::string> threadFolders(std::int32_t pid) {
-    const std::string parent = processFolder(pid) + "/task";
-    const std::unique_ptr<DIR, int (*)(DIR*)> folder(opendir(parent.c_str()), closedir);
-    std::vector<std::string> folders;
-    while (folder) {
-        const dirent* entry = readdir(folder.get());
-        if (entry == nullptr) {
-            break;
-        }
-        if (entry->d_name[0] != '.' && entry->d_name != std::to_string(pid)) {
-            folders.push_back(parent + "/" + entry->d_name);
-        }
-    }
-    return folders;
-}
-
-} // namespace
 
 kern_return_t statusForErrno(int error) {
     return error == EACCES || error == EPERM                       ? KERN_NO_ACCESS
@@ -57,7 +35,6 @@ kern_return_t ProcessMemoryFiles::open(std::int32_t pid, std::uint64_t startTick
                                        std::vector<Mapping>* mappings) {
     kern_return_t status = openFolder(processFolder(pid), mappings);
     if (status == KERN_INVALID_ARGUMENT) {
-        // A leader that ended before its threads shows no mappings, while its threads do.
         for (std::string& thread : threadFolders(pid)) {
             status = openFolder(std::move(thread), mappings);
             if (status == KERN_SUCCESS) {
@@ -67,10 +44,10 @@ kern_return_t ProcessMemoryFiles::open(std::int32_t pid, std::uint64_t startTick
     }
     // Only now is it certain whose files were opened: the pid may have been used again.
     const std::optional<ProcessStat> stat = readProcessStat(pid);
-    if (!stat || stat->startTicks != startTicks) {
-        return KERN_INVALID_ARGUMENT;
+    if (!stat) {
+        return statusForErrno(errno);
     }
-    return status;
+    return stat->startTicks == startTicks ? status : KERN_INVALID_ARGUMENT;
 }
 
 } // namespace tally::platform

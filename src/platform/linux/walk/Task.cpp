@@ -86,6 +86,19 @@ PortTable& portTable() {
     return table;
 }
 
+FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat, std::int64_t threads) {
+    FamilyKey key = decodeFamilyKey(stat);
+    if (!key.isKnown() && threads > 1) {
+        for (const std::string& thread : threadFolders(pid)) {
+            key = decodeFamilyKey(readSystemFile(thread + "/stat").value_or(""));
+            if (key.isKnown()) {
+                break;
+            }
+        }
+    }
+    return key;
+}
+
 } // namespace
 
 Task::Task(MemberIdentity identity, const FamilyKey& key)
@@ -96,6 +109,9 @@ Task::~Task() { leaveAddressSpace(key_, identity_); }
 const Walk* Task::walk(kern_return_t* status) {
     *status = KERN_SUCCESS;
     if (!walk_) {
+        if (isSecondTenant() && compareAddressSpaces(owner_.pid, identity_.pid) != 0) {
+            owner_ = identity_; // it has loaded another program since
+        }
         Walk::Result result = Walk::read(identity_, key_, owner_, !accountingSwitchIsOn());
         *status = result.status;
         walk_ = std::move(result.walk);
@@ -128,8 +144,8 @@ kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     if (!maps.isOpen() && statusForErrno(errno) == KERN_NO_ACCESS) {
         return KERN_NO_ACCESS;
     }
-    *task = portTable().add(
-        std::make_shared<Task>(MemberIdentity{pid, stat->startTicks}, decodeFamilyKey(*text)));
+    *task = portTable().add(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks},
+                                                   familyKeyOf(pid, *text, stat->threads)));
     return KERN_SUCCESS;
 }
 

@@ -29,6 +29,7 @@ class Task {
     /// Whether there is a right to another process that descends from the same exec, as far as can be told.
     bool hasRelatives() const { return !key_.isKnown() || countRelatives(key_) > 1; }
     std::uint64_t startTicks() const { return identity_.startTicks; }
+    const FamilyKey& familyKey() const { return key_; }
 
     /// The walk that is under way; starts one when there is none.
     /// @return null with `*status` when the address space cannot be read.

@@ -42,15 +42,21 @@ AddressSpace readAlone(MemberIdentity task) {
 
 constexpr const char* pageCacheNotice =
     "The page cache could not be asked: shared memory and files are counted by the process's own page tables";
+constexpr const char* unreadRelativesNotice =
+    "What is shared with forked relatives counts for each of them: they could not be read side by side";
 constexpr const char* sharingNotice =
     "Frame numbers are hidden: what is shared with forked relatives is estimated from addresses";
 
 } // namespace
 
 Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView) {
-    std::optional<AddressSpace> withRelatives = takeFamilySpace(key, owner);
-    AddressSpace space = withRelatives ? std::move(*withRelatives) : readAlone(task);
     Result result;
+    std::optional<AddressSpace> withRelatives = takeFamilySpace(key, owner);
+    if (withRelatives && withRelatives->status == KERN_FAILURE) {
+        withRelatives.reset();
+        result.notices.emplace_back(unreadRelativesNotice);
+    }
+    AddressSpace space = withRelatives ? std::move(*withRelatives) : readAlone(task);
     if (space.status != KERN_SUCCESS && space.states.mappings.empty()) {
         result.status = space.status;
         return result;
