@@ -7,9 +7,12 @@
 #include "platform/linux/walk/Task.h"
 
 #include <algorithm>
+#include <condition_variable>
+#include <cstddef>
 #include <map>
 #include <mutex>
 #include <set>
+#include <utility>
 #include <vector>
 
 namespace tally::platform {
@@ -18,16 +21,20 @@ namespace {
 
 struct Search {
     std::mutex mutex;
+    std::condition_variable changed;
     bool isGathering = false;
     bool isPrepared = false;
     struct Candidate {
         std::int32_t pid = 0;
         std::uint64_t residentAnonymous = 0;
-        bool hasRelatives = false; // whose lazily freed pages smaps can show in each of them
+        FamilyKey family;
     };
     std::vector<Candidate> candidates; // rising by anonymous memory: the next one is the last
     std::uint64_t left = 0;            // bytes that were not found yet
     std::map<std::int32_t, bool> answers;
+    std::size_t asked = 0; // whose answer is under way
+    // The most that a member of each family has: smaps can show the same lazily freed pages in all of them.
+    std::map<FamilyKey, std::uint64_t> largestOfFamily;
 };
 
 Search& search() {
@@ -48,11 +55,22 @@ void prepare(Search& search) {
             continue;
         }
         if (const std::optional<ProcessStatus> status = readProcessStatus(task->pid())) {
-            search.candidates.push_back({task->pid(), status->residentAnonymous, task->hasRelatives()});
+            search.candidates.push_back({task->pid(), status->residentAnonymous, task->familyKey()});
         }
     }
     std::sort(search.candidates.begin(), search.candidates.end(),
               [](const auto& a, const auto& b) { return a.residentAnonymous < b.residentAnonymous; });
+}
+
+/// Takes what one process has off what is left to be found.
+void enter(Search& search, const Search::Candidate& candidate, std::uint64_t found) {
+    search.answers[candidate.pid] = found != 0;
+    std::uint64_t known = 0;
+    if (candidate.family.isKnown() && found != 0) {
+        std::uint64_t& largest = search.largestOfFamily[candidate.family];
+        known = std::exchange(largest, std::max(largest, found));
+    }
+    search.left -= std::min(found - std::min(known, found), search.left);
 }
 
 } // namespace
@@ -62,21 +80,28 @@ bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder, std::uint
         return false;
     }
     Search& current = search();
-    const std::scoped_lock lock(current.mutex);
+    std::unique_lock lock(current.mutex);
     if (!current.isGathering) {
         return lazilyFreed(folder) != 0;
     }
     if (!current.isPrepared) {
         prepare(current);
     }
-    while (!current.answers.contains(pid) && !current.candidates.empty() && current.left != 0) {
+    while (!current.answers.contains(pid) && current.left != 0 &&
+           (!current.candidates.empty() || current.asked != 0)) {
+        if (current.candidates.empty()) {
+            current.changed.wait(lock);
+            continue;
+        }
         const Search::Candidate next = current.candidates.back();
         current.candidates.pop_back();
+        ++current.asked;
+        lock.unlock();
         const std::uint64_t found = lazilyFreed(processFolder(next.pid));
-        current.answers[next.pid] = found != 0;
-        if (!next.hasRelatives) {
-            current.left -= std::min(found, current.left);
-        }
+        lock.lock();
+        --current.asked;
+        enter(current, next, found);
+        current.changed.notify_all();
     }
     const auto answer = current.answers.find(pid);
     return answer != current.answers.end() && answer->second;
@@ -89,6 +114,7 @@ void restartLazyFreeSearch(bool isGathering) {
     current.isPrepared = false;
     current.candidates.clear();
     current.answers.clear();
+    current.largestOfFamily.clear();
 }
 
 } // namespace tally::platform
