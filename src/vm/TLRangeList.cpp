@@ -50,9 +50,11 @@ TLRangeList::~TLRangeList() {
 
 void TLRangeList::addSubrange(std::uint64_t start, std::uint64_t size, std::uint64_t pageSize,
                               const TLRangeSizes& sizes) {
+    // A device's offsets can reach past the last address.
+    constexpr std::uint64_t last = ~std::uint64_t{0};
+    start = std::min(start, last - pageSize);
+    size = std::min(size, last - pageSize - start);
     const std::uint64_t firstPage = roundDownToPage(start, pageSize);
-    size = std::min(size, ~std::uint64_t{0} - pageSize -
-                              start); // a device's offsets can reach past the last address
     const std::uint64_t pagesEnd = roundUpToPage(start + size, pageSize);
     auto node = std::make_unique<TLRangeListNode>();
     node->start = start;
