@@ -2,6 +2,7 @@
 
 #include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/pieces/FindPages.h"
+#include "platform/linux/pieces/SharedPieces.h"
 #include "platform/linux/tags/Tags.h"
 
 #include <algorithm>
@@ -282,19 +283,7 @@ std::span<const SharedPart> PieceBuilder::partsOf(std::size_t index) {
     return parts;
 }
 
-void PieceBuilder::addSharedPieces(std::size_t index, std::span<const SharedPart> parts) {
-    for (const SharedPart& part : parts) {
-        Piece& piece = addPiece(index, part.resident + part.swapped);
-        piece.offset = part.pagesBelow * basePage;
-        piece.objectId = part.objectId;
-        piece.resident = static_cast<std::uint32_t>(part.resident);
-        piece.swapped = static_cast<std::uint32_t>(part.swapped);
-        piece.dirty = piece.resident;
-        piece.shareMode = SM_COW;
-    }
-}
-
-/// What the task shares with no relative.
+/// The task's pages, whoever of its relatives has them too.
 void PieceBuilder::addOwnPiece(std::size_t index, const MappingPages& own, std::uint64_t length) {
     if (length == 0) {
         return;
@@ -310,20 +299,11 @@ void PieceBuilder::addOwnPiece(std::size_t index, const MappingPages& own, std::
     }
 }
 
-/// smaps tells lazily freed pages by mapping only: they are taken to be the task's own first.
-void PieceBuilder::markLazilyFreed(std::size_t index, std::size_t firstPiece) {
+void PieceBuilder::markLazilyFreed(std::size_t index, Piece& own) {
     const SmapsEntry* entry = smaps_.entryFor(mappings_[index]);
-    std::uint64_t left = entry == nullptr ? 0 : entry->lazyFree / basePage;
-    for (std::size_t i = pieces_.size(); i-- > firstPiece && left != 0;) { // the task's own piece is the last
-        Piece& piece = pieces_[i];
-        const bool isObject =
-            piece.objectId == objectIdOfFile(backings_[index]) && mappings_[index].isFileBacked();
-        if (!isObject) {
-            piece.reusable = static_cast<std::uint32_t>(std::min<std::uint64_t>(left, piece.dirty));
-            piece.dirty -= piece.reusable;
-            left -= piece.reusable;
-        }
-    }
+    const std::uint64_t pages = entry == nullptr ? 0 : entry->lazyFree / basePage;
+    own.reusable = static_cast<std::uint32_t>(std::min<std::uint64_t>(pages, own.dirty));
+    own.dirty -= own.reusable;
 }
 
 void PieceBuilder::build(std::size_t index) {
@@ -331,12 +311,6 @@ void PieceBuilder::build(std::size_t index) {
     const BackingObject& backing = backings_[index];
     const MappingPages& states = states_.mappings[index];
     const std::span<const SharedPart> parts = partsOf(index);
-    MappingPages own = states; // what no relative shares
-    for (const SharedPart& part : parts) {
-        own.anonymous -= std::min(part.resident, own.anonymous);
-        own.swapped -= std::min(part.swapped, own.swapped);
-    }
-    const std::uint64_t shared = states.own() - own.own();
     const std::size_t firstPiece = pieces_.size();
     nextStart_ = mapping.start;
 
@@ -350,8 +324,7 @@ void PieceBuilder::build(std::size_t index) {
         Piece& piece = addPiece(index, mapping.pages());
         piece.resident = facts_.objectView ? 0 : static_cast<std::uint32_t>(states.object);
     } else if (backing.backing == Backing::anonymous) {
-        addSharedPieces(index, parts);
-        addOwnPiece(index, own, restIsApart ? own.own() : mapping.pages() - shared);
+        addOwnPiece(index, states, restIsApart ? states.own() : mapping.pages());
     } else {
         ObjectPages object = facts_.objectView ? seenObjectPages(index) : chargedObjectPages(index);
         const std::uint64_t room = mapping.pages() - states.own();
@@ -366,14 +339,18 @@ void PieceBuilder::build(std::size_t index) {
             closeGaps(states_.runsOf(states), object.words);
         }
         addObjectPiece(index, std::move(object), objectLength);
-        addSharedPieces(index, parts);
-        addOwnPiece(index, own, packed || objectLength != 0 ? own.own() : mapping.pages() - shared);
+        addOwnPiece(index, states, packed || objectLength != 0 ? states.own() : mapping.pages());
     }
     if (facts_.asksLazyFree && states.anonymous != 0) {
-        markLazilyFreed(index, firstPiece);
+        markLazilyFreed(index, pieces_.back());
     }
     for (std::size_t i = firstPiece; i < pieces_.size(); ++i) {
         pieces_[i].isWired = wired && pieces_[i].resident + pieces_[i].swapped != 0;
+    }
+    if (!parts.empty()) {
+        const Piece own = pieces_.back();
+        pieces_.pop_back();
+        appendDivided(own, parts, &pieces_);
     }
     addRest(index, (mapping.end - nextStart_) / basePage);
 }

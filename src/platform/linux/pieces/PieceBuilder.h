@@ -52,9 +52,8 @@ class PieceBuilder {
     void markSwapped(std::size_t index, const Descriptor& file, ObjectPages& pages);
     void markDirty(std::size_t index, ObjectPages& pages);
     void addObjectPiece(std::size_t index, ObjectPages pages, std::uint64_t length);
-    void addSharedPieces(std::size_t index, std::span<const SharedPart> parts);
     void addOwnPiece(std::size_t index, const MappingPages& own, std::uint64_t length);
-    void markLazilyFreed(std::size_t index, std::size_t firstPiece);
+    void markLazilyFreed(std::size_t index, Piece& own);
     std::span<const SharedPart> partsOf(std::size_t index);
     void addRest(std::size_t index, std::uint64_t length);
     Piece& addPiece(std::size_t index, std::uint64_t length);
