@@ -16,8 +16,6 @@ namespace {
 
 constexpr std::uint64_t windowBytes = 4 << 20;
 
-bool isPrivate(const Mapping& mapping) { return !mapping.shared && !mapping.isKernelSpecial(); }
-
 /// A run of a member's own pages in the window that is being read.
 struct OwnRun {
     std::uint64_t start = 0; // addresses
@@ -34,12 +32,7 @@ class MemberScan {
         smaps_.emplace(files_.folder);
         source_.emplace(files_, space_.mappings, *smaps_, PageDetail::positions);
         recorder_.emplace(space_.mappings, &space_.states);
-        for (std::size_t i = 0; i < space_.mappings.size(); ++i) {
-            const Mapping& mapping = space_.mappings[i];
-            if (isPrivate(mapping)) {
-                privateMappings_.push_back({{mapping.start, mapping.end}, i});
-            }
-        }
+        privateMappings_ = tally::platform::privateMappings(space_.mappings);
     }
 
     bool isReadable() const { return space_.status == KERN_SUCCESS; }
@@ -51,7 +44,7 @@ class MemberScan {
     void readSharedMappings() {
         for (std::size_t at = 0; isReadable() && at < space_.mappings.size();) {
             std::size_t end = at;
-            while (end < space_.mappings.size() && !isPrivate(space_.mappings[end])) {
+            while (end < space_.mappings.size() && !space_.mappings[end].isPrivate()) {
                 ++end;
             }
             if (end > at) {
@@ -133,7 +126,7 @@ class MemberScan {
     void read(std::size_t first, std::size_t end, AddressRange window) {
         const auto sink = [&](std::size_t index, std::uint64_t start, std::uint64_t stop, PageKind kind) {
             recorder_->record(index, start, stop, kind);
-            if (kind != PageKind::object && isPrivate(space_.mappings[index])) {
+            if (kind != PageKind::object && space_.mappings[index].isPrivate()) {
                 if (!ownRuns_.empty() && ownRuns_.back().end == start) {
                     ownRuns_.back().end = stop;
                 } else {
@@ -223,27 +216,6 @@ std::uint64_t nextPageOfAny(Members& members, std::uint64_t end) {
     return next / basePage * basePage;
 }
 
-/// Clusters that hold a private mapping of a file are image segments, and so is what lies directly behind
-/// one: its zero-filled data.
-std::vector<char> imageClusters(std::span<const AddressSlot> slots, const Members& members) {
-    std::vector<char> isImage(slots.empty() ? 0 : slots.back().cluster + 1);
-    for (const auto& member : members) {
-        std::size_t slot = 0;
-        std::uint64_t imageEnd = 0;
-        for (const MemberMapping& mapping : member->privateMappings()) {
-            while (slots[slot].start < mapping.range.start) {
-                ++slot;
-            }
-            const bool isFile = member->mappings()[mapping.index].isFileBacked();
-            if (isFile || mapping.range.start == imageEnd) {
-                isImage[slots[slot].cluster] = 1;
-                imageEnd = isFile ? mapping.range.end : 0;
-            }
-        }
-    }
-    return isImage;
-}
-
 } // namespace
 
 std::vector<AddressSpace> scanFamily(std::uint64_t familyKey, std::span<const MemberIdentity> identities) {
@@ -272,11 +244,11 @@ std::vector<AddressSpace> scanFamily(std::uint64_t familyKey, std::span<const Me
     }
 
     const std::vector<SetPages> counts = sets.takeCounts();
-    const std::vector<char> isImage = imageClusters(slots, members);
     std::vector<std::vector<MemberMapping>> mappings;
     for (const auto& member : members) {
         mappings.push_back(member->privateMappings());
     }
+    const std::vector<char> isImage = imageClusters(slots, mappings);
     std::vector<std::vector<SharedPart>> parts =
         sharedParts({familyKey, identities, slots, sets.sets(), counts, isImage}, mappings);
     std::vector<AddressSpace> spaces;

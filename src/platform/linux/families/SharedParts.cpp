@@ -99,6 +99,35 @@ std::uint64_t identityOfSet(const FamilySharing& family, const std::vector<std::
 
 } // namespace
 
+std::vector<MemberMapping> privateMappings(std::span<const Mapping> mappings) {
+    std::vector<MemberMapping> found;
+    for (std::size_t i = 0; i < mappings.size(); ++i) {
+        if (mappings[i].isPrivate()) {
+            found.push_back({{mappings[i].start, mappings[i].end}, i, mappings[i].isFileBacked()});
+        }
+    }
+    return found;
+}
+
+std::vector<char> imageClusters(std::span<const AddressSlot> slots,
+                                std::span<const std::vector<MemberMapping>> mappings) {
+    std::vector<char> isImage(slots.empty() ? 0 : slots.back().cluster + 1);
+    for (const std::vector<MemberMapping>& member : mappings) {
+        std::size_t slot = 0;
+        std::uint64_t imageEnd = 0;
+        for (const MemberMapping& mapping : member) {
+            while (slots[slot].start < mapping.range.start) {
+                ++slot;
+            }
+            if (mapping.isFile || mapping.range.start == imageEnd) {
+                isImage[slots[slot].cluster] = 1;
+                imageEnd = mapping.isFile ? mapping.range.end : 0;
+            }
+        }
+    }
+    return isImage;
+}
+
 std::vector<std::vector<SharedPart>> sharedParts(const FamilySharing& family,
                                                  std::span<const std::vector<MemberMapping>> mappings) {
     const std::vector<bool> keptWhole = clustersKeptWhole(family);

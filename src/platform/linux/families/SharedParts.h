@@ -42,12 +42,22 @@ struct FamilySharing {
     std::span<const char> keepsAllSets;               // per cluster, 1 for image segments
 };
 
-/// The parts of every member, sorted by mapping. `mappings[m]` are the private mappings of member m: their
-/// ranges in rising order and the numbers to report them by.
+/// A private mapping of a member, and the number to report it by.
 struct MemberMapping {
     AddressRange range;
     std::size_t index = 0;
+    bool isFile = false;
 };
+
+/// The mappings of one process that relatives can share page by page, in rising order.
+std::vector<MemberMapping> privateMappings(std::span<const Mapping> mappings);
+
+/// Which clusters are image segments, for `keepsAllSets`: those that hold a private mapping of a file, and
+/// what lies directly behind one, its zero-filled data. `mappings[m]` are the private mappings of member m.
+std::vector<char> imageClusters(std::span<const AddressSlot> slots,
+                                std::span<const std::vector<MemberMapping>> mappings);
+
+/// The parts of every member, sorted by mapping. `mappings[m]` are the private mappings of member m.
 std::vector<std::vector<SharedPart>> sharedParts(const FamilySharing& family,
                                                  std::span<const std::vector<MemberMapping>> mappings);
 

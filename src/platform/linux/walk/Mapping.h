@@ -38,7 +38,9 @@ struct Mapping {
         return !isFileBacked() && name.size() > 1 && name[0] == '[' && name != "[heap]" &&
                name != "[stack]" && !name.starts_with("[anon:") && !name.starts_with("[stack:");
     }
-    bool isPrivateAnonymous() const { return !isFileBacked() && !shared && !isKernelSpecial(); }
+    /// Whether it can hold pages of the task's own, which relatives may share after a fork.
+    bool isPrivate() const { return !shared && !isKernelSpecial(); }
+    bool isPrivateAnonymous() const { return !isFileBacked() && isPrivate(); }
 };
 
 } // namespace tally::platform
