@@ -1,5 +1,7 @@
 // What a process is charged for, from its status file.
 
+#include "platform/linux/processes/Ledgers.h"
+
 #include "platform/bsd_process.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/Task.h"
@@ -16,13 +18,6 @@ namespace {
 constexpr std::array<const char*, 2> entryNames{"page_table", "phys_tally"};
 constexpr std::uint64_t topLevelTable = 4096; // one page, which VmPTE leaves out
 
-struct Charges {
-    std::uint64_t pageTable = 0;
-    std::uint64_t physTally = 0;
-    std::uint64_t peak = 0;
-    std::uint64_t residentAnonymous = 0;
-};
-
 /// The charges of the process that this thread read last: the usage record and the ledger that are asked one
 /// after the other come from one read, so that they agree.
 struct LastRead {
@@ -31,16 +26,21 @@ struct LastRead {
 };
 thread_local std::optional<LastRead> lastRead;
 
-std::optional<Charges> readCharges(std::int32_t pid) {
+std::optional<Charges> readChargesOfTask(std::int32_t pid) {
+    const std::shared_ptr<Task> task = taskOfProcess(pid);
+    return readCharges(pid, task && task->isSecondTenant());
+}
+
+} // namespace
+
+std::optional<Charges> readCharges(std::int32_t pid, bool isSecondTenant) {
     const std::optional<ProcessStatus> status = readProcessStatus(pid);
     if (!status) {
         return std::nullopt;
     }
     Charges charges;
     if (status->hasAddressSpace) {
-        // Of tasks that share one address space only the first is charged for its page tables.
-        const std::shared_ptr<Task> task = taskOfProcess(pid);
-        charges.pageTable = task && task->isSecondTenant() ? 0 : status->pageTables + topLevelTable;
+        charges.pageTable = isSecondTenant ? 0 : status->pageTables + topLevelTable;
         charges.physTally = status->residentAnonymous + status->residentShared + status->hugetlb +
                             status->swapped + charges.pageTable;
         charges.peak = std::max(charges.physTally, status->peakResident);
@@ -49,10 +49,8 @@ std::optional<Charges> readCharges(std::int32_t pid) {
     return charges;
 }
 
-} // namespace
-
 int proc_pid_rusage(std::int32_t pid, rusage_info_v5* info) {
-    const std::optional<Charges> charges = readCharges(pid);
+    const std::optional<Charges> charges = readChargesOfTask(pid);
     if (!charges) {
         return -1;
     }
@@ -80,7 +78,7 @@ int ledger_entries(std::int32_t pid, std::span<ledger_entry_info> entries) {
         charges = lastRead->charges;
         lastRead.reset();
     } else {
-        charges = readCharges(pid);
+        charges = readChargesOfTask(pid);
     }
     if (!charges) {
         return -1;
