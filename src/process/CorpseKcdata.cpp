@@ -13,6 +13,8 @@ namespace {
 
 constexpr std::uint32_t BeginMarker = 0xDEADF157;
 constexpr std::uint32_t EndMarker = 0xF19158ED;
+constexpr std::uint32_t ArrayType = 0x11;
+constexpr std::uint32_t FirstPaddedArrayType = 0x20; // one for each of 0 to 15 bytes of padding
 
 struct ItemHeader {
     std::uint32_t type;
@@ -33,7 +35,8 @@ std::optional<KcdataItem> takeItem(std::span<const std::byte>& rest) {
         return std::nullopt;
     }
     rest = payload.subspan(header.payloadSize);
-    return KcdataItem{header.type, payload.first(header.payloadSize)};
+    const bool isPaddedArray = (header.type & ~std::uint32_t{0xF}) == FirstPaddedArrayType;
+    return KcdataItem{isPaddedArray ? ArrayType : header.type, payload.first(header.payloadSize)};
 }
 
 /// Crash information that is mapped into the tool for as long as this lives.

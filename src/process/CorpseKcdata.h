@@ -14,7 +14,7 @@
 namespace tally {
 
 struct KcdataItem {
-    std::uint32_t type = 0;
+    std::uint32_t type = 0; // of an array whatever its padding
     std::span<const std::byte> payload;
 };
 

@@ -19,7 +19,7 @@ constexpr std::uint32_t TranslatedFlag = 0x20000;
 /// What the crash information says of the process.
 struct CrashInformation {
     std::int32_t pid = -1;
-    std::optional<std::string> name;
+    std::string name; // stays empty where none is told: what has its pid now may be another process
     std::uint32_t flags = 0;
     std::uint32_t dirtyFlags = ~std::uint32_t{0};
     TLUserProcess::Ledgers ledgers;
@@ -104,9 +104,7 @@ std::shared_ptr<TLCorpseProcess> TLCorpseProcess::initWithCorpse(mach_port_t cor
     if (!process->initWithBsdInfo(info)) {
         return nullptr;
     }
-    if (information.name) {
-        process->setName(*std::move(information.name));
-    }
+    process->setName(information.name);
     process->setDisplayString(formatted("%s [%d] (corpse)", process->name().c_str(), process->pid()));
     process->_setIdleExitStatusFromDirtyFlags(information.dirtyFlags);
     process->setLedgers(information.ledgers);

@@ -87,6 +87,8 @@ TEST_F(Corpse, MakesDoWithMissingAndShortItemsButNotWithDamage) {
     ASSERT_TRUE(corpse);
     EXPECT_EQ(corpse->pid(), -1);
     EXPECT_EQ(corpse->name().size(), 1023u) << "the longest path";
+    EXPECT_EQ(corpseWith(kcdata(item(begin) + item(0x805, raw(50))))->displayString(), " [50] (corpse)")
+        << "its pid may be another process's by now";
     EXPECT_EQ(corpse->idleExitStatus(), TLIdleExitStatus::dirty) << "missing flags are all set";
     EXPECT_FALSE(corpse->is64bit() || corpse->isTranslated() || corpse->auxData());
     EXPECT_FALSE(TLCorpseProcess::initWithCorpse(MACH_PORT_NULL));
@@ -100,6 +102,13 @@ TEST_F(Corpse, MakesDoWithMissingAndShortItemsButNotWithDamage) {
     EXPECT_TRUE(testing::internal::GetCapturedStderr().starts_with("initWithCorpse:mach_port_mod_refs: "));
     EXPECT_EQ(kernel.heldBuffers(), 0u);
     EXPECT_EQ(kernel.heldPortReferences(), 1u) << "the corpse that was made";
+}
+
+TEST(Kcdata, CallsArraysSoWhateverTheirPadding) {
+    std::string types;
+    const auto note = [&](const KcdataItem& each) { types += std::to_string(each.type) + " "; };
+    enumerateKcdata(kcdata(item(begin) + item(0x1F) + item(0x20) + item(0x2F) + item(0x30)), note);
+    EXPECT_EQ(types, "3735941463 31 17 17 48 ");
 }
 
 TEST(Kcdata, EndsBeforeAnItemThatDoesNotFit) {
