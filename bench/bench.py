@@ -3,8 +3,9 @@
 
   bench.py TALLY PROGRAMS [NAME ...]
 
-TALLY is the tool, PROGRAMS the folder of puppet and latency. NAMEs choose among: population libraries big mappings scaling
-latency (all). Commands that are compared run in turn, five times each after one run that does not count; figures are medians.
+TALLY is the tool, PROGRAMS the folder of puppet, latency and stop. NAMEs choose among: population libraries big mappings
+scaling latency stop (all). Commands that are compared run in turn, five times each after one run that does not count;
+figures are medians.
 Everything that is started is ended by pid.
 """
 import contextlib, json, os, platform, resource, shutil, signal, statistics, subprocess, sys, time
@@ -164,10 +165,25 @@ def latency(tally, programs):
               flush=True)
 
 
+def stop(tally, programs):
+    # What else runs on the machine shall not displace the spinning thread.
+    undisplaced = ["chrt", "-f", "10"] if os.geteuid() == 0 and shutil.which("chrt") else []
+    print("\n### The longest gap that a spinning thread sees while its process is measured once\n")
+    print("| process | measured by | median | maximum | times |\n|---|---|---|---|---|")
+    for name, mebibytes, threads in [("2 threads, little memory", "0", "1"), ("200 threads, little memory", "0", "199"),
+                                     ("2 threads, 64 MiB", "64", "1"), ("2 threads, 2 GiB", "2048", "1")]:
+        for measured_by, command in [("nobody", ["-"]), ("tally --pid", [tally, "--pid", "PID"]),
+                                     ("tally --forkCorpse --pid", [tally, "--forkCorpse", "--pid", "PID"])]:
+            output = subprocess.run(undisplaced + [programs + "/stop", "5", mebibytes, threads] + command, check=True,
+                                    text=True, stdout=subprocess.PIPE).stdout.split()
+            print("| %s | %s | %.1f ms | %.1f ms | %s |" %
+                  (name, measured_by, int(output[0]) / 1e3, int(output[1]) / 1e3, output[2]), flush=True)
+
+
 def main():
     tally, programs = sys.argv[1:3]
     print("Linux %s, %d processors, %s" % (platform.release(), os.cpu_count(), time.strftime("%Y-%m-%d")))
-    measurements = {each.__name__: each for each in (population, libraries, big, mappings, scaling, latency)}
+    measurements = {each.__name__: each for each in (population, libraries, big, mappings, scaling, latency, stop)}
     for name in sys.argv[3:] or measurements:
         measurements[name](os.path.abspath(tally), os.path.abspath(programs))
 
