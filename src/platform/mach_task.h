@@ -17,8 +17,10 @@ namespace tally::platform {
 ///         not be read. `*task` is MACH_PORT_NULL then.
 kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task);
 
-/// Makes a corpse of `task`: a copy that no longer changes, with its crash information.
-/// @return KERN_SUCCESS, or an error, and then `*corpse` is MACH_PORT_NULL.
+/// Makes a corpse of `task`: a copy that no longer changes, with its crash information. The task runs on.
+/// @return KERN_SUCCESS; KERN_TERMINATED when it has ended; KERN_RIGHT_EXISTS while somebody else traces it;
+///         KERN_NO_ACCESS; KERN_OPERATION_TIMED_OUT when it could not be made to hold still;
+///         KERN_INVALID_ARGUMENT when the port is not a task's. `*corpse` is MACH_PORT_NULL then.
 kern_return_t task_generate_corpse(mach_port_t task, mach_port_t* corpse);
 
 /// Maps the crash information of a corpse, a kcdata buffer, for reading.

@@ -151,6 +151,45 @@ TEST_P(WalkContract, KnownMemoryIsCounted) {
     }
 }
 
+TEST_P(WalkContract, ACorpseShowsWhatTheTaskShowedAndOutlivesIt) {
+    const auto figures = [](mach_port_t task) {
+        std::vector<std::vector<std::uint64_t>> all;
+        for (const auto& [status, start, size, depth, info] : walk(task)) {
+            all.push_back({start, size, info.pages_resident, info.pages_dirtied, info.pages_swapped_out,
+                           info.user_tag, info.object_id_full});
+        }
+        return all;
+    };
+    const auto expected = figures(port.name());
+    mach_port_t made = MACH_PORT_NULL;
+    ASSERT_EQ(task_generate_corpse(port.name(), &made), KERN_SUCCESS);
+    const PortRight corpse(made);
+    EXPECT_EQ(figures(corpse.name()), expected);
+    std::span<const std::byte> information[2];
+    for (auto& buffer : information) {
+        ASSERT_EQ(task_map_corpse_info_64(corpse.name(), &buffer), KERN_SUCCESS);
+        const std::uint32_t beginMarker = 0xDEADF157;
+        ASSERT_GE(buffer.size(), 32U);
+        EXPECT_EQ(std::memcmp(buffer.data(), &beginMarker, sizeof beginMarker), 0);
+    }
+    EXPECT_TRUE(std::ranges::equal(information[0], information[1]));
+    for (const auto& buffer : information) {
+        EXPECT_EQ(vm_deallocate(buffer), KERN_SUCCESS);
+    }
+    EXPECT_EQ(task_map_corpse_info_64(port.name(), information), KERN_INVALID_ARGUMENT);
+    for (const mach_port_t noTask : {MACH_PORT_NULL, corpse.name()}) {
+        EXPECT_EQ(task_generate_corpse(noTask, &made), KERN_INVALID_ARGUMENT);
+        EXPECT_EQ(made, MACH_PORT_NULL);
+    }
+    for (const bool isGone : {false, true}) {
+        isGone ? environment->endSubject() : environment->leaveSubjectAsZombie();
+        EXPECT_EQ(figures(corpse.name()), expected);
+        made = corpse.name();
+        EXPECT_EQ(task_generate_corpse(port.name(), &made), KERN_TERMINATED);
+        EXPECT_EQ(made, MACH_PORT_NULL);
+    }
+}
+
 TEST_P(WalkContract, PastTheLastMappingOutputsAreUntouched) {
     for (int round = 0; round < 2; ++round) { // also when the walk has come to its end before
         std::uint64_t address = beyondAll;

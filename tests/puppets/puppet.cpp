@@ -6,7 +6,7 @@
 //   puppet fill PATH PAGES         maps the file at PATH shared, writes its first PAGES pages
 //   puppet big MIB                 private memory, every page written
 //   puppet maps COUNT              COUNT mappings of one page each, every second one written
-//   puppet churn                   maps and unmaps without end
+//   puppet churn [THREADS]         maps and unmaps without end, so many more threads too
 //   puppet breathe                 grows, shrinks and forks children that end, without end
 //   puppet family KIDS PAGES HOW   forks KIDS children that share PAGES pages and change them. HOW is
 //                                  one of same, half (every second page written), random (three pages in
@@ -19,8 +19,9 @@
 //                                  and touched
 //   puppet twins                   a second process in the same address space
 //   puppet leaderless              the first thread ends, another lives on
-//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY;
-//                                  "fixed" in place of a number runs it without randomised addresses
+//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY,
+//                                  for number 0 every ptrace by EPERM; "fixed" in place of a number runs it
+//                                  without randomised addresses
 //
 // Every line of output is "name address bytes key=bytes ...", what the mapping must show; "ready" ends the
 // ledger.
@@ -314,16 +315,29 @@ void manyMappings(std::size_t count) {
     tell("many", m, count, figure("dirty", (count + 1) / 2));
 }
 
-[[noreturn]] void churn() {
-    std::printf("ready\n");
-    std::fflush(stdout);
-    alarm(120);
+/// `pause` in microseconds, as the threads of a program wait for work.
+[[noreturn]] void churnForever(useconds_t pause) {
     for (std::size_t round = 0;; ++round) {
         char* m = map((64 + round % 64) * page, readWrite, privateAnonymous);
         write(m, 0, 32);
         munmap(m + 16 * page, 8 * page);
+        if (pause != 0) {
+            usleep(pause);
+        }
         munmap(m, (64 + round % 64) * page);
     }
+}
+
+void churn(std::size_t moreThreads) {
+    const auto start = [](void*) -> void* { churnForever(20'000); };
+    alarm(120);
+    pthread_t thread{};
+    for (std::size_t i = 0; i < moreThreads; ++i) {
+        pthread_create(&thread, nullptr, start, nullptr);
+    }
+    std::printf("ready\n");
+    std::fflush(stdout);
+    churnForever(moreThreads == 0 ? 0 : 20'000);
 }
 
 [[noreturn]] void breathe() {
@@ -460,14 +474,19 @@ void leaderless() {
     pthread_exit(nullptr);
 }
 
-/// Answers every ioctl with the request `number` by ENOTTY, here and in what is run from here.
+/// Answers every ioctl with the request `number` by ENOTTY, or for number 0 every ptrace by EPERM, here and
+/// in what is run from here.
 void refuse(std::uint32_t number) {
+    const bool refusesTracing = number == 0;
+    const std::uint32_t call = refusesTracing ? SYS_ptrace : SYS_ioctl;
+    const std::uint32_t place = refusesTracing ? offsetof(seccomp_data, nr) : offsetof(seccomp_data, args[1]);
+    const std::uint32_t error = refusesTracing ? EPERM : ENOTTY;
     sock_filter filter[] = {
         BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_ioctl, 0, 3),
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, args[1])),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 1),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | ENOTTY),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, call, 0, 3),
+        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, place),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, refusesTracing ? call : number, 0, 1),
+        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
         BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
     };
     const sock_fprog program{std::size(filter), filter};
@@ -504,7 +523,7 @@ int main(int argc, char** argv) {
     } else if (what == "maps") {
         manyMappings(number(2));
     } else if (what == "churn") {
-        churn();
+        churn(number(2));
     } else if (what == "breathe") {
         breathe();
     } else if (what == "family" && argc > 4) {

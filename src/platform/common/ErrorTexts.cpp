@@ -18,8 +18,14 @@ const char* mach_error_string(kern_return_t status) {
         return "failure";
     case KERN_NO_ACCESS:
         return "no access";
+    case KERN_RIGHT_EXISTS:
+        return "already traced";
+    case KERN_TERMINATED:
+        return "terminated";
     case KERN_NOT_SUPPORTED:
         return "operation not supported";
+    case KERN_OPERATION_TIMED_OUT:
+        return "operation timed out";
     default:
         return "unknown error code";
     }

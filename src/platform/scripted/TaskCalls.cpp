@@ -35,9 +35,13 @@ kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
 kern_return_t task_generate_corpse(mach_port_t task, mach_port_t* corpse) {
     const Answer answer("task_generate_corpse", PortName{task});
     *corpse = MACH_PORT_NULL;
-    const ScriptedTask* scripted = answer.taskOfPort(task);
-    if (answer.fault != 0 || scripted == nullptr) {
+    const auto port = answer.state.ports.find(task);
+    if (answer.fault != 0 || port == answer.state.ports.end() || port->second.corpse != nullptr) {
         return answer.fault != 0 ? answer.fault : KERN_INVALID_ARGUMENT;
+    }
+    const ScriptedTask* scripted = answer.taskOfPort(task);
+    if (scripted == nullptr) {
+        return KERN_TERMINATED;
     }
     if (scripted->corpseStatus != KERN_SUCCESS) {
         return scripted->corpseStatus;

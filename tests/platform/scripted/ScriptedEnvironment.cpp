@@ -37,9 +37,17 @@ class ScriptedEnvironment final : public Environment {
   private:
     static constexpr std::uint64_t page = 4096;
 
+    /// Crash information of nothing but its two markers.
+    static std::vector<std::byte> emptyCrashInformation() {
+        const std::uint64_t words[] = {0xDEADF157, 0, 0xF19158ED, 0};
+        const auto bytes = std::as_bytes(std::span(words));
+        return {bytes.begin(), bytes.end()};
+    }
+
     ScriptedTask& addSubject() {
         return kernel_.addTask({.pid = 4711,
                                 .name = "subject",
+                                .crashInformation = emptyCrashInformation(),
                                 .usage = {.ri_phys_tally = 40960, .ri_lifetime_max_phys_tally = 81920},
                                 .ledger = {{"phys_tally", 40960}, {"page_table", 4096}},
                                 .owned = {{{.id = 9, .virtualSize = 4096}}}});

@@ -1,5 +1,8 @@
 // The images of a task: the ELF files among its mappings, and the pages of code that the kernel gives it.
 
+#include "platform/linux/images/SymbolOwners.h"
+
+#include "platform/linux/corpse/Corpse.h"
 #include "platform/linux/images/ImageSegments.h"
 #include "platform/linux/images/LayoutTable.h"
 #include "platform/linux/objects/Backing.h"
@@ -7,6 +10,7 @@
 #include "platform/linux/walk/Task.h"
 #include "platform/runekit.h"
 
+#include <algorithm>
 #include <map>
 
 namespace tally::platform {
@@ -30,40 +34,48 @@ bool isCovered(const CodeRanges& ranges, const Mapping& mapping) {
 
 } // namespace
 
-void RKForeachSymbolOwner(mach_port_t port, const std::function<void(const RKSymbolOwner&)>& handler) {
-    const std::shared_ptr<Task> task = taskOfPort(port);
-    kern_return_t status = KERN_SUCCESS;
-    const Walk* walk = task ? task->walk(&status) : nullptr;
-    if (walk == nullptr) {
-        return; // the walk of the regions meets that too, and reports it
-    }
+std::vector<RKSymbolOwner> symbolOwnersOf(std::span<const Mapping> mappings, const std::string& folder) {
+    std::vector<RKSymbolOwner> owners;
     CodeRanges code;
     std::map<std::uint64_t, int> instances; // by object id of the file
-    for (const Mapping& mapping : walk->mappings()) {
+    for (const Mapping& mapping : mappings) {
         if (mapping.name == kernelCode) {
-            handler({kernelCode, mapping.start, {{mapping.start, mapping.size(), "__TEXT"}}});
+            owners.push_back({kernelCode, mapping.start, {{mapping.start, mapping.size(), "__TEXT"}}});
         }
         if (!mapping.executable || !mapping.isFileBacked() || isCovered(code, mapping)) {
             continue;
         }
         // A file in memory is shared memory first of all: its pages are dirty, whoever maps them.
-        const BackingObject object = backingOf(mapping, walk->folder());
+        const BackingObject object = backingOf(mapping, folder);
         if (object.backing != Backing::file || ++instances[objectIdOfFile(object)] > mostInstances) {
             continue;
         }
-        const auto layout = layoutOfFile(object, walk->folder(), mapping);
+        const auto layout = layoutOfFile(object, folder, mapping);
         const auto bias = layout ? biasOf(*layout, mapping) : std::nullopt;
         if (!bias) {
             continue;
         }
-        RKSymbolOwner owner{mapping.name, *bias + layout->loads.front().firstPage(),
-                            segmentsOf(*layout, *bias, mapping, walk->mappings())};
-        for (const RKSegment& segment : owner.segments) {
+        owners.push_back({mapping.name, *bias + layout->loads.front().firstPage(),
+                          segmentsOf(*layout, *bias, mapping, mappings)});
+        for (const RKSegment& segment : owners.back().segments) {
             if (segment.name == "__TEXT") {
                 code.emplace(segment.start + segment.size, segment.start);
             }
         }
-        handler(owner);
+    }
+    return owners;
+}
+
+void RKForeachSymbolOwner(mach_port_t port, const std::function<void(const RKSymbolOwner&)>& handler) {
+    const std::shared_ptr<Task> task = taskOfPort(port);
+    if (task && task->corpse() != nullptr) {
+        std::ranges::for_each(task->corpse()->images(), handler);
+        return;
+    }
+    kern_return_t status = KERN_SUCCESS;
+    const Walk* walk = task ? task->walk(&status) : nullptr;
+    if (walk != nullptr) { // else the walk of the regions meets that too, and reports it
+        std::ranges::for_each(symbolOwnersOf(walk->mappings(), walk->folder()), handler);
     }
 }
 

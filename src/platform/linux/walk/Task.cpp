@@ -2,6 +2,7 @@
 
 #include "platform/bsd_process.h"
 #include "platform/gather.h"
+#include "platform/linux/corpse/Corpse.h"
 #include "platform/linux/families/Families.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/processes/ProcessStat.h"
@@ -29,8 +30,10 @@ class PortTable {
     mach_port_t add(std::shared_ptr<Task> task) {
         const std::scoped_lock lock(mutex_);
         const mach_port_t name = nextName_++;
+        if (task->corpse() == nullptr) {
+            byPid_[task->pid()] = name;
+        }
         ports_.emplace(name, PortEntry{std::move(task)});
-        byPid_[ports_[name].task->pid()] = name;
         return name;
     }
 
@@ -50,7 +53,9 @@ class PortTable {
         const std::scoped_lock lock(mutex_);
         std::vector<std::shared_ptr<Task>> tasks;
         for (const auto& [name, entry] : ports_) {
-            tasks.push_back(entry.task);
+            if (entry.task->corpse() == nullptr) {
+                tasks.push_back(entry.task);
+            }
         }
         return tasks;
     }
@@ -104,10 +109,28 @@ FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat, std::int64_t th
 Task::Task(MemberIdentity identity, const FamilyKey& key)
     : identity_(identity), key_(key), owner_(enterAddressSpace(key, identity)) {}
 
-Task::~Task() { leaveAddressSpace(key_, identity_); }
+Task::Task(std::shared_ptr<Corpse> corpse)
+    : identity_(corpse->identity()), owner_(corpse->owner()), corpse_(std::move(corpse)) {}
+
+Task::~Task() {
+    if (!corpse_) {
+        leaveAddressSpace(key_, identity_);
+    }
+}
+
+bool Task::hasRelatives() const {
+    return corpse_ ? corpse_->hasRelatives() : !key_.isKnown() || countRelatives(key_) > 1;
+}
+
+std::vector<std::string> Task::takeNotices() {
+    return corpse_ ? corpse_->takeNotices() : std::exchange(notices_, {});
+}
 
 const Walk* Task::walk(kern_return_t* status) {
     *status = KERN_SUCCESS;
+    if (corpse_) {
+        return corpse_->walk();
+    }
     if (!walk_) {
         if (isSecondTenant() && compareAddressSpaces(owner_.pid, identity_.pid) != 0) {
             owner_ = identity_; // it has loaded another program since
@@ -124,6 +147,8 @@ const Walk* Task::walk(kern_return_t* status) {
     }
     return walk_.get();
 }
+
+mach_port_t makePort(std::shared_ptr<Task> task) { return portTable().add(std::move(task)); }
 
 std::vector<std::shared_ptr<Task>> allTasks() { return portTable().all(); }
 
@@ -144,8 +169,8 @@ kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     if (!maps.isOpen() && statusForErrno(errno) == KERN_NO_ACCESS) {
         return KERN_NO_ACCESS;
     }
-    *task = portTable().add(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks},
-                                                   familyKeyOf(pid, *text, stat->threads)));
+    *task = makePort(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks},
+                                            familyKeyOf(pid, *text, stat->threads)));
     return KERN_SUCCESS;
 }
 

@@ -14,11 +14,14 @@
 
 namespace tally::platform {
 
-/// One process, by pid and start time: a pid that is used again is another task. Holds no descriptor. The
-/// walk that is under way is used by one thread at a time.
+class Corpse;
+
+/// One process, by pid and start time: a pid that is used again is another task; or the corpse of one. Holds
+/// no descriptor. The walk that is under way is used by one thread at a time.
 class Task {
   public:
     Task(MemberIdentity identity, const FamilyKey& key);
+    explicit Task(std::shared_ptr<Corpse> corpse);
     ~Task();
     Task(const Task&) = delete;
     Task& operator=(const Task&) = delete;
@@ -27,32 +30,39 @@ class Task {
     /// Whether a task with a lower pid has the very same address space, and so its page tables too.
     bool isSecondTenant() const { return owner_.pid != identity_.pid; }
     /// Whether there is a right to another process that descends from the same exec, as far as can be told.
-    bool hasRelatives() const { return !key_.isKnown() || countRelatives(key_) > 1; }
+    bool hasRelatives() const;
     std::uint64_t startTicks() const { return identity_.startTicks; }
     const FamilyKey& familyKey() const { return key_; }
+    MemberIdentity identity() const { return identity_; }
+    /// What is left of the process; null for one that runs.
+    const Corpse* corpse() const { return corpse_.get(); }
 
     /// The walk that is under way; starts one when there is none.
     /// @return null with `*status` when the address space cannot be read.
     const Walk* walk(kern_return_t* status);
     void endWalk() { walk_.reset(); }
-    std::vector<std::string> takeNotices() { return std::exchange(notices_, {}); }
+    std::vector<std::string> takeNotices();
 
   private:
     MemberIdentity identity_;
     FamilyKey key_;
     MemberIdentity owner_; // of the address space
+    std::shared_ptr<Corpse> corpse_;
     std::unique_ptr<const Walk> walk_;
     std::vector<std::string> notices_;
     std::vector<std::string> given_; // notices that were given once already
 };
 
-/// Every task to which a right exists.
+/// A right to `task`, with one reference.
+mach_port_t makePort(std::shared_ptr<Task> task);
+
+/// Every running task to which a right exists.
 std::vector<std::shared_ptr<Task>> allTasks();
 
 /// The task that `port` names; null when it names none.
 std::shared_ptr<Task> taskOfPort(mach_port_t port);
 
-/// A task of process `pid` to which a right exists; null when there is none.
+/// The running task of process `pid` to which a right exists; null when there is none.
 std::shared_ptr<Task> taskOfProcess(std::int32_t pid);
 
 } // namespace tally::platform

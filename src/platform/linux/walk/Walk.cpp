@@ -5,6 +5,7 @@
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/pieces/PieceBuilder.h"
+#include "platform/linux/pieces/SharedPieces.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/PageSource.h"
 #include "platform/linux/walk/ProcessMemoryFiles.h"
@@ -88,6 +89,25 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
     walk->mappings_ = std::move(space.mappings);
     result.walk = std::move(walk);
     return result;
+}
+
+void Walk::divide(std::span<const SharedPart> parts) {
+    std::vector<Piece> divided;
+    divided.reserve(pieces_.size() + parts.size());
+    for (const Piece& piece : pieces_) {
+        std::size_t count = 0;
+        while (piece.shareMode == SM_PRIVATE && count < parts.size() &&
+               parts[count].mapping == piece.mapping) {
+            ++count;
+        }
+        if (count == 0) {
+            divided.push_back(piece);
+        } else {
+            appendDivided(piece, parts.first(count), &divided);
+            parts = parts.subspan(count);
+        }
+    }
+    pieces_ = std::move(divided);
 }
 
 const Piece* Walk::pieceAt(std::uint64_t address) const {

@@ -22,7 +22,7 @@ namespace tally::platform {
 class Walk {
   public:
     struct Result {
-        std::unique_ptr<const Walk> walk; // null unless KERN_SUCCESS
+        std::unique_ptr<Walk> walk; // null unless KERN_SUCCESS
         kern_return_t status = KERN_SUCCESS;
         std::vector<std::string> notices;
     };
@@ -42,6 +42,10 @@ class Walk {
     std::span<const Mapping> mappings() const { return mappings_; }
     /// The process folder that the mappings were read in.
     const std::string& folder() const { return folder_; }
+
+    /// Divides the task's own pieces by what relatives share, for a walk that was read without them.
+    /// @param parts sorted by mapping.
+    void divide(std::span<const SharedPart> parts);
 
     /// Fills one disposition word per page from `address` on.
     void pageWords(std::uint64_t address, std::span<std::int32_t> words) const;

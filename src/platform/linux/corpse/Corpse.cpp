@@ -1,0 +1,219 @@
+#include "platform/linux/corpse/Corpse.h"
+
+#include "platform/bsd_process.h"
+#include "platform/linux/corpse/CorpseFamilies.h"
+#include "platform/linux/corpse/KcdataWriter.h"
+#include "platform/linux/corpse/StoppedThreads.h"
+#include "platform/linux/images/SymbolOwners.h"
+#include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/processes/Ledgers.h"
+#include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/walk/AccountingSwitch.h"
+#include "platform/linux/walk/ProcessMemoryFiles.h"
+#include "platform/linux/walk/Task.h"
+#include "platform/mach_task.h"
+
+#include <algorithm>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <system_error>
+#include <thread>
+#include <vector>
+
+namespace tally::platform {
+
+namespace {
+
+// Types of items of crash information.
+constexpr std::uint32_t pidItem = 0x805;
+constexpr std::uint32_t pathItem = 0x80F;
+constexpr std::uint32_t flagsItem = 0x815;
+constexpr std::uint32_t dirtyFlagsItem = 0x819;
+constexpr std::uint32_t pageTableItem = 0x825;
+constexpr std::uint32_t physTallyItem = 0x826;
+constexpr std::uint32_t peakItem = 0x827;
+
+constexpr std::uint32_t flag64bit = 0x4;
+
+/// Who the process is, as its crash information says it.
+struct Identification {
+    std::string path; // of the executable, or a name
+    std::uint32_t flags = 0;
+};
+
+Identification identify(std::int32_t pid) {
+    Identification identification;
+    proc_bsdinfo info;
+    if (proc_pidinfo(pid, &info) != sizeof info) {
+        return identification;
+    }
+    identification.flags = (info.pbi_flags & PROC_FLAG_LP64) != 0 ? flag64bit : 0;
+    constexpr std::string_view deleted = " (deleted)";
+    identification.path =
+        readSystemLink(processFolder(pid) + "/exe")
+            .value_or(std::string(info.pbi_name, strnlen(info.pbi_name, sizeof info.pbi_name)));
+    if (identification.path.ends_with(deleted)) {
+        identification.path.resize(identification.path.size() - deleted.size());
+    }
+    return identification;
+}
+
+std::vector<std::byte> crashInformationOf(std::int32_t pid, const Identification& identification,
+                                          const Charges& charges) {
+    KcdataWriter writer;
+    writer.addNumber(pidItem, static_cast<std::uint32_t>(pid));
+    writer.addText(pathItem, identification.path);
+    writer.addNumber(flagsItem, identification.flags);
+    writer.addNumber(dirtyFlagsItem, std::uint32_t{0}); // nothing is tracked for idle exit here
+    writer.addNumber(pageTableItem, charges.pageTable);
+    writer.addNumber(physTallyItem, charges.physTally);
+    writer.addNumber(peakItem, charges.peak);
+    return writer.finish();
+}
+
+/// Whether another process descends from the same exec. Who will be asked for later is not known yet.
+bool hasLiveRelatives(std::int32_t pid, const FamilyKey& key) {
+    std::vector<std::int32_t> pids(static_cast<std::size_t>(std::max(proc_listallpids({}), 0)));
+    pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
+    return key.isKnown() && std::ranges::any_of(pids, [&](std::int32_t other) {
+               return other != pid &&
+                      decodeFamilyKey(readSystemFile(processFolder(other) + "/stat").value_or("")) == key;
+           });
+}
+
+/// Reads what of a running process may take its time, so that it need not while the process holds still.
+void readAhead(MemberIdentity task) {
+    ProcessMemoryFiles files;
+    std::vector<Mapping> mappings;
+    if (files.open(task.pid, task.startTicks, &mappings) == KERN_SUCCESS) {
+        symbolOwnersOf(mappings, files.folder); // the headers of its files are remembered
+    }
+}
+
+/// Looks at the process. To be run by a thread of its own, at whose end every thread of the process runs on.
+kern_return_t lookAt(MemberIdentity task, bool hasRelatives, CorpseSpace& space, Charges& charges) {
+    const StoppedThreads stopped(task.pid);
+    if (stopped.status() != KERN_SUCCESS) {
+        return stopped.status();
+    }
+    const std::optional<std::string> text = readSystemFile(processFolder(task.pid) + "/stat");
+    const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
+    if (!stat || stat->startTicks != task.startTicks) {
+        return KERN_TERMINATED;
+    }
+    space.owner = task;
+    space.key = decodeFamilyKey(*text);
+    Walk::Result result = Walk::read(task, FamilyKey(), task, !accountingSwitchIsOn());
+    charges = readCharges(task.pid, false).value_or(Charges());
+    const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
+    if (status == KERN_INVALID_ARGUMENT || charges.pageTable == 0) {
+        return KERN_TERMINATED; // it can be killed while it holds still
+    }
+    if (!result.walk) {
+        return status;
+    }
+    space.walk = std::move(result.walk);
+    space.notices = std::move(result.notices);
+    space.images = symbolOwnersOf(space.walk->mappings(), space.walk->folder());
+    if (hasRelatives) {
+        space.held = readHeldPages(task, space.walk->mappings());
+    }
+    return KERN_SUCCESS;
+}
+
+/// Runs `work` on a thread of its own. @return KERN_NO_SPACE where the system refuses one.
+template <typename Work>
+kern_return_t runApart(const Work& work) {
+    kern_return_t status = KERN_NO_SPACE;
+    try {
+        std::thread([&] { status = work(); }).join();
+    } catch (const std::system_error&) { // no thread is to be had
+    }
+    return status;
+}
+
+/// Crash information that callers have asked for and not given back.
+struct MappedInformation {
+    std::mutex mutex;
+    std::map<const std::byte*, std::vector<std::byte>> buffers;
+};
+
+MappedInformation& mappedInformation() {
+    static MappedInformation information;
+    return information;
+}
+
+} // namespace
+
+const Walk* Corpse::walk() const {
+    settleCorpseFamily(*space_);
+    return space_->walk.get();
+}
+
+std::vector<std::string> Corpse::takeNotices() { return takeCorpseNotices(*space_); }
+
+bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpses(space_->key) > 1; }
+
+kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
+    const FamilyKey key = decodeFamilyKey(readSystemFile(processFolder(task.pid) + "/stat").value_or(""));
+    const Identification identification = identify(task.pid);
+    if (auto space = corpseSpaceOfTwin(key, task)) {
+        const Charges charges = readCharges(task.pid, true).value_or(Charges());
+        *corpse =
+            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, identification, charges));
+        return KERN_SUCCESS;
+    }
+    const auto space = std::make_shared<CorpseSpace>();
+    if (isLayoutFixed(task.pid)) {
+        space->execRandom = readExecRandom(task.pid);
+    }
+    const bool hasRelatives = hasLiveRelatives(task.pid, key);
+    readAhead(task);
+    Charges charges;
+    const kern_return_t status = runApart([&] { return lookAt(task, hasRelatives, *space, charges); });
+    if (status == KERN_SUCCESS) {
+        enterCorpse(space);
+        *corpse =
+            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, identification, charges));
+    }
+    return status;
+}
+
+kern_return_t task_generate_corpse(mach_port_t task, mach_port_t* corpse) {
+    *corpse = MACH_PORT_NULL;
+    const std::shared_ptr<Task> live = taskOfPort(task);
+    if (!live || live->corpse() != nullptr) {
+        return KERN_INVALID_ARGUMENT;
+    }
+    std::shared_ptr<Corpse> made;
+    const kern_return_t status = makeCorpse(live->identity(), &made);
+    if (status == KERN_SUCCESS) {
+        *corpse = makePort(std::make_shared<Task>(std::move(made)));
+    }
+    return status;
+}
+
+kern_return_t task_map_corpse_info_64(mach_port_t corpse, std::span<const std::byte>* buffer) {
+    *buffer = {};
+    const std::shared_ptr<Task> task = taskOfPort(corpse);
+    if (!task || task->corpse() == nullptr) {
+        return KERN_INVALID_ARGUMENT;
+    }
+    const auto information = task->corpse()->crashInformation();
+    std::vector<std::byte> copy(information.begin(), information.end());
+    *buffer = copy;
+    MappedInformation& mapped = mappedInformation();
+    const std::scoped_lock lock(mapped.mutex);
+    mapped.buffers.emplace(copy.data(), std::move(copy));
+    return KERN_SUCCESS;
+}
+
+kern_return_t vm_deallocate(std::span<const std::byte> buffer) {
+    MappedInformation& mapped = mappedInformation();
+    const std::scoped_lock lock(mapped.mutex);
+    return mapped.buffers.erase(buffer.data()) == 1 ? KERN_SUCCESS : KERN_INVALID_ADDRESS;
+}
+
+} // namespace tally::platform

@@ -1,0 +1,47 @@
+// StoppedThreads: a process that holds still while it is looked at.
+//
+// Its threads are seized by ptrace, interrupted and awaited, until a look at the list of threads finds no new
+// one. Nothing of it outlives the thread that made it: whatever way that ends, the kernel lets go of every
+// thread which it had seized, and they run on. Processes that share the memory without being threads of the
+// process are not stopped.
+
+#pragma once
+
+#include "platform/kern_return.h"
+
+#include <chrono>
+#include <cstdint>
+#include <map>
+
+namespace tally::platform {
+
+class StoppedThreads {
+  public:
+    /// Stops all threads of process `pid`. To be made by a thread that ends soon after.
+    explicit StoppedThreads(std::int32_t pid);
+    /// Lets the threads go on, with the signals that were on their way to them.
+    ~StoppedThreads();
+    StoppedThreads(const StoppedThreads&) = delete;
+    StoppedThreads& operator=(const StoppedThreads&) = delete;
+
+    /// KERN_SUCCESS when all threads hold still; KERN_NO_ACCESS, KERN_RIGHT_EXISTS when another process
+    /// traces them, KERN_TERMINATED, or KERN_OPERATION_TIMED_OUT when one does not react.
+    kern_return_t status() const { return status_; }
+
+  private:
+    struct Thread {
+        enum class State : std::uint8_t { running, stopped, gone } state = State::running;
+        int signal = 0; // that it was about to take
+    };
+
+    kern_return_t stopAll();
+    kern_return_t seizeNewThreads(bool* isNew);
+    bool awaitThreads(std::chrono::steady_clock::time_point deadline);
+    bool look(std::int32_t id, Thread& thread);
+
+    std::int32_t pid_;
+    std::map<std::int32_t, Thread> threads_;
+    kern_return_t status_;
+};
+
+} // namespace tally::platform

@@ -1,0 +1,272 @@
+// Corpses of real processes: that they show one instant, and that the processes run on as if nothing had
+// been.
+
+#include "linux/Puppet.h"
+#include "platform/mach_task.h"
+#include "process/TLCorpseProcess.h"
+#include "vm/PhysTallyCollection.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <spawn.h>
+#include <sys/mman.h>
+#include <sys/ptrace.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <random>
+#include <regex>
+#include <set>
+#include <thread>
+
+namespace tally::test {
+namespace {
+
+using namespace platform;
+using namespace std::chrono_literals;
+
+PortRight portOf(int pid) {
+    mach_port_t task = MACH_PORT_NULL;
+    EXPECT_EQ(task_read_for_pid(pid, &task), KERN_SUCCESS);
+    return PortRight(task);
+}
+
+/// What the status file of a thread says behind `key`; empty when the thread has ended.
+std::string statusOf(const std::filesystem::path& thread, const std::string& key) {
+    std::ifstream file(thread / "status");
+    std::string word;
+    while (file >> word && word != key) {
+    }
+    file >> word;
+    return word;
+}
+
+/// Expects to see soon `threads` threads that nobody traces, all in one of the states `states`.
+void expectThreads(int pid, std::size_t threads, const std::string& states) {
+    std::string seen;
+    const auto areAsExpected = [&] {
+        seen.clear();
+        for (const auto& entry :
+             std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task")) {
+            const bool isTraced = statusOf(entry.path(), "TracerPid:") != "0";
+            seen += isTraced ? "traced" : statusOf(entry.path(), "State:");
+        }
+        return seen.size() == threads && seen.find_first_not_of(states) == std::string::npos;
+    };
+    for (int i = 0; i < 1000 && !areAsExpected(); ++i) { // they have to run to stop again
+        std::this_thread::sleep_for(10ms);
+    }
+    EXPECT_TRUE(areAsExpected()) << seen;
+}
+
+/// Waits until the process is traced, or may have been.
+void awaitTracer(int pid) {
+    const std::string folder = "/proc/" + std::to_string(pid);
+    const auto deadline = std::chrono::steady_clock::now() + 200ms;
+    while (statusOf(folder, "TracerPid:") == "0" && std::chrono::steady_clock::now() < deadline) {
+    }
+}
+
+void stop(int pid) {
+    siginfo_t stopped{};
+    kill(pid, SIGSTOP);
+    waitid(P_PID, static_cast<id_t>(pid), &stopped, WSTOPPED);
+}
+
+/// Makes a corpse of `task`. @return what it is charged; 0 with `*status` when there is none.
+std::uint64_t examineCorpse(const PortRight& task, kern_return_t* status) {
+    mach_port_t port = MACH_PORT_NULL;
+    *status = task_generate_corpse(task.name(), &port);
+    if (*status != KERN_SUCCESS) {
+        EXPECT_EQ(port, MACH_PORT_NULL);
+        return 0;
+    }
+    const PortRight given(port);
+    const auto corpse = TLCorpseProcess::initWithCorpse(port);
+    if (!corpse) {
+        ADD_FAILURE() << "no crash information";
+        return 0;
+    }
+    corpse->gatherData();
+    std::uint64_t held = 0;
+    for (const TLMemoryRegion& region : corpse->memoryRegions()) {
+        held += region.dirtySize + region.swappedSize;
+    }
+    EXPECT_EQ(held, corpse->phys_tally()) << "regions and ledger of one instant";
+    EXPECT_TRUE(corpse->warnings().empty());
+    return held;
+}
+
+class Corpse : public testing::Test {
+  protected:
+    Corpse() { setPhysTallyCollectionEnabled(1); }
+    ~Corpse() override { setPhysTallyCollectionEnabled(0); }
+};
+
+TEST_F(Corpse, ShowsOneInstantOfTwoHundredThreadsThatMapAndUnmap) {
+    const Puppet puppet({"churn", "200"});
+    const PortRight task = portOf(puppet.pid());
+    std::set<std::uint64_t> tallies;
+    for (int round = 0; round < 20; ++round) {
+        kern_return_t status = KERN_FAILURE;
+        tallies.insert(examineCorpse(task, &status));
+        ASSERT_EQ(status, KERN_SUCCESS);
+        expectThreads(puppet.pid(), 201, "RSD");
+    }
+    EXPECT_GT(tallies.size(), 5U) << "nothing changes, so that nothing is shown";
+}
+
+TEST_F(Corpse, LetsGoOfEveryThreadWhenTheToolIsKilled) {
+    const Puppet busy({"churn", "200"});
+    const Puppet stopped({"churn", "20"});
+    stop(stopped.pid());
+    std::mt19937 random(1);
+    for (int round = 0; round < 40; ++round) {
+        const int pid = (round % 2 == 0 ? busy : stopped).pid();
+        std::string arguments[] = {TALLY_PROGRAM, "--forkCorpse", "--pid", std::to_string(pid)};
+        char* words[] = {arguments[0].data(), arguments[1].data(), arguments[2].data(), arguments[3].data(),
+                         nullptr};
+        posix_spawn_file_actions_t actions;
+        posix_spawn_file_actions_init(&actions);
+        posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
+        pid_t tool = 0;
+        ASSERT_EQ(posix_spawn(&tool, words[0], &actions, nullptr, words, environ), 0);
+        posix_spawn_file_actions_destroy(&actions);
+        awaitTracer(pid);
+        std::this_thread::sleep_for(std::chrono::microseconds(random() % 4000));
+        kill(tool, SIGKILL);
+        waitpid(tool, nullptr, 0);
+        expectThreads(busy.pid(), 201, "RSD");
+        expectThreads(stopped.pid(), 21, "T");
+    }
+}
+
+TEST_F(Corpse, LeavesAStoppedProcessStoppedAndItsContinuingPossible) {
+    const Puppet puppet({"idle"});
+    const PortRight task = portOf(puppet.pid());
+    stop(puppet.pid());
+    for (const std::string states : {"T", "RS"}) {
+        kern_return_t status = KERN_FAILURE;
+        EXPECT_GT(examineCorpse(task, &status), 0U);
+        expectThreads(puppet.pid(), 1, states);
+        siginfo_t continued{};
+        kill(puppet.pid(), SIGCONT);
+        waitid(P_PID, static_cast<id_t>(puppet.pid()), &continued, WCONTINUED | WNOHANG);
+    }
+}
+
+volatile int* signalsTaken = nullptr; // shared with the child that takes them
+
+TEST_F(Corpse, LosesNoSignalOnItsWay) {
+    void* const shared = mmap(nullptr, 4096, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+    signalsTaken = static_cast<volatile int*>(shared);
+    signal(SIGRTMIN, [](int) { *signalsTaken = *signalsTaken + 1; });
+    const pid_t pid = fork();
+    if (pid == 0) {
+        alarm(60);
+        for (;;) {
+        }
+    }
+    std::atomic<bool> isOver = false;
+    int sent = 0;
+    std::thread sender([&] {
+        while (!isOver) {
+            sent += sigqueue(pid, SIGRTMIN, {}) == 0 ? 1 : 0;
+            std::this_thread::sleep_for(20us);
+        }
+    });
+    const PortRight task = portOf(pid);
+    for (int round = 0; round < 40; ++round) {
+        kern_return_t status = KERN_FAILURE;
+        examineCorpse(task, &status);
+        EXPECT_EQ(status, KERN_SUCCESS);
+    }
+    isOver = true;
+    sender.join();
+    for (int i = 0; i < 1000 && *signalsTaken != sent; ++i) {
+        std::this_thread::sleep_for(10ms);
+    }
+    EXPECT_EQ(*signalsTaken, sent);
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+    signal(SIGRTMIN, SIG_DFL);
+    munmap(shared, 4096);
+}
+
+TEST_F(Corpse, OfAProcessThatEndsMeanwhileIsWholeOrNone) {
+    std::mt19937 random(2);
+    int whole = 0;
+    constexpr int rounds = 30;
+    for (int round = 0; round < rounds; ++round) {
+        const Puppet puppet({"churn", "20"});
+        const PortRight task = portOf(puppet.pid());
+        std::thread killer([&] {
+            awaitTracer(puppet.pid());
+            std::this_thread::sleep_for(std::chrono::microseconds(random() % (100 * rounds)));
+            kill(puppet.pid(), SIGKILL);
+        });
+        kern_return_t status = KERN_FAILURE;
+        examineCorpse(task, &status);
+        EXPECT_TRUE(status == KERN_SUCCESS || status == KERN_TERMINATED) << mach_error_string(status);
+        whole += status == KERN_SUCCESS ? 1 : 0;
+        killer.join();
+    }
+    EXPECT_LT(whole, rounds) << "all ended too late";
+}
+
+TEST_F(Corpse, ReportsWhatStillProcessesReport) {
+    const std::vector<std::string> shapes[] = {{"zoo"},
+                                               {"leaderless"},
+                                               {"twins"},
+                                               {"family", "3", "600", "half"},
+                                               {"family", "5", "3000", "random"},
+                                               {"family", "2", "2048", "huge"},
+                                               {"family", "2", "600", "grow"}};
+    for (const std::vector<std::string>& shape : shapes) {
+        const Puppet puppet(shape);
+        for (const std::string view : {"--swapped", "--vmObjectDirty"}) { // the first changes no figure
+            std::vector<std::string> command{TALLY_PROGRAM, "-f", "bytes",
+                                             view,          "-t", std::to_string(puppet.pid())};
+            const Outcome live = run(command);
+            command.insert(command.begin() + 1, "--forkCorpse");
+            const Outcome dead = run(command);
+            EXPECT_EQ(dead.errors, "");
+            EXPECT_EQ(std::regex_replace(dead.output, std::regex(R"( \(corpse\)|={2,})"), ""),
+                      std::regex_replace(live.output, std::regex("={2,}"), ""))
+                << shape[0] << " " << view;
+        }
+    }
+}
+
+TEST_F(Corpse, ThatCannotBeHadIsSaidAndTheRunGoesOn) {
+    Puppet puppet({"idle"});
+    const Puppet other({"idle"});
+    const std::string pid = std::to_string(puppet.pid());
+    const std::vector<std::string> command{TALLY_PROGRAM, "--forkCorpse", "--pid",
+                                           pid,           "--pid",        std::to_string(other.pid())};
+    const auto expectRefused = [&](const std::string& reason, std::vector<std::string> prefix, int others) {
+        prefix.insert(prefix.end(), command.begin(), command.end());
+        const Outcome outcome = run(prefix);
+        const std::string start = "Unable to fork a corpse of process puppet [";
+        EXPECT_TRUE(outcome.errors.starts_with(start + pid + "]: " + reason + "\n")) << outcome.errors;
+        EXPECT_EQ(outcome.status, others == 0 ? 1 : 0);
+        EXPECT_EQ(outcome.output.find("puppet [" + std::to_string(other.pid()) + "] (corpse)") !=
+                      std::string::npos,
+                  others != 0);
+    };
+    ASSERT_EQ(ptrace(PTRACE_SEIZE, puppet.pid(), nullptr, nullptr), 0);
+    expectRefused("already traced", {}, 1);
+    ptrace(PTRACE_INTERRUPT, puppet.pid(), nullptr, nullptr);
+    waitpid(puppet.pid(), nullptr, __WALL);
+    ptrace(PTRACE_DETACH, puppet.pid(), nullptr, nullptr);
+    expectRefused("no access", {PUPPET_PROGRAM, "refuse", "0"}, 0); // as where tracing is forbidden
+    puppet.end(true);
+    expectRefused("terminated", {}, 1);
+}
+
+} // namespace
+} // namespace tally::test
