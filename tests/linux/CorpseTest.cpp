@@ -3,6 +3,7 @@
 
 #include "linux/Puppet.h"
 #include "platform/mach_task.h"
+#include "platform/mach_vm.h"
 #include "process/TLCorpseProcess.h"
 #include "vm/PhysTallyCollection.h"
 
@@ -239,6 +240,70 @@ TEST_F(Corpse, ReportsWhatStillProcessesReport) {
                       std::regex_replace(live.output, std::regex("={2,}"), ""))
                 << shape[0] << " " << view;
         }
+    }
+}
+
+/// Pages of a corpse between two addresses: its own, and those it shares with relatives.
+std::pair<std::uint32_t, std::uint32_t> ownAndShared(const PortRight& corpse, std::uint64_t start,
+                                                     std::uint64_t end) {
+    std::pair<std::uint32_t, std::uint32_t> pages;
+    vm_region_submap_info_64 info;
+    for (std::uint64_t size = 0, at = start; at < end; at += size) {
+        std::uint32_t depth = 0;
+        std::uint32_t count = VM_REGION_SUBMAP_INFO_COUNT_64;
+        if (mach_vm_region_recurse(corpse.name(), &at, &size, &depth, &info, &count) != KERN_SUCCESS) {
+            break;
+        }
+        (info.share_mode == SM_COW ? pages.second : pages.first) += at < end ? info.pages_resident : 0;
+    }
+    return pages;
+}
+
+TEST_F(Corpse, SharesNothingWithARelativeThatWasForkedLater) {
+    if (geteuid() != 0) {
+        GTEST_SKIP() << "frame numbers are for root";
+    }
+    constexpr std::size_t size = 64 * 4096;
+    void* const guarded = mmap(nullptr, 3 * size, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    char* const memory = static_cast<char*>(guarded) + size;
+    mprotect(memory, size, PROT_READ | PROT_WRITE);
+    madvise(memory, size, MADV_NOHUGEPAGE);
+    int go[2];
+    int told[2];
+    ASSERT_TRUE(pipe(go) == 0 && pipe(told) == 0);
+    pid_t pid = 0;
+    const pid_t child = fork();
+    if (child == 0) {
+        alarm(60);
+        for (std::size_t at = 0; at < size; at += 4096) {
+            memory[at] = 1;
+        }
+        bool isTold = write(told[1], &pid, sizeof pid) == sizeof pid && read(go[0], &pid, 1) == 1;
+        pid = fork();
+        alarm(60);
+        isTold = isTold && (pid == 0 || write(told[1], &pid, sizeof pid) == sizeof pid);
+        for (;;) {
+            pause();
+        }
+    }
+    mach_port_t port = MACH_PORT_NULL;
+    EXPECT_EQ(read(told[0], &pid, sizeof pid), static_cast<ssize_t>(sizeof pid));
+    EXPECT_EQ(task_generate_corpse(portOf(child).name(), &port), KERN_SUCCESS);
+    const PortRight before(port);
+    EXPECT_EQ(write(go[1], "x", 1), 1);
+    EXPECT_EQ(read(told[0], &pid, sizeof pid), static_cast<ssize_t>(sizeof pid));
+    EXPECT_EQ(task_generate_corpse(portOf(pid).name(), &port), KERN_SUCCESS);
+    const PortRight after(port);
+    const auto start = reinterpret_cast<std::uint64_t>(memory);
+    for (const PortRight* corpse : {&before, &after}) {
+        EXPECT_EQ(ownAndShared(*corpse, start, start + size), (std::pair{64U, 0U}));
+    }
+    kill(pid, SIGKILL);
+    kill(child, SIGKILL);
+    waitpid(child, nullptr, 0);
+    munmap(guarded, 3 * size);
+    for (const int end : {go[0], go[1], told[0], told[1]}) {
+        close(end);
     }
 }
 
