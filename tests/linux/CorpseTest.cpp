@@ -219,6 +219,14 @@ TEST_F(Corpse, OfAProcessThatEndsMeanwhileIsWholeOrNone) {
     EXPECT_LT(whole, rounds) << "all ended too late";
 }
 
+/// What the tool reports, but for the word that tells corpses, and for lines as long as the names between
+/// them.
+std::string reportOf(const std::vector<std::string>& command) {
+    const Outcome outcome = run(command);
+    EXPECT_EQ(outcome.errors, "");
+    return std::regex_replace(outcome.output, std::regex(R"( \(corpse\)|={2,})"), "");
+}
+
 TEST_F(Corpse, ReportsWhatStillProcessesReport) {
     const std::vector<std::string> shapes[] = {{"zoo"},
                                                {"leaderless"},
@@ -232,13 +240,12 @@ TEST_F(Corpse, ReportsWhatStillProcessesReport) {
         for (const std::string view : {"--swapped", "--vmObjectDirty"}) { // the first changes no figure
             std::vector<std::string> command{TALLY_PROGRAM, "-f", "bytes",
                                              view,          "-t", std::to_string(puppet.pid())};
-            const Outcome live = run(command);
-            command.insert(command.begin() + 1, "--forkCorpse");
-            const Outcome dead = run(command);
-            EXPECT_EQ(dead.errors, "");
-            EXPECT_EQ(std::regex_replace(dead.output, std::regex(R"( \(corpse\)|={2,})"), ""),
-                      std::regex_replace(live.output, std::regex("={2,}"), ""))
-                << shape[0] << " " << view;
+            std::vector<std::string> ofCorpse = command;
+            ofCorpse.insert(ofCorpse.begin() + 1, "--forkCorpse");
+            const std::string before = reportOf(command);
+            const std::string found = reportOf(ofCorpse);
+            const std::string after = reportOf(command); // pages of files can have been written to disk
+            EXPECT_EQ(found, found == before ? before : after) << shape[0] << " " << view;
         }
     }
 }

@@ -79,7 +79,7 @@ bool hasLiveRelatives(std::int32_t pid, const FamilyKey& key) {
     pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
     return key.isKnown() && std::ranges::any_of(pids, [&](std::int32_t other) {
                return other != pid &&
-                      decodeFamilyKey(readSystemFile(processFolder(other) + "/stat").value_or("")) == key;
+                      familyKeyOf(other, readSystemFile(processFolder(other) + "/stat").value_or("")) == key;
            });
 }
 
@@ -104,7 +104,7 @@ kern_return_t lookAt(MemberIdentity task, bool hasRelatives, CorpseSpace& space,
         return KERN_TERMINATED;
     }
     space.owner = task;
-    space.key = decodeFamilyKey(*text);
+    space.key = familyKeyOf(task.pid, *text);
     Walk::Result result = Walk::read(task, FamilyKey(), task, !accountingSwitchIsOn());
     charges = readCharges(task.pid, false).value_or(Charges());
     const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
@@ -157,7 +157,8 @@ std::vector<std::string> Corpse::takeNotices() { return takeCorpseNotices(*space
 bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpses(space_->key) > 1; }
 
 kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
-    const FamilyKey key = decodeFamilyKey(readSystemFile(processFolder(task.pid) + "/stat").value_or(""));
+    const FamilyKey key =
+        familyKeyOf(task.pid, readSystemFile(processFolder(task.pid) + "/stat").value_or(""));
     const Identification identification = identify(task.pid);
     if (auto space = corpseSpaceOfTwin(key, task)) {
         const Charges charges = readCharges(task.pid, true).value_or(Charges());

@@ -2,6 +2,7 @@
 
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
+#include "platform/linux/processes/ProcessStat.h"
 
 #include <elf.h>
 #include <linux/kcmp.h>
@@ -31,6 +32,20 @@ FamilyKey decodeFamilyKey(std::string_view stat) {
         }
         if (field == fields[next]) {
             takeNumber(word, &key.layout[next++]);
+        }
+    }
+    return key;
+}
+
+FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat) {
+    FamilyKey key = decodeFamilyKey(stat);
+    const std::optional<ProcessStat> decoded = decodeStat(stat);
+    if (!key.isKnown() && decoded && decoded->threads > 1) {
+        for (const std::string& thread : threadFolders(pid)) {
+            key = decodeFamilyKey(readSystemFile(thread + "/stat").value_or(""));
+            if (key.isKnown()) {
+                break;
+            }
         }
     }
     return key;

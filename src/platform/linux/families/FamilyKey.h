@@ -9,6 +9,7 @@
 #include <array>
 #include <compare>
 #include <cstdint>
+#include <string>
 #include <string_view>
 
 namespace tally::platform {
@@ -24,6 +25,9 @@ struct FamilyKey {
 
 /// Takes the key from the text of /proc/PID/stat; unknown when it holds none.
 FamilyKey decodeFamilyKey(std::string_view stat);
+
+/// The key of process `pid`, whose stat file holds `stat`: of another thread where the first has ended.
+FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat);
 
 /// The random bytes that process `pid` got at its exec; zeros when they cannot be read.
 std::array<std::uint64_t, 2> readExecRandom(std::int32_t pid);

@@ -91,19 +91,6 @@ PortTable& portTable() {
     return table;
 }
 
-FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat, std::int64_t threads) {
-    FamilyKey key = decodeFamilyKey(stat);
-    if (!key.isKnown() && threads > 1) {
-        for (const std::string& thread : threadFolders(pid)) {
-            key = decodeFamilyKey(readSystemFile(thread + "/stat").value_or(""));
-            if (key.isKnown()) {
-                break;
-            }
-        }
-    }
-    return key;
-}
-
 } // namespace
 
 Task::Task(MemberIdentity identity, const FamilyKey& key)
@@ -169,8 +156,7 @@ kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     if (!maps.isOpen() && statusForErrno(errno) == KERN_NO_ACCESS) {
         return KERN_NO_ACCESS;
     }
-    *task = makePort(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks},
-                                            familyKeyOf(pid, *text, stat->threads)));
+    *task = makePort(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks}, familyKeyOf(pid, *text)));
     return KERN_SUCCESS;
 }
 
