@@ -8,7 +8,7 @@ scaling latency stop (all). Commands that are compared run in turn, five times e
 figures are medians.
 Everything that is started is ended by pid.
 """
-import contextlib, json, os, platform, resource, shutil, signal, statistics, subprocess, sys, time
+import contextlib, json, os, platform, resource, shutil, signal, statistics, subprocess, sys, tempfile, time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 RUNS = 5
@@ -36,7 +36,7 @@ class Child:
 
 
 def run(command):
-    """Wall seconds, processor seconds and peak resident MiB of one run."""
+    """Wall seconds, processor seconds and peak resident MiB of one run, the last not below what this program has."""
     before = resource.getrusage(resource.RUSAGE_CHILDREN)
     start = time.monotonic()
     process = subprocess.Popen(command, shell=isinstance(command, str), stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
@@ -51,9 +51,12 @@ def run(command):
 def run_sampling(command, seconds):
     """Processor seconds of all samples, and how many there were."""
     before = resource.getrusage(resource.RUSAGE_CHILDREN)
-    done = subprocess.run(["timeout", "-s", "INT", str(seconds)] + command, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL)
+    with tempfile.TemporaryFile() as report:
+        subprocess.run(["timeout", "-s", "INT", str(seconds)] + command, stdout=report, stderr=subprocess.DEVNULL)
+        report.seek(0)
+        samples = sum(line.startswith(b"Summary Tally") for line in report)
     after = resource.getrusage(resource.RUSAGE_CHILDREN)
-    return after.ru_utime + after.ru_stime - before.ru_utime - before.ru_stime, done.stdout.count(b"\nSummary Tally")
+    return after.ru_utime + after.ru_stime - before.ru_utime - before.ru_stime, samples
 
 
 def compare(title, commands):
