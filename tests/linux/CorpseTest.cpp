@@ -219,6 +219,21 @@ TEST_F(Corpse, OfAProcessThatEndsMeanwhileIsWholeOrNone) {
     EXPECT_LT(whole, rounds) << "all ended too late";
 }
 
+/// The kernel lets no program be loaded before whoever traces the threads that it ends has taken note of
+/// that.
+TEST_F(Corpse, OfAProcessThatLoadsProgramsIsWholeOrNone) {
+    const Puppet puppet({"reload"});
+    int whole = 0;
+    for (int round = 0; round < 200; ++round) {
+        const PortRight task = portOf(puppet.pid());
+        kern_return_t status = KERN_FAILURE;
+        examineCorpse(task, &status);
+        EXPECT_TRUE(status == KERN_SUCCESS || status == KERN_TERMINATED) << mach_error_string(status);
+        whole += status == KERN_SUCCESS ? 1 : 0;
+    }
+    EXPECT_GT(whole, 0);
+}
+
 /// What the tool reports, but for the word that tells corpses, and for lines as long as the names between
 /// them.
 std::string reportOf(const std::vector<std::string>& command) {

@@ -6,6 +6,7 @@
 //   puppet fill PATH PAGES         maps the file at PATH shared, writes its first PAGES pages
 //   puppet big MIB                 private memory, every page written
 //   puppet maps COUNT              COUNT mappings of one page each, every second one written
+//   puppet reload                  60 threads, the last of which loads the program again, without end
 //   puppet churn [THREADS]         maps and unmaps without end, so many more threads too
 //   puppet breathe                 grows, shrinks and forks children that end, without end
 //   puppet family KIDS PAGES HOW   forks KIDS children that share PAGES pages and change them. HOW is
@@ -49,6 +50,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <string>
 
 #ifndef MADV_GUARD_INSTALL
@@ -340,6 +342,30 @@ void churn(std::size_t moreThreads) {
     churnForever(moreThreads == 0 ? 0 : 20'000);
 }
 
+/// Loads the same program again and again, from another thread than the first.
+void reload(char** arguments) {
+    const auto wait = [](void*) -> void* {
+        for (;;) {
+            pause();
+        }
+    };
+    const auto load = [](void* words) -> void* {
+        usleep(static_cast<useconds_t>(std::clock() * 7919 % 3000));
+        execv("/proc/self/exe", static_cast<char**>(words));
+        fail("exec");
+    };
+    signal(SIGPIPE, SIG_IGN); // whoever started it hears it once
+    std::printf("ready\n");
+    std::fflush(stdout);
+    alarm(120);
+    pthread_t thread{};
+    for (int i = 0; i < 60; ++i) {
+        pthread_create(&thread, nullptr, wait, nullptr);
+    }
+    pthread_create(&thread, nullptr, load, arguments);
+    wait(nullptr);
+}
+
 [[noreturn]] void breathe() {
     std::printf("ready\n");
     std::fflush(stdout);
@@ -530,6 +556,8 @@ int main(int argc, char** argv) {
         family(number(2), number(3), argv[4]);
     } else if (what == "memory") {
         halfTouchedMemory(number(2));
+    } else if (what == "reload") {
+        reload(argv);
     } else if (what == "twins") {
         twins();
     } else if (what == "leaderless") {

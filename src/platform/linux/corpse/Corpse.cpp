@@ -14,7 +14,9 @@
 #include "platform/mach_task.h"
 
 #include <algorithm>
+#include <chrono>
 #include <cstring>
+#include <future>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -92,23 +94,31 @@ void readAhead(MemberIdentity task) {
     }
 }
 
-/// Looks at the process. To be run by a thread of its own, at whose end every thread of the process runs on.
-kern_return_t lookAt(MemberIdentity task, bool hasRelatives, CorpseSpace& space, Charges& charges) {
-    const StoppedThreads stopped(task.pid);
+/// What is found out while the process holds still.
+struct Capture {
+    bool hasRelatives = false; // by which it is known what else to read
+    Identification identification;
+    Charges charges;
+};
+
+/// Looks at the process, whose key is that of `space`. To be run by a thread of its own, at whose end every
+/// thread of the process runs on.
+kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& space, Capture& capture) {
+    const StoppedThreads stopped(task.pid, seized);
     if (stopped.status() != KERN_SUCCESS) {
         return stopped.status();
     }
     const std::optional<std::string> text = readSystemFile(processFolder(task.pid) + "/stat");
     const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
-    if (!stat || stat->startTicks != task.startTicks) {
-        return KERN_TERMINATED;
+    if (!stat || stat->startTicks != task.startTicks || familyKeyOf(task.pid, *text) != space.key) {
+        return KERN_TERMINATED; // or it has loaded another program since
     }
     space.owner = task;
-    space.key = familyKeyOf(task.pid, *text);
+    capture.identification = identify(task.pid);
     Walk::Result result = Walk::read(task, FamilyKey(), task, !accountingSwitchIsOn());
-    charges = readCharges(task.pid, false).value_or(Charges());
+    capture.charges = readCharges(task.pid, false).value_or(Charges());
     const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
-    if (status == KERN_INVALID_ARGUMENT || charges.pageTable == 0) {
+    if (status == KERN_INVALID_ARGUMENT || capture.charges.pageTable == 0) {
         return KERN_TERMINATED; // it can be killed while it holds still
     }
     if (!result.walk) {
@@ -117,21 +127,28 @@ kern_return_t lookAt(MemberIdentity task, bool hasRelatives, CorpseSpace& space,
     space.walk = std::move(result.walk);
     space.notices = std::move(result.notices);
     space.images = symbolOwnersOf(space.walk->mappings(), space.walk->folder());
-    if (hasRelatives) {
+    if (capture.hasRelatives) {
         space.held = readHeldPages(task, space.walk->mappings());
     }
     return KERN_SUCCESS;
 }
 
-/// Runs `work` on a thread of its own. @return KERN_NO_SPACE where the system refuses one.
-template <typename Work>
-kern_return_t runApart(const Work& work) {
-    kern_return_t status = KERN_NO_SPACE;
+/// Runs `work` on a thread of its own, and `meanwhile` on this one again and again.
+/// @return KERN_NO_SPACE where the system refuses a thread.
+template <typename Work, typename Meanwhile>
+kern_return_t runApart(const Work& work, const Meanwhile& meanwhile) {
+    std::promise<kern_return_t> promise;
+    std::future<kern_return_t> result = promise.get_future();
     try {
-        std::thread([&] { status = work(); }).join();
+        std::thread worker([&] { promise.set_value(work()); });
+        while (result.wait_for(std::chrono::milliseconds(2)) != std::future_status::ready) {
+            meanwhile();
+        }
+        worker.join();
     } catch (const std::system_error&) { // no thread is to be had
+        return KERN_NO_SPACE;
     }
-    return status;
+    return result.get();
 }
 
 /// Crash information that callers have asked for and not given back.
@@ -159,25 +176,26 @@ bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpse
 kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
     const FamilyKey key =
         familyKeyOf(task.pid, readSystemFile(processFolder(task.pid) + "/stat").value_or(""));
-    const Identification identification = identify(task.pid);
     if (auto space = corpseSpaceOfTwin(key, task)) {
         const Charges charges = readCharges(task.pid, true).value_or(Charges());
         *corpse =
-            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, identification, charges));
+            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, identify(task.pid), charges));
         return KERN_SUCCESS;
     }
     const auto space = std::make_shared<CorpseSpace>();
+    space->key = key;
     if (isLayoutFixed(task.pid)) {
         space->execRandom = readExecRandom(task.pid);
     }
-    const bool hasRelatives = hasLiveRelatives(task.pid, key);
+    Capture capture{.hasRelatives = hasLiveRelatives(task.pid, key), .identification = {}, .charges = {}};
     readAhead(task);
-    Charges charges;
-    const kern_return_t status = runApart([&] { return lookAt(task, hasRelatives, *space, charges); });
+    SeizedThreads seized;
+    const kern_return_t status =
+        runApart([&] { return lookAt(task, seized, *space, capture); }, [&] { seized.takeNoteOfEnds(); });
     if (status == KERN_SUCCESS) {
         enterCorpse(space);
-        *corpse =
-            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, identification, charges));
+        *corpse = std::make_shared<Corpse>(
+            task, space, crashInformationOf(task.pid, capture.identification, capture.charges));
     }
     return status;
 }

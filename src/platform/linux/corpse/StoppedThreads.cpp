@@ -72,7 +72,28 @@ long trace(__ptrace_request request, std::int32_t thread, int signal = 0) {
 
 } // namespace
 
-StoppedThreads::StoppedThreads(std::int32_t pid) : pid_(pid), status_(stopAll()) {}
+void SeizedThreads::add(std::int32_t id) {
+    const std::scoped_lock lock(mutex_);
+    ids_.insert(id);
+}
+
+void SeizedThreads::takeNoteOfEnds() {
+    const std::scoped_lock lock(mutex_);
+    std::erase_if(ids_, [](std::int32_t thread) {
+        const auto id = static_cast<id_t>(thread);
+        siginfo_t found{};
+        // Stops of a traced thread are told whether one asks for them or not, and they are another's to take.
+        if (waitid(P_PID, id, &found, WEXITED | WNOHANG | WNOWAIT | __WALL) != 0) {
+            return true;
+        }
+        const bool hasEnded =
+            found.si_pid == thread && found.si_code != CLD_TRAPPED && found.si_code != CLD_STOPPED;
+        return hasEnded && waitid(P_PID, id, &found, WEXITED | WNOHANG | __WALL) == 0;
+    });
+}
+
+StoppedThreads::StoppedThreads(std::int32_t pid, SeizedThreads& seized)
+    : pid_(pid), seized_(seized), status_(stopAll()) {}
 
 StoppedThreads::~StoppedThreads() {
     for (const auto& [id, thread] : threads_) {
@@ -114,19 +135,47 @@ kern_return_t StoppedThreads::stopAll() {
 kern_return_t StoppedThreads::seizeNewThreads(bool* isNew) {
     *isNew = false;
     for (const std::int32_t id : listThreads(pid_)) {
-        if (threads_.contains(id)) {
+        if (isStillKnown(id)) {
             continue;
         }
-        if (trace(PTRACE_SEIZE, id) == 0) {
-            threads_[id] = {};
-            *isNew = true;
-        } else if (hasEnded(pid_, id)) {
-            threads_[id] = {.state = Thread::State::gone};
-        } else {
-            return tracerOf(pid_, id) != 0 ? KERN_RIGHT_EXISTS : KERN_NO_ACCESS;
+        // One that has just ended can have cut the list off: it is read again.
+        *isNew = true;
+        if (const kern_return_t status = seize(id); status != KERN_SUCCESS) {
+            return status;
         }
     }
     return KERN_SUCCESS;
+}
+
+/// Not when another thread has taken the number over: one that loads another program becomes the first.
+bool StoppedThreads::isStillKnown(std::int32_t id) const {
+    const auto found = threads_.find(id);
+    if (found == threads_.end()) {
+        return false;
+    }
+    return found->second.state == Thread::State::gone ? hasEnded(pid_, id)
+                                                      : id != pid_ || tracerOf(pid_, id) == gettid();
+}
+
+kern_return_t StoppedThreads::seize(std::int32_t id) {
+    for (int attempt = 0; attempt < 3; ++attempt) { // its number can go over to another thread meanwhile
+        const bool isSeized = trace(PTRACE_SEIZE, id) == 0;
+        const std::int32_t tracer = isSeized ? gettid() : tracerOf(pid_, id);
+        if (tracer == gettid()) { // also one that was seized under another number
+            threads_[id] = {};
+            seized_.add(id);
+            return KERN_SUCCESS;
+        }
+        if (hasEnded(pid_, id)) {
+            threads_[id] = {.state = Thread::State::gone};
+            return KERN_SUCCESS;
+        }
+        if (tracer != 0) {
+            return KERN_RIGHT_EXISTS;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return KERN_NO_ACCESS;
 }
 
 /// Waits until every thread has stopped or ended. @return false when time is up before.

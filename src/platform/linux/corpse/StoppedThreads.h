@@ -4,6 +4,10 @@
 // one. Nothing of it outlives the thread that made it: whatever way that ends, the kernel lets go of every
 // thread which it had seized, and they run on. Processes that share the memory without being threads of the
 // process are not stopped.
+//
+// A thread that loads another program ends the others, and waits until whoever traces them has taken note of
+// their ends; to seize one more thread is to wait for that program meanwhile. So another thread of the tool
+// takes note of them.
 
 #pragma once
 
@@ -12,13 +16,27 @@
 #include <chrono>
 #include <cstdint>
 #include <map>
+#include <mutex>
+#include <set>
 
 namespace tally::platform {
+
+/// The threads that are seized, for the thread of the tool that takes note of their ends.
+class SeizedThreads {
+  public:
+    void add(std::int32_t id);
+    /// To be called again and again while the others are stopped.
+    void takeNoteOfEnds();
+
+  private:
+    std::mutex mutex_;
+    std::set<std::int32_t> ids_;
+};
 
 class StoppedThreads {
   public:
     /// Stops all threads of process `pid`. To be made by a thread that ends soon after.
-    explicit StoppedThreads(std::int32_t pid);
+    StoppedThreads(std::int32_t pid, SeizedThreads& seized);
     /// Lets the threads go on, with the signals that were on their way to them.
     ~StoppedThreads();
     StoppedThreads(const StoppedThreads&) = delete;
@@ -36,10 +54,13 @@ class StoppedThreads {
 
     kern_return_t stopAll();
     kern_return_t seizeNewThreads(bool* isNew);
+    bool isStillKnown(std::int32_t id) const;
+    kern_return_t seize(std::int32_t id);
     bool awaitThreads(std::chrono::steady_clock::time_point deadline);
     bool look(std::int32_t id, Thread& thread);
 
     std::int32_t pid_;
+    SeizedThreads& seized_;
     std::map<std::int32_t, Thread> threads_;
     kern_return_t status_;
 };
