@@ -12,8 +12,10 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <optional>
 #include <string>
+#include <system_error>
 #include <vector>
 
 namespace tally {
@@ -127,6 +129,11 @@ bool writeFile(const std::string& path, const std::string& contents) {
     const bool isClosed = file != nullptr && std::fclose(file) == 0;
     if (!isWritten || !isClosed) {
         std::fprintf(stderr, "Unable to write %s: %s\n", printable(path).c_str(), std::strerror(errno));
+        std::error_code ignored;
+        const auto status = std::filesystem::symlink_status(path, ignored);
+        if (file != nullptr && std::filesystem::is_regular_file(status)) {
+            std::filesystem::remove(path, ignored); // half a snapshot is of no use
+        }
     }
     return isWritten && isClosed;
 }

@@ -56,6 +56,7 @@ class TargetBuilder {
     bool addChildren();
     bool searchAllProcessesBut(TLPidSet excluded);
     std::optional<TLProcessTable> allReadableProcesses(const TLPidSet& excluded) const;
+    void noticePidsNamedTwice() const;
     void notice(const std::string& text) const;
     std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name) const;
 
@@ -83,10 +84,25 @@ bool TargetBuilder::build() {
     if (!(args_.targetAll ? targetEveryProcess(excluded) : targetNamedProcesses(excluded))) {
         return false;
     }
+    noticePidsNamedTwice();
     if (args_.skipIdleExitClean) {
         table_ = removeIdleExitCleanProcessesFrom(table_);
     }
     return true;
+}
+
+/// Reports go by pid: a process and its snapshot, or two snapshots of it, are one entry there.
+void TargetBuilder::noticePidsNamedTwice() const {
+    std::map<std::int32_t, std::string> names;
+    for (const auto& [key, process] : table_) {
+        const auto [entry, isNew] = names.try_emplace(process->pid(), process->displayString());
+        if (!isNew) {
+            notice(
+                formatted("NOTICE: %s and %s have one pid: their sections and totals show the two together; "
+                          "report on one at a time to tell them apart\n",
+                          printable(entry->second).c_str(), printable(process->displayString()).c_str()));
+        }
+    }
 }
 
 /// What names a file is a snapshot or, failing that, a process.

@@ -115,6 +115,7 @@ void SnapshotCapture::addUnmappedMemory() {
     }
     sum.address = std::uint64_t{1} << 61;
     sum.type = Name("memory");
+    sum.object_id = TLNotSet; // of no object that others could have
     sum.user_tag = TLUnmappedTag;
     sum.resident_size = sum.dirty_size + sum.reusable_size;
     sum.length = std::max(sum.length, sum.resident_size + sum.swapped_out_size);

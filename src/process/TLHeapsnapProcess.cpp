@@ -37,8 +37,10 @@ std::string contentsOfFile(const std::string& path, std::error_code& failure) {
     }
     constexpr std::size_t step = 1 << 20;
     std::string contents;
-    bool isTooLarge = std::filesystem::file_size(path, failure) > QRYLargestSnapshotFile;
-    while (file && !isTooLarge) { // it may grow or shrink meanwhile
+    const std::uintmax_t told = std::filesystem::file_size(path, failure);
+    bool isTooLarge = told > QRYLargestSnapshotFile;
+    // It may grow or shrink meanwhile. The kernel's own files tell no size, and some never end.
+    while (file && told != 0 && !isTooLarge) {
         const std::size_t size = contents.size();
         contents.resize(size + step);
         file.read(contents.data() + size, step);

@@ -267,6 +267,9 @@ bool SnapshotHandler::finishRegion() {
         return refuse("it has two tags");
     }
     end_ = r.address + r.length;
+    if (r.object_id == 0 && (r.dirty_size | r.swapped_out_size | r.reusable_size) != 0) {
+        region_.object_id = ~std::uint64_t{0}; // what is charged for is some object's, if nobody else's
+    }
     snapshot_.regions.push_back(r);
     return true;
 }
