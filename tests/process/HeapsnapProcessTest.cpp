@@ -185,6 +185,7 @@ class Capture : public WalkTest {
         Lines lines;
         for (const TLMemoryRegion& region : snapshot->memoryRegions()) {
             lines.push_back(describe(region));
+            EXPECT_TRUE(region.dirtySize == 0 || region.object_id != 0) << "no row shows " << lines.back();
         }
         EXPECT_EQ(snapshot->auxData(), capture->auxData());
         return lines;
