@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <mutex>
 #include <optional>
+#include <thread>
 
 namespace tally::platform {
 
@@ -27,8 +28,11 @@ std::int64_t numberOf(std::string_view text, std::string_view key) {
     return 0;
 }
 
-// Counters lag by what processors keep to themselves: less than this is nothing.
-constexpr std::int64_t noisePages = 32;
+/// Counters lag by what processors keep to themselves: less than this is nothing.
+std::int64_t noisePages() {
+    constexpr std::int64_t ofOneProcessor = 16;
+    return ofOneProcessor * std::max<std::int64_t>(std::thread::hardware_concurrency(), 1);
+}
 
 MachineState readMachineState() {
     const std::string meminfo = readSystemFile(systemPath("/proc/meminfo")).value_or("");
@@ -60,7 +64,7 @@ std::uint64_t decodeLazyFree(std::string_view vmstat) {
     const std::int64_t filePages = numberOf(vmstat, "nr_file_pages ") - numberOf(vmstat, "nr_shmem ") -
                                    numberOf(vmstat, "nr_swapcached ");
     const std::int64_t surplus = onFileLists - filePages;
-    return surplus > noisePages ? static_cast<std::uint64_t>(surplus) * basePage : 0;
+    return surplus > noisePages() ? static_cast<std::uint64_t>(surplus) * basePage : 0;
 }
 
 bool decodeSwapInUse(std::string_view meminfo) {
