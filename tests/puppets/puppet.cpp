@@ -14,8 +14,9 @@
 //                                  ten, drawn by the child's number), drop (the second half unmapped),
 //                                  huge (huge pages, the first 4 KiB of each written), grow (the parent's
 //                                  and the children's mappings grow apart), leaderless (nothing changes, the
-//                                  children's first threads end), swapped (nothing changes: it was
-//                                  swapped out before, and shared memory of as many pages with it)
+//                                  children's first threads end), freed (lazily, before), swapped (nothing
+//                                  changes: it was swapped out before, and shared memory of as many pages
+//                                  with it)
 //   puppet memory PAGES            a memfd of PAGES pages, all written, of which only the first are mapped
 //                                  and touched
 //   puppet twins                   a second process in the same address space
@@ -426,6 +427,9 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
         madvise(m, pages * page, MADV_HUGEPAGE);
     }
     write(m, 0, pages);
+    if (how == "freed") {
+        madvise(m, pages * page, MADV_FREE);
+    }
     if (how == "swapped") {
         char* shared = map(pages * page, readWrite, MAP_SHARED | MAP_ANONYMOUS);
         write(shared, 0, pages);

@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <condition_variable>
 #include <cstddef>
+#include <iterator>
 #include <map>
 #include <mutex>
 #include <set>
@@ -73,6 +74,20 @@ void enter(Search& search, const Search::Candidate& candidate, std::uint64_t fou
     search.left -= std::min(found - std::min(known, found), search.left);
 }
 
+/// Asks one candidate, without the lock meanwhile.
+void ask(Search& search, std::vector<Search::Candidate>::iterator candidate,
+         std::unique_lock<std::mutex>& lock) {
+    const Search::Candidate asked = *candidate;
+    search.candidates.erase(candidate);
+    ++search.asked;
+    lock.unlock();
+    const std::uint64_t found = lazilyFreed(processFolder(asked.pid));
+    lock.lock();
+    --search.asked;
+    enter(search, asked, found);
+    search.changed.notify_all();
+}
+
 } // namespace
 
 bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder, std::uint64_t residentAnonymous) {
@@ -87,24 +102,21 @@ bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder, std::uint
     if (!current.isPrepared) {
         prepare(current);
     }
-    while (!current.answers.contains(pid) && current.left != 0 &&
-           (!current.candidates.empty() || current.asked != 0)) {
-        if (current.candidates.empty()) {
+    while (!current.answers.contains(pid)) {
+        if (current.left != 0 && !current.candidates.empty()) {
+            ask(current, std::prev(current.candidates.end()), lock);
+        } else if (current.asked != 0) {
             current.changed.wait(lock);
-            continue;
+        } else {
+            // All is found; but relatives of one that has some can show the same pages.
+            const auto own = std::ranges::find(current.candidates, pid, &Search::Candidate::pid);
+            if (own == current.candidates.end() || !current.largestOfFamily.contains(own->family)) {
+                return false;
+            }
+            ask(current, own, lock);
         }
-        const Search::Candidate next = current.candidates.back();
-        current.candidates.pop_back();
-        ++current.asked;
-        lock.unlock();
-        const std::uint64_t found = lazilyFreed(processFolder(next.pid));
-        lock.lock();
-        --current.asked;
-        enter(current, next, found);
-        current.changed.notify_all();
     }
-    const auto answer = current.answers.find(pid);
-    return answer != current.answers.end() && answer->second;
+    return current.answers[pid];
 }
 
 void restartLazyFreeSearch(bool isGathering) {
