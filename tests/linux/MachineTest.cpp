@@ -6,10 +6,12 @@
 #include "linux/Puppet.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <sstream>
 
@@ -147,6 +149,52 @@ TEST(Machine, SwappedMemoryOfRelativesIsWhatTheSwapFileHolds) {
     const std::int64_t expected = used() - before;
     EXPECT_GT(expected, 30 << 20);
     EXPECT_TRUE(isWithin(swapped, expected, 0.005)) << swapped << " of " << expected;
+}
+
+constexpr const char* mergingSwitch = "/sys/kernel/mm/ksm/run";
+
+/// Has the kernel merge pages of one content, and what it merged taken apart again in the end.
+class PageMerging {
+  public:
+    PageMerging() : lock_(lockOfMachine("merging")) {
+        int before = -1;
+        std::ifstream(mergingSwitch) >> before;
+        isOn_ = before == 0 && static_cast<bool>(std::ofstream(mergingSwitch) << 1 << std::flush);
+    }
+    ~PageMerging() {
+        for (const char* step : {"2", "0"}) {
+            if (isOn_) {
+                std::ofstream(mergingSwitch) << step;
+            }
+        }
+        close(lock_);
+    }
+    bool isOn() const { return isOn_; }
+
+  private:
+    int lock_ = -1;
+    bool isOn_ = false;
+};
+
+TEST(Machine, PagesMergedByContentAreAWarningOfTheirProcess) {
+    constexpr std::size_t size = 64 << 10;
+    void* const memory = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    std::memset(memory, 7, size);
+    const PageMerging merging;
+    int merged = 0;
+    if (merging.isOn() && madvise(memory, size, MADV_MERGEABLE) == 0) {
+        for (int i = 0; i < 100 && merged == 0; ++i) {
+            usleep(50'000);
+            std::ifstream("/proc/self/ksm_merging_pages") >> merged;
+        }
+    }
+    const std::string own = std::to_string(getpid());
+    const std::string report = run({TALLY_PROGRAM, "--pid", own}).output;
+    munmap(memory, size);
+    if (merged == 0) {
+        GTEST_SKIP() << "the kernel merges no pages here, or others have it do so";
+    }
+    EXPECT_NE(report.find("(KSM) count for every process"), std::string::npos) << report;
 }
 
 TEST(Machine, WhatProcessesAddIsWhatTheMachineCounts) {

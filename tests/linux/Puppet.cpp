@@ -71,14 +71,6 @@ std::string readAll(int descriptor) {
     return text;
 }
 
-/// Waits until no other test changes this setting of the machine. Until the descriptor is closed.
-int lockOfMachine(const std::string& setting) {
-    const std::string path = "/tmp/tally-test-" + setting + ".lock";
-    const int lock = open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600);
-    flock(lock, LOCK_EX);
-    return lock;
-}
-
 /// Waits for the end. @return the exit status, or 128 + the signal.
 int waitFor(int pid) {
     int status = 0;
@@ -185,6 +177,13 @@ TemporaryFolder::TemporaryFolder() {
 TemporaryFolder::~TemporaryFolder() {
     std::error_code ignored;
     std::filesystem::remove_all(path_, ignored);
+}
+
+int lockOfMachine(const std::string& setting) {
+    const std::string path = "/tmp/tally-test-" + setting + ".lock";
+    const int lock = open(path.c_str(), O_CREAT | O_RDWR | O_CLOEXEC, 0600);
+    flock(lock, LOCK_EX);
+    return lock;
 }
 
 HugePagePool::HugePagePool(int pages) {

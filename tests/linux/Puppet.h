@@ -75,6 +75,10 @@ class TemporaryFolder {
     std::string path_;
 };
 
+/// Waits until no other test changes this setting of the machine. @return a descriptor; until it is closed no
+/// other can.
+int lockOfMachine(const std::string& setting);
+
 /// Raises the machine's pool of huge pages, alone among tests, and puts it back. `granted` is how many pages
 /// there were to be had.
 class HugePagePool {

@@ -37,7 +37,10 @@ std::int64_t noisePages() {
 MachineState readMachineState() {
     const std::string meminfo = readSystemFile(systemPath("/proc/meminfo")).value_or("");
     const std::string vmstat = readSystemFile(systemPath("/proc/vmstat")).value_or("");
-    return {.swapInUse = decodeSwapInUse(meminfo), .lazyFree = decodeLazyFree(vmstat)};
+    const std::string merged = readSystemFile(systemPath("/sys/kernel/mm/ksm/pages_shared")).value_or("");
+    return {.swapInUse = decodeSwapInUse(meminfo),
+            .mergesPages = numberOf(merged, "") != 0,
+            .lazyFree = decodeLazyFree(vmstat)};
 }
 
 struct CurrentGather {

@@ -10,6 +10,7 @@ namespace tally::platform {
 
 struct MachineState {
     bool swapInUse = false;
+    bool mergesPages = false;   // pages of the same content are one (KSM)
     std::uint64_t lazyFree = 0; // bytes that processes have given up and the kernel may take, about
 };
 

@@ -4,6 +4,7 @@
 #include "platform/linux/gather/LazyFree.h"
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/io/TextScan.h"
 #include "platform/linux/pieces/PieceBuilder.h"
 #include "platform/linux/pieces/SharedPieces.h"
 #include "platform/linux/processes/ProcessStat.h"
@@ -41,6 +42,16 @@ AddressSpace readAlone(MemberIdentity task) {
     return space;
 }
 
+/// Whether the kernel has merged pages of the process with others of the same content.
+bool hasMergedPages(const std::string& folder) {
+    const std::string text = readSystemFile(folder + "/ksm_merging_pages").value_or("");
+    std::string_view rest = text;
+    std::uint64_t pages = 0;
+    return takeNumber(rest, &pages) && pages != 0;
+}
+
+constexpr const char* mergedPagesNotice =
+    "Pages that the kernel has merged by their content (KSM) count for every process that has them";
 constexpr const char* pageCacheNotice =
     "The page cache could not be asked: shared memory and files are counted by the process's own page tables";
 constexpr const char* unreadRelativesNotice =
@@ -79,6 +90,9 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
     }
     walk->pieces_ = builder.takePieces();
     walk->words_ = builder.takeWords();
+    if (machineState().mergesPages && hasMergedPages(space.folder)) {
+        result.notices.emplace_back(mergedPagesNotice);
+    }
     if (builder.usedEstimates()) {
         result.notices.emplace_back(pageCacheNotice);
     }
