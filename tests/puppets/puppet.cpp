@@ -437,7 +437,7 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
             madvise(memory, pages * page, MADV_PAGEOUT);
         }
     }
-    int ready[2];
+    static int ready[2];
     if (pipe(ready) != 0) {
         fail("pipe");
     }
