@@ -101,6 +101,10 @@ kern_return_t mach_vm_region_recurse(mach_port_t task, std::uint64_t* address, s
 kern_return_t mach_vm_page_range_query(mach_port_t task, std::uint64_t address, std::uint64_t size,
                                        std::span<std::int32_t> dispositions, std::uint64_t* count);
 
+/// The first page in [address, end) of which the query above tells anything, that is, whose word is not 0.
+/// @return its address; `end` when there is none, `address` when that cannot be told.
+std::uint64_t mach_vm_next_page(mach_port_t task, std::uint64_t address, std::uint64_t end);
+
 /// Reads the purgeable state (VM_PURGABLE_...) of the mapping at `address` into `*state`.
 /// @return KERN_SUCCESS, or an error, and then the mapping counts as not purgeable.
 kern_return_t mach_vm_purgable_get_state(mach_port_t task, std::uint64_t address, int* state);

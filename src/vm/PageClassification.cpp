@@ -17,22 +17,33 @@ namespace {
 constexpr std::uint64_t PagesPerQuery = 4096;
 
 /// Asks for the state of `pageCount` pages from `start` on and calls handler(words, index of the first of
-/// them) for each chunk of them. @return false, with the error recorded, when the kernel refuses.
+/// them) for each chunk of them. Chunks of absent pages behind another such chunk are left out, but for the
+/// last: what is only reserved can be a billion times what is there.
+/// @return false, with the error recorded, when the kernel refuses.
 template <typename Handler>
 bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t pageCount,
                            Handler&& handler) {
     std::array<std::int32_t, PagesPerQuery> words;
-    for (std::uint64_t first = 0; first < pageCount; first += PagesPerQuery) {
+    for (std::uint64_t first = 0; first < pageCount;) {
         std::uint64_t count = std::min(pageCount - first, PagesPerQuery);
         const std::span<std::int32_t> chunk = std::span(words).first(count);
-        const kern_return_t status = mach_vm_page_range_query(task.task(), start + first * task.pageSize(),
-                                                              count * task.pageSize(), chunk, &count);
+        const std::uint64_t address = start + first * task.pageSize();
+        const kern_return_t status =
+            mach_vm_page_range_query(task.task(), address, count * task.pageSize(), chunk, &count);
         if (status != KERN_SUCCESS) {
             mach_error("mach_vm_page_range_query", status);
             task.recordRegionError(status);
             return false;
         }
         handler(std::span<const std::int32_t>(chunk.first(count)), first);
+        first += PagesPerQuery;
+        if (first < pageCount &&
+            std::ranges::all_of(chunk.first(count), [](auto word) { return word == 0; })) {
+            const std::uint64_t next = mach_vm_next_page(task.task(), start + first * task.pageSize(),
+                                                         start + pageCount * task.pageSize());
+            const std::uint64_t index = std::min((next - start) / task.pageSize(), pageCount - 1);
+            first = std::max(first, index / PagesPerQuery * PagesPerQuery);
+        }
     }
     return true;
 }
@@ -88,6 +99,9 @@ class PageRun {
         }
         (kind == Kind::absent ? start_ : length_) += pageSize_;
     }
+
+    /// Passes over pages that are absent, behind one that is.
+    void skip(std::uint64_t pages) { start_ += pages * pageSize_; }
 
     /// Hands the run to the region, unless it is one of absent pages.
     void finish() {
@@ -184,8 +198,11 @@ void addSubrangesForRegion(WalkedTask& task, TLMemoryRegion& region, int purgeSt
         purgeState == VM_PURGABLE_VOLATILE ? VM_PAGE_QUERY_PAGE_PRESENT : VM_PAGE_QUERY_PAGE_REUSABLE;
 
     PageRun run(region, pageSize);
+    std::uint64_t next = 0;
     const bool answered = queryPageDispositions(
-        task, firstPage, pageCount, [&](std::span<const std::int32_t> words, std::uint64_t /*first*/) {
+        task, firstPage, pageCount, [&](std::span<const std::int32_t> words, std::uint64_t first) {
+            run.skip(first - next);
+            next = first + words.size();
             for (const std::int32_t disposition : words) {
                 run.addPage(kindOfPage(disposition, reclaimableMask));
             }

@@ -68,6 +68,7 @@ namespace tally::platform {
     &mach_vm_region,
     &mach_vm_region_recurse,
     &mach_vm_page_range_query,
+    &mach_vm_next_page,
     &mach_vm_purgable_get_state,
     &QRYRegionTypeDescriptionForTag,
     &QRYTagForRegionTypeDescription,

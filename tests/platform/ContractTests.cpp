@@ -116,6 +116,9 @@ TEST_P(WalkContract, PageQueriesAgreeWithTheCounts) {
         EXPECT_EQ(pagesWith(VM_PAGE_QUERY_PAGE_PAGED_OUT), region.info.pages_swapped_out);
         EXPECT_EQ(pagesWith(VM_PAGE_QUERY_PAGE_DIRTY), region.info.pages_dirtied);
         EXPECT_EQ(pagesWith(VM_PAGE_QUERY_PAGE_REUSABLE), region.info.pages_reusable);
+        const auto first = std::find_if(words.begin(), words.end(), [](auto word) { return word != 0; });
+        EXPECT_EQ(mach_vm_next_page(port.name(), region.start, region.start + words.size() * pageSize),
+                  region.start + (first - words.begin()) * pageSize);
     }
 }
 

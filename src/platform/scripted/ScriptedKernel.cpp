@@ -20,7 +20,7 @@ std::atomic<ScriptedKernel*>& currentKernel() {
 }
 
 // A fault for a call that is in neither list would never happen, and its test would prove nothing.
-constexpr std::array<std::string_view, 34> callsThatCanFail{
+constexpr std::array<std::string_view, 35> callsThatCanFail{
     "QRYRegionTypeDescriptionForTag",
     "RKCreateKernelSymbolicator",
     "RKForeachSymbolOwner",
@@ -35,6 +35,7 @@ constexpr std::array<std::string_view, 34> callsThatCanFail{
     "mach_memory_info",
     "mach_port_deallocate",
     "mach_port_retain",
+    "mach_vm_next_page",
     "mach_vm_page_range_query",
     "mach_vm_purgable_get_state",
     "mach_vm_region",

@@ -95,6 +95,29 @@ kern_return_t mach_vm_page_range_query(mach_port_t task, std::uint64_t address, 
     return KERN_SUCCESS;
 }
 
+std::uint64_t mach_vm_next_page(mach_port_t task, std::uint64_t address, std::uint64_t end) {
+    const Answer answer("mach_vm_next_page", PortName{task}, {address, end});
+    const ScriptedTask* scripted = answer.taskOfPort(task);
+    if (answer.fault != 0 || scripted == nullptr) {
+        return address;
+    }
+    while (address < end) {
+        const ScriptedMapping* mapping =
+            scripted->findMapping(address, std::numeric_limits<std::uint32_t>::max()).mapping;
+        if (mapping == nullptr) {
+            break;
+        }
+        address = std::max(address, *mapping->start);
+        for (; address < std::min(end, mapping->end()); address += answer.kernel.pageSize) {
+            if (pageWord(*mapping, answer.isCharged(),
+                         (address - *mapping->start) / answer.kernel.pageSize) != 0) {
+                return address;
+            }
+        }
+    }
+    return end;
+}
+
 kern_return_t mach_vm_purgable_get_state(mach_port_t task, std::uint64_t address, int* state) {
     const Answer answer("mach_vm_purgable_get_state", PortName{task}, {address});
     const ScriptedTask* scripted = answer.taskOfPort(task);

@@ -36,7 +36,7 @@ struct Piece {
 
 /// Dispositions of consecutive pages; page numbers count from the start of the piece.
 struct PageWords {
-    std::uint32_t firstPage = 0;
+    std::uint64_t firstPage = 0;
     std::uint32_t pages = 0;
     std::int32_t word = 0; // VM_PAGE_QUERY_...
 };

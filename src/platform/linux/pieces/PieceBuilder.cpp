@@ -23,7 +23,7 @@ bool isSharedMemory(const BackingObject& object) {
 std::uint64_t filePage(const Mapping& mapping) { return mapping.fileOffset / basePage; }
 
 PageWords wordsOf(PageRange range, std::uint64_t base, std::int32_t word) {
-    return {static_cast<std::uint32_t>(range.first - base), static_cast<std::uint32_t>(range.pages()), word};
+    return {range.first - base, static_cast<std::uint32_t>(range.pages()), word};
 }
 
 /// The pages of `range` that no run covers.
@@ -55,11 +55,11 @@ std::vector<PageRange> firstPages(std::span<const PageRange> ranges, std::uint64
 
 /// Moves the words of an object's pages to where they stand once the task's own pages are taken out.
 void closeGaps(std::span<const PageRun> runs, std::vector<PageWords>& words) {
-    std::uint32_t ownBelow = 0;
+    std::uint64_t ownBelow = 0;
     std::size_t at = 0;
     for (PageWords& word : words) {
         for (; at < runs.size() && runs[at].firstPage < word.firstPage; ++at) {
-            ownBelow += runs[at].kind == PageKind::object ? 0 : static_cast<std::uint32_t>(runs[at].pages);
+            ownBelow += runs[at].kind == PageKind::object ? 0 : runs[at].pages;
         }
         word.firstPage -= ownBelow;
     }
@@ -67,7 +67,7 @@ void closeGaps(std::span<const PageRun> runs, std::vector<PageWords>& words) {
 
 /// Moves the words together, one behind the other.
 void pack(std::vector<PageWords>& words) {
-    std::uint32_t next = 0;
+    std::uint64_t next = 0;
     for (PageWords& word : words) {
         word.firstPage = next;
         next += word.pages;

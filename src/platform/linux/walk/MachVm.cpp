@@ -101,6 +101,13 @@ kern_return_t mach_vm_page_range_query(mach_port_t task, std::uint64_t address, 
     return KERN_SUCCESS;
 }
 
+std::uint64_t mach_vm_next_page(mach_port_t task, std::uint64_t address, std::uint64_t end) {
+    const std::shared_ptr<Task> found = taskOfPort(task);
+    kern_return_t status = KERN_SUCCESS;
+    const Walk* walk = found ? found->walk(&status) : nullptr;
+    return walk == nullptr ? address : walk->nextPage(address, end);
+}
+
 kern_return_t mach_vm_purgable_get_state(mach_port_t /*task*/, std::uint64_t /*address*/, int* state) {
     *state = VM_PURGABLE_DENY; // nothing is purgeable here
     return KERN_SUCCESS;

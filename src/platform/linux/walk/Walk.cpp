@@ -146,26 +146,47 @@ void Walk::pageWords(std::uint64_t address, std::span<std::int32_t> words) const
     }
 }
 
-void Walk::pageWordsOf(const Piece& piece, std::uint64_t firstPage, std::span<std::int32_t> words) const {
+std::uint64_t Walk::nextPage(std::uint64_t address, std::uint64_t end) const {
+    std::array<PageWords, 4> byCounts;
+    for (const Piece* piece = pieceAt(address); piece != nullptr && piece != pieces_.data() + pieces_.size();
+         ++piece) {
+        for (const PageWords& run : wordsOf(*piece, byCounts)) {
+            const std::uint64_t runEnd = piece->start + (run.firstPage + run.pages) * basePage;
+            if (run.pages != 0 && runEnd > address) {
+                return std::min(end, std::max(address, piece->start + run.firstPage * basePage));
+            }
+        }
+        if (piece->end() >= end) {
+            break;
+        }
+    }
+    return end;
+}
+
+std::span<const PageWords> Walk::wordsOf(const Piece& piece, std::array<PageWords, 4>& byCounts) const {
     const std::int32_t external = piece.externalPager ? VM_PAGE_QUERY_PAGE_EXTERNAL : 0;
     const std::uint32_t clean = piece.resident - piece.dirty - piece.reusable;
-    const std::array<PageWords, 4> byCounts{{
+    byCounts = {{
         {0, piece.dirty, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY | external},
         {piece.dirty, clean, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL},
         {piece.dirty + clean, piece.reusable, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_REUSABLE},
         {piece.resident, piece.swapped, VM_PAGE_QUERY_PAGE_PAGED_OUT},
     }};
-    const std::span<const PageWords> known =
-        piece.wordsCount == 0 ? std::span<const PageWords>(byCounts)
-                              : std::span(words_).subspan(piece.firstWords, piece.wordsCount);
+    return piece.wordsCount == 0 ? std::span<const PageWords>(byCounts)
+                                 : std::span(words_).subspan(piece.firstWords, piece.wordsCount);
+}
+
+void Walk::pageWordsOf(const Piece& piece, std::uint64_t firstPage, std::span<std::int32_t> words) const {
+    std::array<PageWords, 4> byCounts;
+    const std::span<const PageWords> known = wordsOf(piece, byCounts);
     auto at =
         std::upper_bound(known.begin(), known.end(), firstPage, [](std::uint64_t page, const PageWords& run) {
-            return page < std::uint64_t{run.firstPage} + run.pages;
+            return page < run.firstPage + run.pages;
         });
     const std::uint64_t endPage = firstPage + words.size();
     for (; at != known.end() && at->firstPage < endPage; ++at) {
-        const std::uint64_t from = std::max<std::uint64_t>(at->firstPage, firstPage);
-        const std::uint64_t to = std::min(std::uint64_t{at->firstPage} + at->pages, endPage);
+        const std::uint64_t from = std::max(at->firstPage, firstPage);
+        const std::uint64_t to = std::min(at->firstPage + at->pages, endPage);
         std::fill(words.begin() + static_cast<std::ptrdiff_t>(from - firstPage),
                   words.begin() + static_cast<std::ptrdiff_t>(std::max(to, from) - firstPage), at->word);
     }

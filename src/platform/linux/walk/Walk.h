@@ -11,6 +11,7 @@
 #include "platform/linux/pieces/Piece.h"
 #include "platform/linux/walk/Mapping.h"
 
+#include <array>
 #include <cstdint>
 #include <memory>
 #include <span>
@@ -50,7 +51,13 @@ class Walk {
     /// Fills one disposition word per page from `address` on.
     void pageWords(std::uint64_t address, std::span<std::int32_t> words) const;
 
+    /// The first page in [address, end) whose word is not 0; `end` when there is none.
+    std::uint64_t nextPage(std::uint64_t address, std::uint64_t end) const;
+
   private:
+    /// The dispositions of a piece's pages in rising order, absent ones left out; `byCounts` is room for
+    /// them.
+    std::span<const PageWords> wordsOf(const Piece& piece, std::array<PageWords, 4>& byCounts) const;
     void pageWordsOf(const Piece& piece, std::uint64_t firstPage, std::span<std::int32_t> words) const;
 
     std::string folder_;
