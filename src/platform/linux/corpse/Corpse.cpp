@@ -81,7 +81,7 @@ bool hasLiveRelatives(std::int32_t pid, const FamilyKey& key) {
     pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
     return key.isKnown() && std::ranges::any_of(pids, [&](std::int32_t other) {
                return other != pid &&
-                      familyKeyOf(other, readSystemFile(processFolder(other) + "/stat").value_or("")) == key;
+                      familyKeyOf(other, readSystemRecord(processFolder(other) + "/stat").value_or("")) == key;
            });
 }
 
@@ -108,7 +108,7 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
     if (stopped.status() != KERN_SUCCESS) {
         return stopped.status();
     }
-    const std::optional<std::string> text = readSystemFile(processFolder(task.pid) + "/stat");
+    const std::optional<std::string> text = readSystemRecord(processFolder(task.pid) + "/stat");
     const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
     if (!stat || stat->startTicks != task.startTicks || familyKeyOf(task.pid, *text) != space.key) {
         return KERN_TERMINATED; // or it has loaded another program since
@@ -175,7 +175,7 @@ bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpse
 
 kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
     const FamilyKey key =
-        familyKeyOf(task.pid, readSystemFile(processFolder(task.pid) + "/stat").value_or(""));
+        familyKeyOf(task.pid, readSystemRecord(processFolder(task.pid) + "/stat").value_or(""));
     if (auto space = corpseSpaceOfTwin(key, task)) {
         const Charges charges = readCharges(task.pid, true).value_or(Charges());
         *corpse =

@@ -50,13 +50,13 @@ std::vector<std::int32_t> listThreads(std::int32_t pid) {
 
 /// Whether the thread has ended, though it is still listed: a first thread is until the others have.
 bool hasEnded(std::int32_t pid, std::int32_t thread) {
-    const auto stat = decodeStat(readSystemFile(threadFolder(pid, thread) + "/stat").value_or(""));
+    const auto stat = decodeStat(readSystemRecord(threadFolder(pid, thread) + "/stat").value_or(""));
     return !stat || stat->state == 'Z' || stat->state == 'X';
 }
 
 /// The process that traces the thread; 0 when none does.
 std::int32_t tracerOf(std::int32_t pid, std::int32_t thread) {
-    const std::string status = readSystemFile(threadFolder(pid, thread) + "/status").value_or("");
+    const std::string status = readSystemRecord(threadFolder(pid, thread) + "/status").value_or("");
     constexpr std::string_view key = "\nTracerPid:";
     const std::size_t at = status.find(key);
     std::string_view rest =

@@ -42,7 +42,7 @@ FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat) {
     const std::optional<ProcessStat> decoded = decodeStat(stat);
     if (!key.isKnown() && decoded && decoded->threads > 1) {
         for (const std::string& thread : threadFolders(pid)) {
-            key = decodeFamilyKey(readSystemFile(thread + "/stat").value_or(""));
+            key = decodeFamilyKey(readSystemRecord(thread + "/stat").value_or(""));
             if (key.isKnown()) {
                 break;
             }
@@ -53,7 +53,7 @@ FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat) {
 
 std::array<std::uint64_t, 2> readExecRandom(std::int32_t pid) {
     std::array<std::uint64_t, 2> bytes{};
-    const std::string auxiliary = readSystemFile(processFolder(pid) + "/auxv").value_or("");
+    const std::string auxiliary = readSystemRecord(processFolder(pid) + "/auxv").value_or("");
     for (std::size_t at = 0; at + sizeof(Elf64_auxv_t) <= auxiliary.size(); at += sizeof(Elf64_auxv_t)) {
         Elf64_auxv_t entry;
         std::memcpy(&entry, auxiliary.data() + at, sizeof(entry));
@@ -75,7 +75,7 @@ bool isLayoutFixed(std::int32_t pid) {
     if (fixedForAll) {
         return true;
     }
-    const std::string text = readSystemFile(processFolder(pid) + "/personality").value_or("0");
+    const std::string text = readSystemRecord(processFolder(pid) + "/personality").value_or("0");
     std::string_view rest = text;
     std::uint32_t flags = 0;
     takeNumber(rest, &flags, 16);

@@ -44,7 +44,7 @@ Search& search() {
 }
 
 std::uint64_t lazilyFreed(const std::string& folder) {
-    return decodeRollupLazyFree(readSystemFile(folder + "/smaps_rollup").value_or(""));
+    return decodeRollupLazyFree(readSystemRecord(folder + "/smaps_rollup").value_or(""));
 }
 
 void prepare(Search& search) {

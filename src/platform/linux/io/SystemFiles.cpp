@@ -86,6 +86,24 @@ std::optional<std::string> readSystemFile(const std::string& path) {
     return text;
 }
 
+std::optional<std::string> readSystemRecord(const std::string& path) {
+    const Descriptor file = openForReading(path);
+    std::array<char, 16384> buffer;
+    ssize_t count = -1;
+    do {
+        count = file.isOpen() ? read(file.number(), buffer.data(), buffer.size()) : -1;
+    } while (count < 0 && errno == EINTR);
+    if (count < 0) {
+        return std::nullopt;
+    }
+    std::string text(buffer.data(), static_cast<std::size_t>(count));
+    std::string rest;
+    if (text.size() == buffer.size() && readToEnd(file, rest)) {
+        text += rest;
+    }
+    return text;
+}
+
 void allowDescriptors(std::size_t count) {
     constexpr rlim_t usual = 128;
     rlimit limit{};

@@ -45,6 +45,10 @@ bool readExactly(const Descriptor& file, std::uint64_t offset, std::span<std::by
 /// The whole file at `path`; absent on failure, with errno.
 std::optional<std::string> readSystemFile(const std::string& path);
 
+/// The same for a file that the kernel makes as one record, as it does those that tell of a whole process:
+/// what the first read gives is all, unless it fills the buffer.
+std::optional<std::string> readSystemRecord(const std::string& path);
+
 /// Makes room for `count` more descriptors than are usual; but for root, as far as the hard limit goes.
 void allowDescriptors(std::size_t count);
 

@@ -69,7 +69,7 @@ std::optional<OwnedRecord> recordOf(const std::string& folder, const char* numbe
                         : link == "anon_inode:bpf-map"                             ? decodeBpfMap
                                                                                    : nullptr;
     return decode == nullptr ? std::nullopt
-                             : decode(readSystemFile(folder + "/fdinfo/" + number).value_or(""));
+                             : decode(readSystemRecord(folder + "/fdinfo/" + number).value_or(""));
 }
 
 } // namespace
@@ -82,6 +82,9 @@ bool forEachHeldObject(const std::string& folder, const std::function<void(const
     std::array<char, PATH_MAX> link; // the kernel shows no longer one
     while (const dirent* entry = readdir(descriptors.get())) {
         const char* const number = entry->d_name;
+        if (number[0] == '.') {
+            continue; // the folder itself and the one above
+        }
         const ssize_t length = readlinkat(dirfd(descriptors.get()), number, link.data(), link.size());
         if (length <= 0) {
             continue; // closed meanwhile, or no descriptor

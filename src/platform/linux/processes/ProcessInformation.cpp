@@ -56,7 +56,7 @@ std::optional<ProcessStat> readUserProcess(std::int32_t pid) {
 
 /// The last component of argv[0] up to its first blank or colon: what a server that retitles itself goes by.
 std::string nameFromArguments(std::int32_t pid, const std::string& fallback) {
-    const std::string arguments = readSystemFile(processFolder(pid) + "/cmdline").value_or("");
+    const std::string arguments = readSystemRecord(processFolder(pid) + "/cmdline").value_or("");
     std::string_view first = std::string_view(arguments).substr(0, arguments.find('\0'));
     first = first.substr(0, first.find_first_of(" :"));
     first.remove_prefix(first.rfind('/') + 1);
@@ -153,7 +153,7 @@ int sysctl_argmax(std::uint64_t* size) {
 
 std::ptrdiff_t sysctl_procargs2(std::int32_t pid, std::span<char> area) {
     std::optional<std::string> path = readSystemLink(processFolder(pid) + "/exe");
-    const std::optional<std::string> arguments = readSystemFile(processFolder(pid) + "/cmdline");
+    const std::optional<std::string> arguments = readSystemRecord(processFolder(pid) + "/cmdline");
     if (!path || !arguments) {
         errno = errno == ENOENT ? ESRCH : errno;
         return -1;

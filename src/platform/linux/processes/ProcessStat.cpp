@@ -53,7 +53,7 @@ namespace {
 
 /// Reads a file of the folder of process `pid`; a folder that is not there is a process that does not exist.
 std::optional<std::string> readProcessFile(std::int32_t pid, const char* name) {
-    std::optional<std::string> text = readSystemFile(processFolder(pid) + name);
+    std::optional<std::string> text = readSystemRecord(processFolder(pid) + name);
     if (!text && errno == ENOENT) {
         errno = ESRCH;
     }
@@ -110,7 +110,7 @@ std::optional<ProcessStatus> readProcessStatus(std::int32_t pid) {
         return status;
     }
     for (const std::string& thread : threadFolders(pid)) {
-        const ProcessStatus other = decodeStatus(readSystemFile(thread + "/status").value_or(""));
+        const ProcessStatus other = decodeStatus(readSystemRecord(thread + "/status").value_or(""));
         if (other.hasAddressSpace) {
             return other;
         }

@@ -47,7 +47,7 @@ std::vector<std::uint64_t> stackPointers(const std::string& folder) {
         }
         if (thread->d_name[0] != '.') {
             ++asked;
-            const auto text = readSystemFile(parent + "/" + thread->d_name + "/syscall");
+            const auto text = readSystemRecord(parent + "/" + thread->d_name + "/syscall");
             if (const auto pointer = decodeStackPointer(text.value_or(""))) {
                 pointers.push_back(*pointer);
             }
@@ -85,7 +85,7 @@ void tagThreadStacks(const std::string& folder, std::span<const Mapping> mapping
     if (found.empty()) {
         return;
     }
-    const std::optional<ProcessStat> stat = decodeStat(readSystemFile(folder + "/stat").value_or(""));
+    const std::optional<ProcessStat> stat = decodeStat(readSystemRecord(folder + "/stat").value_or(""));
     const std::size_t others = stat && stat->threads > 1 ? static_cast<std::size_t>(stat->threads) - 1 : 0;
     if (others == 0) {
         return; // a forked child keeps the stacks of threads that it does not have

@@ -145,7 +145,7 @@ std::shared_ptr<Task> taskOfProcess(std::int32_t pid) { return portTable().findP
 
 kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     *task = MACH_PORT_NULL;
-    const std::optional<std::string> text = readSystemFile(processFolder(pid) + "/stat");
+    const std::optional<std::string> text = readSystemRecord(processFolder(pid) + "/stat");
     const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
     if (!stat || stat->isKernelThread()) {
         return KERN_FAILURE;

@@ -21,7 +21,7 @@ namespace {
 
 /// Finds out which figures that only smaps tells the process can have at all.
 WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView, const std::string& folder) {
-    const ProcessStatus status = decodeStatus(readSystemFile(folder + "/status").value_or(""));
+    const ProcessStatus status = decodeStatus(readSystemRecord(folder + "/status").value_or(""));
     const MachineState machine = machineState();
     WalkFacts facts{.owner = owner, .objectView = objectView, .swapInUse = machine.swapInUse};
     facts.asksLocked = status.locked != 0;
@@ -44,7 +44,7 @@ AddressSpace readAlone(MemberIdentity task) {
 
 /// Whether the kernel has merged pages of the process with others of the same content.
 bool hasMergedPages(const std::string& folder) {
-    const std::string text = readSystemFile(folder + "/ksm_merging_pages").value_or("");
+    const std::string text = readSystemRecord(folder + "/ksm_merging_pages").value_or("");
     std::string_view rest = text;
     std::uint64_t pages = 0;
     return takeNumber(rest, &pages) && pages != 0;
