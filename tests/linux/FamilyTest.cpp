@@ -61,7 +61,7 @@ struct RandomFamily {
                 }
             }
             const std::size_t slot = at / 64;
-            sets.addPage(slot, all, keys);
+            sets.addPages(slot, all, keys, 1);
             for (const auto& [key, who] : holders) {
                 if (who.size() > 1) {
                     auto& [resident, swapped] = expected[{slot, who}];

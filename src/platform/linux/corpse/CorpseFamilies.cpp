@@ -79,7 +79,7 @@ class SharingCount {
         for (std::size_t i = 0; i < members_.size(); ++i) {
             keys_[i] = isProven(i) ? pages_[i].key : 0;
         }
-        sets.addPage(slot, indices_, keys_);
+        sets.addPages(slot, indices_, keys_, 1);
     }
 
     /// Whether the member's frame was still the same one when a relative was seen to have it: not when no

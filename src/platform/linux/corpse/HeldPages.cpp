@@ -81,11 +81,11 @@ HeldPages readHeldPages(MemberIdentity identity, std::span<const Mapping> mappin
     SmapsOfProcess smaps(files.folder);
     PageSource source(files, mappings, smaps, PageDetail::positions);
     std::vector<std::uint64_t> entries;
-    const PageRunSink sink = [&](std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind) {
-        if (kind != PageKind::object && !mappings[index].shared && !mappings[index].isKernelSpecial()) {
-            entries.resize((end - start) / basePage);
-            entries.resize(readPagemapEntries(files.pagemap, start, entries));
-            held.append(start, entries);
+    const PageRunSink sink = [&](const FoundRun& run) {
+        if (run.kind != PageKind::object && mappings[run.mapping].isPrivate()) {
+            entries.resize((run.end - run.start) / basePage);
+            entries.resize(readPagemapEntries(files.pagemap, run.start, entries));
+            held.append(run.start, entries);
         }
     };
     std::size_t reached = 0;

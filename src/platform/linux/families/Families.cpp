@@ -3,8 +3,8 @@
 #include "platform/linux/objects/ObjectId.h"
 
 #include <algorithm>
-#include <condition_variable>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <utility>
 #include <vector>
@@ -21,20 +21,17 @@ struct Tenants {
 /// The address spaces of processes with one key, in the order in which the kernel compares them.
 using Relatives = std::vector<Tenants>;
 
-enum class Progress : std::uint8_t { waiting, running, done };
-
 /// One family in one gather.
 struct Family {
     std::uint64_t key = 0;
     std::vector<MemberIdentity> members; // one per address space, rising by pid
     std::vector<std::size_t> readers;    // tasks of each that have not taken it yet
-    Progress progress = Progress::waiting;
-    std::vector<AddressSpace> spaces;
+    std::unique_ptr<FamilyScan> scan;    // once a member is walked
+    std::vector<AddressSpace> spaces;    // once the scan is done
 };
 
 struct FamilyTable {
     std::mutex mutex;
-    std::condition_variable changed;
     std::map<FamilyKey, Relatives> relatives;
     bool isGathering = false;
     bool isPrepared = false;
@@ -78,15 +75,6 @@ void prepare(FamilyTable& table) {
             table.familyOfPid[member.pid] = &family;
         }
     }
-}
-
-Family* waitingFamily(FamilyTable& table) {
-    for (auto& [key, family] : table.families) {
-        if (family.progress == Progress::waiting) {
-            return &family;
-        }
-    }
-    return nullptr;
 }
 
 } // namespace
@@ -170,19 +158,14 @@ std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity
         return std::nullopt;
     }
     Family& own = *found->second;
-    while (own.progress != Progress::done) {
-        Family* next = own.progress == Progress::waiting ? &own : waitingFamily(table);
-        if (next == nullptr) {
-            table.changed.wait(lock);
-            continue;
-        }
-        next->progress = Progress::running;
-        lock.unlock();
-        std::vector<AddressSpace> spaces = scanFamily(next->key, next->members);
-        lock.lock();
-        next->spaces = std::move(spaces);
-        next->progress = Progress::done;
-        table.changed.notify_all();
+    if (!own.scan) {
+        own.scan = std::make_unique<FamilyScan>(own.key, own.members);
+    }
+    lock.unlock();
+    own.scan->join();
+    lock.lock();
+    if (own.spaces.empty()) {
+        own.spaces = own.scan->takeSpaces();
     }
     const auto member = std::lower_bound(own.members.begin(), own.members.end(), owner, isBefore);
     const auto index = static_cast<std::size_t>(member - own.members.begin());

@@ -1,9 +1,8 @@
 // Families: which of the processes that are measured descend from one exec by forking.
 //
 // Families are found among the tasks to which rights exist when the first of them is walked in a gather. The
-// sharing of a family is computed once per gather, by whichever worker needs it first; the others meanwhile
-// compute another family or wait. Processes that share one whole address space count as one: the lowest pid
-// stands for them. Thread-safe.
+// sharing of a family is computed once per gather, by all workers that need it meanwhile. Processes that
+// share one whole address space count as one: the lowest pid stands for them. Thread-safe.
 
 #pragma once
 

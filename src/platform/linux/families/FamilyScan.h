@@ -1,36 +1,73 @@
 // FamilyScan: reads a family of forked processes side by side and finds which pages they share.
 //
 // The idea: relatives that still share a page have the same frame at the same address (and, once it is
-// swapped out, the same place in swap). Windows of a few MiB are read of all members before the next, so
-// memory does not grow with the family, and the kernel finds the descriptions of shared pages in its caches.
-// Cost: a page table entry per page and member. Frames are compared wherever two members have pages of their
-// own, also where the kernel says "mapped once": of a huge page that bit tells the first part only.
+// swapped out, the same place in swap). All members are read through one window of addresses before the next,
+// so memory does not grow with the family, and the kernel finds the descriptions of shared pages in its
+// caches. Windows without a page of any member are passed over. Cost: a page table entry per page and member,
+// one per huge page. Frames are compared wherever two members have pages of their own, also where the kernel
+// says "mapped once": of a huge page that bit tells the first part only.
 
 #pragma once
 
-#include "platform/kern_return.h"
-#include "platform/linux/families/SharedParts.h"
-#include "platform/linux/walk/Mapping.h"
-#include "platform/linux/walk/PageStates.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
+#include "platform/linux/families/FamilyMember.h"
+#include "platform/linux/families/SharingSets.h"
 
+#include <condition_variable>
+#include <cstddef>
 #include <cstdint>
-#include <string>
+#include <exception>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <span>
 #include <vector>
 
 namespace tally::platform {
 
-/// The address space of one process as a walk needs it.
-struct AddressSpace {
-    kern_return_t status = KERN_SUCCESS; // KERN_INVALID_ARGUMENT: ended; `states` holds what was read in full
-    std::string folder;
-    std::vector<Mapping> mappings;
-    PageStates states;
-    std::vector<SharedPart> parts; // what is shared with relatives, sorted by mapping
-    bool isEstimated = false;      // sharing was told by addresses only, without frame numbers
-};
+/// Any number of threads may take part.
+class FamilyScan {
+  public:
+    /// @param members rising by pid; no two share an address space.
+    FamilyScan(std::uint64_t familyKey, std::span<const MemberIdentity> members);
 
-/// Reads the address spaces of `members`, which are rising by pid and share no address space among them.
-std::vector<AddressSpace> scanFamily(std::uint64_t familyKey, std::span<const MemberIdentity> members);
+    /// Takes part in the scan until it is done. What one thread throws, all throw.
+    void join();
+    /// The address spaces of all members, once it is done.
+    std::vector<AddressSpace> takeSpaces();
+
+  private:
+    enum class Phase : std::uint8_t { opening, reading, done };
+
+    /// Some windows, and what was found in them.
+    struct Stretch {
+        AddressRange range;
+        std::vector<std::size_t> members; // that have pages there
+        std::vector<MemberStretch> read;
+        std::optional<SharingSets> sets;
+        bool framesTold = true;
+    };
+
+    void work(std::unique_lock<std::mutex>& lock);
+    void open(std::unique_lock<std::mutex>& lock);
+    Stretch* nextStretch();
+    void read(Stretch& stretch) const;
+    void compare(std::uint64_t start, std::span<WindowRow* const> rows, SharingSets& sets) const;
+    void finish();
+
+    std::uint64_t familyKey_;
+    std::vector<MemberIdentity> identities_;
+    std::vector<AddressSlot> slots_;
+
+    std::mutex mutex_; // guards what follows
+    std::condition_variable changed_;
+    Phase phase_ = Phase::opening;
+    std::exception_ptr failure_;
+    std::size_t begun_ = 0;   // members that are opened, or being opened
+    std::size_t working_ = 0; // threads
+    std::vector<std::unique_ptr<FamilyMember>> members_;
+    std::vector<std::uint64_t> nextPages_; // of each member, above all stretches so far
+    std::vector<std::unique_ptr<Stretch>> stretches_;
+    std::vector<AddressSpace> spaces_;
+};
 
 } // namespace tally::platform

@@ -32,9 +32,12 @@ class SharingSets {
   public:
     explicit SharingSets(std::size_t members);
 
-    /// Enters one page: `keys` holds its key in each of `members` (two or more, rising). Slots come in rising
-    /// order.
-    void addPage(std::size_t slot, std::span<const std::uint32_t> members, std::span<const PageKey> keys);
+    /// Enters one page, or `pages` neighbours that are alike: `keys` holds its key in each of `members` (two
+    /// or more, rising). Slots come in rising order.
+    void addPages(std::size_t slot, std::span<const std::uint32_t> members, std::span<const PageKey> keys,
+                  std::uint64_t pages);
+    /// Adds what `other` of the same family has counted, in the same slot or above.
+    void absorb(SharingSets& other);
     /// What was counted, in rising order of slots. No page may be entered afterwards.
     std::vector<SetPages> takeCounts();
 
@@ -51,7 +54,9 @@ class SharingSets {
 
     std::size_t setOf(std::uint64_t signature, PageKey key, std::span<const std::uint32_t> members,
                       std::span<const PageKey> keys);
-    void count(std::size_t slot, std::size_t set, PageKey key);
+    std::size_t numberOf(std::uint64_t signature);
+    void count(std::size_t set, std::uint64_t resident, std::uint64_t swapped);
+    void begin(std::size_t slot);
     void flush();
 
     std::vector<std::uint64_t> memberSignatures_;
@@ -60,6 +65,7 @@ class SharingSets {
     std::uint64_t page_ = 0;
     std::unordered_map<std::uint64_t, std::size_t> setBySignature_;
     std::vector<std::vector<std::uint32_t>> sets_;
+    std::vector<std::uint64_t> signatures_; // of each set
     std::uint64_t lastSignature_ = 0;
     std::size_t lastSet_ = 0;
     std::size_t slot_ = 0;             // that is being counted

@@ -40,6 +40,8 @@ struct Mapping {
     }
     /// Whether it can hold pages of the task's own, which relatives may share after a fork.
     bool isPrivate() const { return !shared && !isKernelSpecial(); }
+    /// Memory that the kernel keeps on its own tmpfs, 00:01: memfds, SysV segments, shared anonymous memory.
+    bool isSharedMemory() const { return shared && deviceMajor == 0 && deviceMinor == 1; }
     bool isPrivateAnonymous() const { return !isFileBacked() && isPrivate(); }
 };
 

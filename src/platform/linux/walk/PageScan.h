@@ -2,6 +2,7 @@
 
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <span>
 
@@ -10,28 +11,37 @@ namespace tally::platform {
 /// As the kernel lays it out (struct page_region of include/uapi/linux/fs.h); the installed headers are
 /// older.
 struct PageRegion {
-    std::uint64_t start = 0; // addresses
-    std::uint64_t end = 0;
-    std::uint64_t categories = 0;
+    std::uint64_t start; // addresses
+    std::uint64_t end;
+    std::uint64_t categories;
 };
 
 inline constexpr std::uint64_t PageIsFile = 4;
 inline constexpr std::uint64_t PageIsPresent = 8;
 inline constexpr std::uint64_t PageIsSwapped = 16;
 inline constexpr std::uint64_t PageIsZero = 32; // the kernel's zero page: no memory of its own
+inline constexpr std::uint64_t PageIsHuge = 64; // mapped as one page of 2 MiB
 inline constexpr std::uint64_t PageIsGuard = 256;
 
 /// Which runs one call gave, and how far it came.
 struct PageScanStep {
-    std::span<const PageRegion> regions; // valid until the next call
+    std::span<const PageRegion> regions; // in the room that the caller gave
     std::uint64_t resume = 0;            // address at which to go on
 };
 
-/// Scans [start, end) for present and swapped pages, at most 64 MiB of them or 1 GiB of addresses a call: the
-/// target's own calls that change its address space wait for a scan, and are let in between two long ones.
+/// Room for the runs of one call.
+using PageScanRoom = std::array<PageRegion, 512>;
+
+/// Scans [start, end) for present and swapped pages, at most 64 MiB of them a call: the target's own calls
+/// that change its address space wait for a scan, and are let in between two long ones. What is absent costs
+/// next to nothing, but for page tables that were emptied.
 /// @param withFile whether to tell file pages from others, which costs the kernel twice the time.
 /// @return 0, or the error: ESRCH when the task has ended, ENOTTY when this kernel has no such query.
 int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile, std::span<PageRegion> room,
               PageScanStep* step);
+
+/// Finds the first present or swapped page in [start, end). @param found out: its address; `end` for none.
+/// @return as above.
+int findPage(int pagemap, std::uint64_t start, std::uint64_t end, std::uint64_t* found);
 
 } // namespace tally::platform

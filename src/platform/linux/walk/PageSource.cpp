@@ -14,7 +14,8 @@ namespace tally::platform {
 namespace {
 
 // The kernel takes twice the time when it is asked to tell file pages from others. Private anonymous memory
-// has none, so neighbouring anonymous mappings of this many bytes in all are scanned without.
+// has none and shared memory nothing else, so neighbouring mappings of these with as many bytes in all are
+// scanned without.
 constexpr std::uint64_t worthOwnScan = 1 << 20;
 
 std::atomic<bool> scansAnswered = true; // false once this kernel has refused one
@@ -33,20 +34,21 @@ struct Segment {
 
 Segment segmentAt(std::span<const Mapping> mappings, std::size_t first, std::size_t end,
                   AddressRange window) {
-    const auto anonymousEnd = [&](std::size_t at, std::uint64_t* bytes) {
-        for (*bytes = 0; at < end && mappings[at].isPrivateAnonymous(); ++at) {
+    const auto uniformEnd = [&](std::size_t at, std::uint64_t* bytes) {
+        for (*bytes = 0; at < end && (mappings[at].isPrivateAnonymous() || mappings[at].isSharedMemory());
+             ++at) {
             *bytes += sizeInside(mappings[at], window);
         }
         return at;
     };
     std::uint64_t bytes = 0;
-    std::size_t at = anonymousEnd(first, &bytes);
+    std::size_t at = uniformEnd(first, &bytes);
     if (bytes >= worthOwnScan) {
         return {at, false};
     }
     // Up to the next anonymous mappings that are worth a scan of their own.
     while (at < end) {
-        const std::size_t next = anonymousEnd(at + 1, &bytes);
+        const std::size_t next = uniformEnd(at + 1, &bytes);
         if (bytes >= worthOwnScan) {
             return {at + 1, true};
         }
@@ -64,10 +66,35 @@ std::optional<PageKind> kindOfRegion(const PageRegion& region) {
                                                       : PageKind::swapped;
 }
 
+// What a call walks without finding a page is bounded as well, because page tables that were emptied are
+// walked too: by the mapped addresses, and ever less strictly while nothing comes, for what is only reserved
+// has no tables.
+constexpr std::uint64_t usualStep = 1 << 30;
+constexpr std::uint64_t growthOfEmptySteps = 64;
+
+/// How many pages of a mapping page tables can show: what is swapped out of shared memory they do not.
+std::uint64_t pagesOf(const Mapping& mapping, const SmapsEntry& entry) {
+    return (entry.resident + entry.hugetlb + (mapping.shared ? 0 : entry.swapped)) / basePage;
+}
+
+/// Where, from `address` on, `bytes` of the addresses of `mappings` are passed.
+std::uint64_t endOfStep(std::span<const Mapping> mappings, std::uint64_t address, std::uint64_t bytes) {
+    for (const Mapping& mapping : mappings) {
+        const std::uint64_t from = std::max(address, mapping.start);
+        if (mapping.end > from && mapping.end - from > bytes) {
+            return from + bytes;
+        }
+        bytes -= mapping.end > from ? mapping.end - from : 0;
+    }
+    return ~std::uint64_t{0};
+}
+
 } // namespace
 
+bool scansAreAnswered() { return scansAnswered; }
+
 int PageSource::read(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
-                     std::size_t* reached) {
+                     std::size_t* reached) const {
     *reached = first;
     while (scansAnswered && *reached < end) {
         const Segment segment = segmentAt(mappings_, *reached, end, window);
@@ -78,32 +105,59 @@ int PageSource::read(std::size_t first, std::size_t end, AddressRange window, co
             return error;
         }
     }
-    return *reached < end ? readOlder(*reached, end, window, sink, reached) : 0;
+    if (*reached < end) {
+        return readOlder(*reached, end, window, sink, reached);
+    }
+    if (!isAlive()) { // of an address space that went away meanwhile a scan shows a part or nothing
+        *reached = first;
+        return ESRCH;
+    }
+    return 0;
+}
+
+std::uint64_t PageSource::nextPage(const Mapping& mapping, std::uint64_t address) const {
+    for (std::uint64_t most = usualStep; address < mapping.end; most *= growthOfEmptySteps) {
+        const std::uint64_t end = std::min(mapping.end, address + most);
+        std::uint64_t found = address;
+        if (findPage(files_.pagemap.number(), address, end, &found) != 0 || found < end) {
+            return found; // whatever is wrong shows when it is read
+        }
+        address = end;
+    }
+    return mapping.end;
 }
 
 int PageSource::scan(std::size_t first, std::size_t end, AddressRange window, bool withFile,
-                     const PageRunSink& sink, std::size_t* reached) {
+                     const PageRunSink& sink, std::size_t* reached) const {
+    PageScanRoom room;
     std::size_t mapping = first;
+    std::uint64_t mostMapped = usualStep;
+    std::uint64_t stepEnd = 0;
     const std::uint64_t last = std::min(window.end, mappings_[end - 1].end);
     for (std::uint64_t address = std::max(window.start, mappings_[first].start); address < last;) {
-        PageScanStep step;
         *reached = mapping;
-        if (const int error = scanPages(files_.pagemap.number(), address, last, withFile, room_, &step);
+        if (address >= stepEnd) {
+            stepEnd =
+                std::min(last, endOfStep(mappings_.subspan(mapping, end - mapping), address, mostMapped));
+        }
+        PageScanStep step;
+        if (const int error = scanPages(files_.pagemap.number(), address, stepEnd, withFile, room, &step);
             error != 0) {
             return error;
         }
-        if (!isAlive()) {
-            return ESRCH; // of an address space that went away meanwhile a scan shows a part or nothing
-        }
+        mostMapped = step.regions.empty() ? mostMapped * growthOfEmptySteps : usualStep;
         for (const PageRegion& region : step.regions) {
             // A region can reach over several mappings and what lies between them.
             while (mapping < end && mappings_[mapping].end <= region.start) {
                 ++mapping;
             }
             const std::optional<PageKind> kind = memoryOf(kindOfRegion(region));
+            const bool isOwn = kind == PageKind::anonymous;
             for (std::size_t at = mapping; kind && at < end && mappings_[at].start < region.end; ++at) {
-                sink(at, std::max(region.start, mappings_[at].start), std::min(region.end, mappings_[at].end),
-                     *kind);
+                sink({at, std::max(region.start, mappings_[at].start),
+                      std::min(region.end, mappings_[at].end),
+                      isOwn && mappings_[at].isSharedMemory() ? PageKind::object : *kind,
+                      (region.categories & PageIsHuge) != 0});
             }
         }
         address = step.resume;
@@ -129,7 +183,7 @@ bool PageSource::isAlive() const {
 }
 
 int PageSource::readOlder(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
-                          std::size_t* reached) {
+                          std::size_t* reached) const {
     for (*reached = first; *reached < end; ++*reached) {
         const Mapping& mapping = mappings_[*reached];
         if (!smaps_.isReadable()) {
@@ -141,20 +195,21 @@ int PageSource::readOlder(std::size_t first, std::size_t end, AddressRange windo
         }
         if (mapping.isPrivateAnonymous() && detail_ == PageDetail::counts) {
             const std::uint64_t resident = mapping.start + std::min(entry->resident, mapping.size());
-            sink(*reached, mapping.start, resident, PageKind::anonymous);
-            sink(*reached, resident, std::min(resident + entry->swapped, mapping.end), PageKind::swapped);
-        } else if (!readPagemap(*reached, window, sink)) {
+            sink({*reached, mapping.start, resident, PageKind::anonymous});
+            sink({*reached, resident, std::min(resident + entry->swapped, mapping.end), PageKind::swapped});
+        } else if (!readPagemap(*reached, window, pagesOf(mapping, *entry), sink)) {
             return ESRCH;
         }
     }
     return 0;
 }
 
-bool PageSource::readPagemap(std::size_t index, AddressRange window, const PageRunSink& sink) {
+bool PageSource::readPagemap(std::size_t index, AddressRange window, std::uint64_t expected,
+                             const PageRunSink& sink) const {
     const Mapping& mapping = mappings_[index];
     const std::uint64_t end = std::min(mapping.end, window.end);
     std::array<std::uint64_t, 4096> entries;
-    for (std::uint64_t address = std::max(mapping.start, window.start); address < end;) {
+    for (std::uint64_t address = std::max(mapping.start, window.start); address < end && expected != 0;) {
         const std::uint64_t wanted = std::min<std::uint64_t>(entries.size(), (end - address) / basePage);
         const std::size_t count =
             readPagemapEntries(files_.pagemap, address, std::span(entries).first(wanted));
@@ -165,7 +220,8 @@ bool PageSource::readPagemap(std::size_t index, AddressRange window, const PageR
             const std::optional<PageKind> kind =
                 memoryOf(kindOfPagemapEntry(entries[i], mapping.isPrivateAnonymous()));
             if (kind) {
-                sink(index, address, address + basePage, *kind);
+                sink({index, address, address + basePage, *kind});
+                expected -= expected != 0 ? 1 : 0;
             }
         }
     }

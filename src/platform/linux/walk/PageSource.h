@@ -12,7 +12,6 @@
 #include "platform/linux/walk/ProcessMemoryFiles.h"
 #include "platform/linux/walk/SmapsOfProcess.h"
 
-#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -24,10 +23,21 @@ namespace tally::platform {
 /// Whether it matters where pages of private anonymous memory are, or only how many.
 enum class PageDetail : std::uint8_t { counts, positions };
 
-/// Takes the run [start, end) of addresses, which lies in mapping `index`.
-using PageRunSink =
-    std::function<void(std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind)>;
+/// Pages of one state, side by side in one mapping.
+struct FoundRun {
+    std::size_t mapping = 0;
+    std::uint64_t start = 0; // addresses
+    std::uint64_t end = 0;
+    PageKind kind = PageKind::object;
+    bool isHuge = false; // mapped as whole pages of 2 MiB
+};
 
+using PageRunSink = std::function<void(const FoundRun&)>;
+
+/// Whether the kernel answers PAGEMAP_SCAN, as far as is known: false once it has refused one.
+bool scansAreAnswered();
+
+/// Any number of threads may read at once.
 class PageSource {
   public:
     PageSource(const ProcessMemoryFiles& files, std::span<const Mapping> mappings, SmapsOfProcess& smaps,
@@ -38,23 +48,27 @@ class PageSource {
     /// @param reached out: the first mapping that was not read to its end or to `to`.
     /// @return 0 or an error: ESRCH when the task has ended.
     int read(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
-             std::size_t* reached);
+             std::size_t* reached) const;
+    /// The first page of `mapping` at or above `address`, where the kernel answers scans; the mapping's end
+    /// when there is none.
+    std::uint64_t nextPage(const Mapping& mapping, std::uint64_t address) const;
+    /// What a kind that a page table shows stands for on this machine; absent for no memory.
+    std::optional<PageKind> memoryOf(std::optional<PageKind> kind) const;
 
   private:
     int scan(std::size_t first, std::size_t end, AddressRange window, bool withFile, const PageRunSink& sink,
-             std::size_t* reached);
+             std::size_t* reached) const;
     int readOlder(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
-                  std::size_t* reached);
-    std::optional<PageKind> memoryOf(std::optional<PageKind> kind) const;
+                  std::size_t* reached) const;
     bool isAlive() const;
-    bool readPagemap(std::size_t index, AddressRange window, const PageRunSink& sink);
+    bool readPagemap(std::size_t index, AddressRange window, std::uint64_t expected,
+                     const PageRunSink& sink) const;
 
     const ProcessMemoryFiles& files_;
     std::span<const Mapping> mappings_;
     SmapsOfProcess& smaps_;
     PageDetail detail_;
     bool swapInUse_ = machineState().swapInUse;
-    std::array<PageRegion, 512> room_;
 };
 
 } // namespace tally::platform

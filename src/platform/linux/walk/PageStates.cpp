@@ -8,6 +8,20 @@
 
 namespace tally::platform {
 
+void PageStates::append(std::size_t index, const PageStates& part, std::size_t from) {
+    const MappingPages& added = part.mappings[from];
+    MappingPages& pages = mappings[index];
+    pages.object += added.object;
+    pages.anonymous += added.anonymous;
+    pages.swapped += added.swapped;
+    if (added.runCount != 0) {
+        pages.firstRun = pages.runCount == 0 ? runs.size() : pages.firstRun;
+        pages.runCount += added.runCount;
+        const std::span<const PageRun> addedRuns = part.runsOf(added);
+        runs.insert(runs.end(), addedRuns.begin(), addedRuns.end());
+    }
+}
+
 void PageRecorder::record(std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind) {
     const Mapping& mapping = mappings_[index];
     // A shared mapping has no memory of the task's own: what shows there is a device's.
@@ -35,9 +49,10 @@ void PageRecorder::record(std::size_t index, std::uint64_t start, std::uint64_t 
 
 kern_return_t readPageStates(PageSource& source, SmapsOfProcess& smaps, std::span<const Mapping> mappings,
                              PageStates* states) {
+    *states = PageStates(mappings.size());
     PageRecorder recorder(mappings, states);
-    const PageRunSink sink = [&](std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind) {
-        recorder.record(index, start, end, kind);
+    const PageRunSink sink = [&](const FoundRun& run) {
+        recorder.record(run.mapping, run.start, run.end, run.kind);
     };
     const AddressRange everywhere{0, ~std::uint64_t{0}};
     for (std::size_t at = 0; at < mappings.size();) {

@@ -47,6 +47,12 @@ struct PageStates {
     std::vector<MappingPages> mappings; // one per mapping, as far as the task lived
     std::vector<PageRun> runs;
 
+    PageStates() = default;
+    explicit PageStates(std::size_t mappingCount) : mappings(mappingCount) {}
+
+    /// Adds what `part` has of the mapping that is its `from`-th to mapping `index`, which no other follows.
+    void append(std::size_t index, const PageStates& part, std::size_t from);
+
     std::span<const PageRun> runsOf(const MappingPages& pages) const {
         return std::span(runs).subspan(pages.firstRun, pages.runCount);
     }
@@ -55,10 +61,9 @@ struct PageStates {
 /// Enters runs of pages, in rising order within a mapping, into its counts and runs.
 class PageRecorder {
   public:
+    /// @param states one per mapping.
     PageRecorder(std::span<const Mapping> mappings, PageStates* states)
-        : mappings_(mappings), states_(states) {
-        states->mappings.assign(mappings.size(), MappingPages());
-    }
+        : mappings_(mappings), states_(states) {}
 
     /// Records the addresses [start, end), which lie in mapping `index`.
     void record(std::size_t index, std::uint64_t start, std::uint64_t end, PageKind kind);

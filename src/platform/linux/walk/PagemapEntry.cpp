@@ -29,6 +29,8 @@ std::uint64_t zeroFrame() {
 
 } // namespace
 
+bool framesAreTold() { return zeroFrame() != 0; }
+
 std::size_t readPagemapEntries(const Descriptor& pagemap, std::uint64_t address,
                                std::span<std::uint64_t> entries) {
     const ssize_t bytes = pread(pagemap.number(), entries.data(), entries.size_bytes(),
@@ -40,16 +42,13 @@ std::optional<PageKind> kindOfPagemapEntry(std::uint64_t entry, bool inPrivateAn
     if ((entry & pagemap::guard) != 0 || (entry & (pagemap::present | pagemap::swapped)) == 0) {
         return std::nullopt;
     }
-    if (inPrivateAnonymous && (entry & pagemap::present) != 0) {
-        // The huge zero page shows as a file's; the ordinary one by its frame.
-        const std::uint64_t frame = entry & pagemap::place;
-        if ((entry & pagemap::file) != 0 || (frame != 0 && frame == zeroFrame())) {
-            return std::nullopt;
-        }
+    const std::uint64_t frame = entry & pagemap::place;
+    const bool isPresent = (entry & pagemap::present) != 0;
+    const bool isOfFile = (entry & pagemap::file) != 0;
+    if (isPresent && (isOfFile ? inPrivateAnonymous : frame != 0 && frame == zeroFrame())) {
+        return std::nullopt; // the huge zero page shows as a file's, the ordinary one by its frame
     }
-    return (entry & pagemap::file) != 0      ? PageKind::object
-           : (entry & pagemap::present) != 0 ? PageKind::anonymous
-                                             : PageKind::swapped;
+    return isOfFile ? PageKind::object : isPresent ? PageKind::anonymous : PageKind::swapped;
 }
 
 } // namespace tally::platform

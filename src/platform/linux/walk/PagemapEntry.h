@@ -26,7 +26,10 @@ inline constexpr std::uint64_t place = (std::uint64_t{1} << 55) - 1;
 std::size_t readPagemapEntries(const Descriptor& pagemap, std::uint64_t address,
                                std::span<std::uint64_t> entries);
 
-/// What an entry shows; absent for no page, guards and, in private anonymous memory, the kernel's zero page.
+/// Whether entries tell frame numbers, which takes rights.
+bool framesAreTold();
+
+/// What an entry shows; absent for no page, guards and, as far as frames are told, the kernel's zero page.
 std::optional<PageKind> kindOfPagemapEntry(std::uint64_t entry, bool inPrivateAnonymous);
 
 } // namespace tally::platform

@@ -7,15 +7,14 @@
 namespace tally::platform {
 
 bool SmapsOfProcess::isReadable() {
-    if (!entries_) {
-        entries_.emplace();
+    std::call_once(isRead_, [this] {
         const Descriptor file = openForReading(folder_ + "/smaps");
-        const auto take = [&](std::string_view lines) { decodeSmaps(lines, &*entries_); };
+        const auto take = [&](std::string_view lines) { decodeSmaps(lines, &entries_); };
         if (!file.isOpen() || !readLines(file, take)) {
-            entries_->clear();
+            entries_.clear();
         }
-    }
-    return !entries_->empty();
+    });
+    return !entries_.empty();
 }
 
 const SmapsEntry* SmapsOfProcess::entryFor(const Mapping& mapping) {
@@ -23,9 +22,9 @@ const SmapsEntry* SmapsOfProcess::entryFor(const Mapping& mapping) {
         return nullptr;
     }
     const auto found =
-        std::lower_bound(entries_->begin(), entries_->end(), mapping.start,
+        std::lower_bound(entries_.begin(), entries_.end(), mapping.start,
                          [](const SmapsEntry& entry, std::uint64_t start) { return entry.start < start; });
-    return found != entries_->end() && found->start == mapping.start ? &*found : nullptr;
+    return found != entries_.end() && found->start == mapping.start ? &*found : nullptr;
 }
 
 } // namespace tally::platform

@@ -5,14 +5,14 @@
 
 #include "platform/linux/walk/DecodeMaps.h"
 
-#include <optional>
+#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
 
 namespace tally::platform {
 
-/// The smaps of one process, read when first asked for.
+/// The smaps of one process, read when first asked for. Any number of threads may ask.
 class SmapsOfProcess {
   public:
     /// @param folder of the process.
@@ -26,7 +26,8 @@ class SmapsOfProcess {
 
   private:
     std::string folder_;
-    std::optional<std::vector<SmapsEntry>> entries_;
+    std::once_flag isRead_;
+    std::vector<SmapsEntry> entries_;
 };
 
 } // namespace tally::platform
