@@ -27,8 +27,6 @@ PageKey keyOf(std::uint64_t entry, std::uint32_t member, bool* framesTold) {
     return residentKey | ((entry & pagemap::exclusive) != 0 ? member + 1 : 0);
 }
 
-bool isReadAtOnce(const Mapping& mapping) { return mapping.size() <= mostReadAtOnce && framesAreTold(); }
-
 /// Whether reading on over the hole between two ranges is cheaper than another call.
 bool areClose(const AddressRange& lower, const AddressRange& upper) {
     return upper.start - lower.end <= 64 * basePage;
@@ -109,50 +107,47 @@ FamilyMember::FamilyMember(MemberIdentity identity, std::uint32_t number) : numb
         }
         at = end;
     }
-    if (isReadable() && !scansAreAnswered()) {
-        findPlaces();
-    }
-}
-
-void FamilyMember::findPlaces() {
-    const auto note = [&](const FoundRun& run) {
-        for (std::uint64_t window = run.start / windowBytes * windowBytes; window < run.end;
-             window += windowBytes) {
-            if (places_.empty() || places_.back() < window) {
-                places_.push_back(window);
-            }
-        }
-    };
+    std::vector<std::size_t> asked;
     for (const MemberMapping& mapping : privateMappings_) {
-        std::size_t reached = 0;
-        if (!isReadAtOnce(space_.mappings[mapping.index])) {
-            source_->read(mapping.index, mapping.index + 1, {0, nowhere}, note, &reached);
+        if (!isReadAtOnce(mapping.index, MemberStretch::none)) {
+            asked.push_back(mapping.index);
         }
     }
+    asked_ = std::make_unique<AskedPages>(*source_, space_.mappings, std::move(asked));
 }
 
-std::uint64_t FamilyMember::nextPage(std::uint64_t address) const {
-    auto at = std::upper_bound(
-        privateMappings_.begin(), privateMappings_.end(), address,
-        [](std::uint64_t wanted, const MemberMapping& mapping) { return wanted < mapping.range.end; });
-    for (; isReadable() && at != privateMappings_.end(); ++at) {
-        const Mapping& mapping = space_.mappings[at->index];
-        const std::uint64_t from = std::max(address, mapping.start);
-        const std::uint64_t next = isReadAtOnce(mapping) ? from : nextAskedPage(mapping, from);
-        if (next < mapping.end) {
-            return next;
+/// Whether the entries of a mapping are read without asking where its pages are, since `full` is.
+bool FamilyMember::isReadAtOnce(std::size_t mapping, std::size_t full) const {
+    return framesAreTold() && (mapping == full || space_.mappings[mapping].size() <= mostReadAtOnce);
+}
+
+std::uint64_t FamilyMember::nextPage(std::uint64_t address) {
+    const std::size_t full = full_;
+    auto at = privateAbove(address);
+    while (at != privateMappings_.end() && !isReadAtOnce(at->index, full)) {
+        ++at;
+    }
+    const std::uint64_t next = at == privateMappings_.end() ? nowhere : std::max(address, at->range.start);
+    if (!isReadable() || next <= address) {
+        return isReadable() ? next : nowhere;
+    }
+    const std::uint64_t asked = asked_->next(address);
+    return asked_->error() != 0 ? address : std::min(next, asked); // an error shows when it is read
+}
+
+std::uint64_t FamilyMember::nextPage(const MemberStretch& stretch, std::uint64_t address) const {
+    const auto run =
+        std::find_if(stretch.asked.begin() + static_cast<std::ptrdiff_t>(stretch.nextAsked),
+                     stretch.asked.end(), [&](const FoundRun& each) { return each.end > address; });
+    const std::uint64_t next = run == stretch.asked.end() ? nowhere : std::max(address, run->start);
+    for (std::size_t at = stretch.nextMapping;
+         at < privateMappings_.size() && privateMappings_[at].range.start < next; ++at) {
+        if (privateMappings_[at].range.end > address &&
+            isReadAtOnce(privateMappings_[at].index, stretch.full)) {
+            return std::max(address, privateMappings_[at].range.start);
         }
     }
-    return nowhere;
-}
-
-std::uint64_t FamilyMember::nextAskedPage(const Mapping& mapping, std::uint64_t address) const {
-    if (!scansAreAnswered()) {
-        const auto place =
-            std::lower_bound(places_.begin(), places_.end(), address / windowBytes * windowBytes);
-        return place == places_.end() ? nowhere : std::max(address, *place);
-    }
-    return source_->nextPage(mapping, address);
+    return next;
 }
 
 /// The first mapping that ends above `address`.
@@ -162,6 +157,12 @@ std::vector<Mapping>::const_iterator FamilyMember::mappingAbove(std::uint64_t ad
         [](std::uint64_t wanted, const Mapping& mapping) { return wanted < mapping.end; });
 }
 
+std::vector<MemberMapping>::const_iterator FamilyMember::privateAbove(std::uint64_t address) const {
+    return std::upper_bound(
+        privateMappings_.begin(), privateMappings_.end(), address,
+        [](std::uint64_t wanted, const MemberMapping& mapping) { return wanted < mapping.range.end; });
+}
+
 void FamilyMember::expect(std::uint64_t end, const WindowRow* last) {
     const auto at = mappingAbove(end - 1);
     const bool isFull = last != nullptr && at != space_.mappings.end() && at->end > end && framesAreTold() &&
@@ -169,52 +170,45 @@ void FamilyMember::expect(std::uint64_t end, const WindowRow* last) {
     full_ = isFull ? static_cast<std::size_t>(at - space_.mappings.begin()) : MemberStretch::none;
 }
 
-MemberStretch FamilyMember::begin(AddressRange range) const {
-    MemberStretch stretch;
-    const auto startsBelow = [](const auto& mapping, std::uint64_t address) {
-        return mapping.start < address;
-    };
+MemberStretch FamilyMember::begin(AddressRange range) {
     const std::vector<Mapping>& all = space_.mappings;
     const auto first = mappingAbove(range.start);
-    const auto end = std::lower_bound(first, all.end(), range.end, startsBelow);
-    const auto indexOf = [&](auto at) { return static_cast<std::size_t>(at - all.begin()); };
-    std::size_t reached = 0;
+    const auto end =
+        std::lower_bound(first, all.end(), range.end, [](const Mapping& mapping, std::uint64_t address) {
+            return mapping.start < address;
+        });
+    MemberStretch stretch;
     stretch.member = number_;
-    stretch.firstMapping = indexOf(first);
-    stretch.states = PageStates(end - first);
-    PageRecorder recorder(std::span(first, end), &stretch.states);
-    const auto take = [&](const FoundRun& run) {
-        recorder.record(run.mapping - stretch.firstMapping, run.start, run.end, run.kind);
-        if (run.kind != PageKind::object) {
-            stretch.asked.push_back(run);
-        }
-    };
+    stretch.firstMapping = static_cast<std::size_t>(first - all.begin());
+    stretch.states = PageStates(static_cast<std::size_t>(end - first));
+    stretch.nextMapping = static_cast<std::size_t>(privateAbove(range.start) - privateMappings_.begin());
     stretch.full = full_;
-    const std::uint64_t fullStart = stretch.full == MemberStretch::none ? nowhere : all[stretch.full].start;
-    const auto isAsked = [&](const Mapping& mapping) {
-        return mapping.isPrivate() && !isReadAtOnce(mapping) && mapping.start != fullStart;
-    };
-    for (auto at = first; stretch.status == KERN_SUCCESS && at != end;) {
-        at = std::find_if(at, end, isAsked);
-        const auto stop = std::find_if_not(at, end, isAsked);
-        const int error = at == stop ? 0 : source_->read(indexOf(at), indexOf(stop), range, take, &reached);
-        if (error != 0) {
-            stretch.breakOff(error, stretch.firstMapping); // what is read at once was not read yet
-        }
-        at = stop;
+    if (stretch.full != MemberStretch::none && all[stretch.full].start < range.end) {
+        asked_->skip(std::min(range.end, all[stretch.full].end));
     }
-    const auto next = std::lower_bound(
-        privateMappings_.begin(), privateMappings_.end(), range.start,
-        [](const MemberMapping& mapping, std::uint64_t address) { return mapping.range.end <= address; });
-    stretch.nextMapping = static_cast<std::size_t>(next - privateMappings_.begin());
+    asked_->skip(range.start);
+    std::vector<FoundRun> runs = asked_->takeBelow(range.end);
+    if (asked_->error() != 0) {
+        stretch.breakOff(asked_->error(), stretch.firstMapping); // what is read at once was not read yet
+        return stretch;
+    }
+    PageRecorder recorder(std::span(first, end), &stretch.states);
+    for (const FoundRun& run : runs) {
+        recorder.record(run.mapping - stretch.firstMapping, run.start, run.end, run.kind);
+    }
+    std::erase_if(runs, [](const FoundRun& run) { return run.kind == PageKind::object; });
+    stretch.asked = std::move(runs);
     return stretch;
 }
 
 bool FamilyMember::readWindow(std::uint64_t start, MemberStretch& stretch, WindowRow& row) const {
     row.member = number_;
     row.holds = WindowRow::Holds::nothing;
-    row.keys.fill(0);
     const std::uint64_t end = start + windowBytes;
+    if (nextPage(stretch, start) >= end) {
+        return true;
+    }
+    row.keys.fill(0);
     while (stretch.nextAsked < stretch.asked.size() && stretch.asked[stretch.nextAsked].end <= start) {
         ++stretch.nextAsked;
     }
@@ -230,8 +224,7 @@ bool FamilyMember::readWindow(std::uint64_t start, MemberStretch& stretch, Windo
                                 privateMappings_[at].range.start < end;) {
         std::size_t stop = at;
         while (stop < privateMappings_.size() && privateMappings_[stop].range.start < end &&
-               (isReadAtOnce(space_.mappings[privateMappings_[stop].index]) ||
-                privateMappings_[stop].index == stretch.full) &&
+               isReadAtOnce(privateMappings_[stop].index, stretch.full) &&
                (stop == at || areClose(privateMappings_[stop - 1].range, privateMappings_[stop].range))) {
             ++stop;
         }

@@ -10,6 +10,7 @@
 #pragma once
 
 #include "platform/kern_return.h"
+#include "platform/linux/families/AskedPages.h"
 #include "platform/linux/families/SharedParts.h"
 #include "platform/linux/families/SharingSets.h"
 #include "platform/linux/walk/Mapping.h"
@@ -82,10 +83,13 @@ class FamilyMember {
     const std::vector<MemberMapping>& privateMappings() const { return privateMappings_; }
 
     /// The first address from `address` on where it may have a page in a private mapping; all ones for none.
-    std::uint64_t nextPage(std::uint64_t address) const;
+    /// For one thread at a time, like begin(); addresses rise.
+    std::uint64_t nextPage(std::uint64_t address);
+    /// Begins to read the private mappings in `range`.
+    MemberStretch begin(AddressRange range);
 
-    /// Begins to read the private mappings in `range`: asks where pages are, as far as that is asked first.
-    MemberStretch begin(AddressRange range) const;
+    /// The same within a stretch that was begun.
+    std::uint64_t nextPage(const MemberStretch& stretch, std::uint64_t address) const;
     /// Reads the window that begins at `start` of mappings that are read at once, and notes in `row` what the
     /// member has of its own there. Windows rise. @return false when frames are hidden.
     bool readWindow(std::uint64_t start, MemberStretch& stretch, WindowRow& row) const;
@@ -102,10 +106,10 @@ class FamilyMember {
 
   private:
     std::vector<Mapping>::const_iterator mappingAbove(std::uint64_t address) const;
+    std::vector<MemberMapping>::const_iterator privateAbove(std::uint64_t address) const;
     bool readAtOnce(std::span<const MemberMapping> neighbours, AddressRange window, MemberStretch& stretch,
                     WindowRow& row) const;
-    std::uint64_t nextAskedPage(const Mapping& mapping, std::uint64_t address) const;
-    void findPlaces();
+    bool isReadAtOnce(std::size_t mapping, std::size_t full) const;
 
     std::uint32_t number_;
     ProcessMemoryFiles files_;
@@ -114,8 +118,7 @@ class FamilyMember {
     std::unique_ptr<PageSource> source_;
     std::vector<MemberMapping> privateMappings_;
     std::atomic<std::size_t> full_ = MemberStretch::none; // the mapping that was mostly there last
-    // Kernels that cannot be asked for the next page: windows with pages in mappings that are asked first.
-    std::vector<std::uint64_t> places_;
+    std::unique_ptr<AskedPages> asked_;
 };
 
 } // namespace tally::platform

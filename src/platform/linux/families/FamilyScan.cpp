@@ -94,24 +94,31 @@ FamilyScan::Stretch* FamilyScan::nextStretch() {
     stretch->range = {next / windowBytes * windowBytes, (next / stretchBytes + 1) * stretchBytes};
     for (std::size_t i = 0; i < members_.size(); ++i) {
         if (nextPages_[i] < stretch->range.end) {
-            stretch->members.push_back(i);
+            stretch->read.push_back(members_[i]->begin(stretch->range));
             nextPages_[i] = members_[i]->nextPage(stretch->range.end);
         }
     }
     return stretches_.emplace_back(std::move(stretch)).get();
 }
 
-void FamilyScan::read(Stretch& stretch) const {
-    for (const std::size_t member : stretch.members) {
-        stretch.read.push_back(members_[member]->begin(stretch.range));
+/// The first window from `address` on in which a member may have a page.
+std::uint64_t FamilyScan::nextWindow(const Stretch& stretch, std::uint64_t address) const {
+    std::uint64_t next = nowhere;
+    for (const MemberStretch& member : stretch.read) {
+        next = std::min(next, members_[member.member]->nextPage(member, address));
     }
+    return next / windowBytes * windowBytes;
+}
+
+void FamilyScan::read(Stretch& stretch) const {
     stretch.sets.emplace(members_.size());
     std::vector<WindowRow> rows(stretch.read.size());
     bool wasShared = false; // the last window
-    for (std::uint64_t start = stretch.range.start; start < stretch.range.end; start += windowBytes) {
+    for (std::uint64_t start = nextWindow(stretch, stretch.range.start); start < stretch.range.end;
+         start = nextWindow(stretch, start + windowBytes)) {
         std::vector<WindowRow*> holding;
         for (std::size_t i = 0; i < rows.size(); ++i) {
-            const FamilyMember& member = *members_[stretch.members[i]];
+            const FamilyMember& member = *members_[stretch.read[i].member];
             stretch.framesTold &= member.readWindow(start, stretch.read[i], rows[i]);
             if (rows[i].holds != WindowRow::Holds::nothing) {
                 holding.push_back(&rows[i]);
@@ -124,14 +131,14 @@ void FamilyScan::read(Stretch& stretch) const {
         for (std::size_t i = 0; i < rows.size(); ++i) {
             if (rows[i].holds != WindowRow::Holds::nothing) {
                 stretch.framesTold &=
-                    members_[stretch.members[i]]->readFrames(start, stretch.read[i], rows[i]);
+                    members_[stretch.read[i].member]->readFrames(start, stretch.read[i], rows[i]);
             }
         }
         compare(start, holding, *stretch.sets);
     }
     for (std::size_t i = 0; i < rows.size(); ++i) {
         stretch.read[i].asked = {};
-        members_[stretch.members[i]]->expect(stretch.range.end, wasShared ? &rows[i] : nullptr);
+        members_[stretch.read[i].member]->expect(stretch.range.end, wasShared ? &rows[i] : nullptr);
     }
 }
 

@@ -41,8 +41,7 @@ class FamilyScan {
     /// Some windows, and what was found in them.
     struct Stretch {
         AddressRange range;
-        std::vector<std::size_t> members; // that have pages there
-        std::vector<MemberStretch> read;
+        std::vector<MemberStretch> read; // of the members that have pages there
         std::optional<SharingSets> sets;
         bool framesTold = true;
     };
@@ -50,6 +49,7 @@ class FamilyScan {
     void work(std::unique_lock<std::mutex>& lock);
     void open(std::unique_lock<std::mutex>& lock);
     Stretch* nextStretch();
+    std::uint64_t nextWindow(const Stretch& stretch, std::uint64_t address) const;
     void read(Stretch& stretch) const;
     void compare(std::uint64_t start, std::span<WindowRow* const> rows, SharingSets& sets) const;
     void finish();

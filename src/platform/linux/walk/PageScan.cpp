@@ -32,7 +32,6 @@ struct pm_scan_arg {
 static_assert(sizeof(pm_scan_arg) == 96);
 
 constexpr unsigned long PAGEMAP_SCAN = _IOWR('f', 16, pm_scan_arg);
-constexpr std::uint64_t mostPages = (64 << 20) / basePage;
 // Of a call that gives more regions than this, the kernel's own note of where it ended is stale (seen
 // on 6.18).
 constexpr std::size_t mostRegions = 512;
@@ -41,65 +40,47 @@ constexpr std::size_t mostRegions = 512;
 /// the lock before it, again and again, for milliseconds.
 void letWaitersIn() { std::this_thread::sleep_for(std::chrono::microseconds(1)); }
 
-/// Makes the call. @return the number of regions; negative with errno.
-int askForPages(int pagemap, pm_scan_arg& query, std::span<PageRegion> room) {
-    static std::atomic<bool> tellsGuards = true; // false once this kernel has refused the category
-    query.size = sizeof(query);
-    query.vec = reinterpret_cast<std::uintptr_t>(room.data());
-    query.vec_len = room.size();
-    query.category_anyof_mask = PageIsPresent | PageIsSwapped;
-    query.return_mask |= PageIsPresent | PageIsSwapped;
-    for (;;) {
-        const bool withGuards = tellsGuards;
-        query.return_mask = withGuards ? query.return_mask | PageIsGuard : query.return_mask & ~PageIsGuard;
-        const int count = ioctl(pagemap, PAGEMAP_SCAN, &query);
-        if (count < 0 && errno == EINVAL && withGuards) {
-            tellsGuards = false;
-        } else if (count >= 0 || errno != EINTR) {
-            return count;
-        }
-    }
-}
-
 } // namespace
 
-int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile, std::span<PageRegion> room,
-              PageScanStep* step) {
+int scanPages(int pagemap, AddressRange range, bool withFile, std::uint64_t mostPages,
+              std::span<PageRegion> room, PageScanStep* step) {
+    static std::atomic<bool> tellsGuards = true; // false once this kernel has refused the category
     const std::span<PageRegion> used = room.first(std::min(room.size(), mostRegions));
-    pm_scan_arg query{};
-    query.start = start;
-    query.end = end;
-    query.max_pages = mostPages;
-    query.return_mask = PageIsZero | PageIsHuge | (withFile ? PageIsFile : 0);
-    const int count = askForPages(pagemap, query, used);
-    if (count < 0) {
-        return errno;
+    for (;;) {
+        const bool withGuards = tellsGuards;
+        pm_scan_arg query{};
+        query.size = sizeof(query);
+        query.start = range.start;
+        query.end = range.end;
+        query.vec = reinterpret_cast<std::uintptr_t>(used.data());
+        query.vec_len = used.size();
+        query.max_pages = mostPages;
+        query.category_anyof_mask = PageIsPresent | PageIsSwapped;
+        query.return_mask = PageIsPresent | PageIsSwapped | PageIsZero | PageIsHuge |
+                            (withFile ? PageIsFile : 0) | (withGuards ? PageIsGuard : 0);
+        const int count = ioctl(pagemap, PAGEMAP_SCAN, &query);
+        if (count < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            if (errno == EINVAL && withGuards) {
+                tellsGuards = false;
+                continue;
+            }
+            return errno;
+        }
+        step->regions = used.first(static_cast<std::size_t>(count));
+        step->pages = 0;
+        for (const PageRegion& region : step->regions) {
+            step->pages += (region.end - region.start) / basePage;
+        }
+        const bool complete = step->regions.size() < used.size() && step->pages < mostPages;
+        step->resume = complete ? range.end : step->regions.back().end;
+        if (step->pages >= mostPagesOfCall && step->resume < range.end) {
+            letWaitersIn();
+        }
+        return 0;
     }
-    step->regions = used.first(static_cast<std::size_t>(count));
-    std::uint64_t pages = 0;
-    for (const PageRegion& region : step->regions) {
-        pages += (region.end - region.start) / basePage;
-    }
-    const bool complete = step->regions.size() < used.size() && pages < mostPages;
-    step->resume = complete ? end : step->regions.back().end;
-    if (pages >= mostPages && step->resume < end) {
-        letWaitersIn();
-    }
-    return 0;
-}
-
-int findPage(int pagemap, std::uint64_t start, std::uint64_t end, std::uint64_t* found) {
-    PageRegion first;
-    pm_scan_arg query{};
-    query.start = start;
-    query.end = end;
-    query.max_pages = 1;
-    const int count = askForPages(pagemap, query, std::span(&first, 1));
-    if (count < 0) {
-        return errno;
-    }
-    *found = count == 0 ? end : std::max(start, first.start);
-    return 0;
 }
 
 } // namespace tally::platform

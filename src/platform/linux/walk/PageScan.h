@@ -2,6 +2,8 @@
 
 #pragma once
 
+#include "platform/linux/walk/Mapping.h"
+
 #include <array>
 #include <cstdint>
 #include <span>
@@ -26,22 +28,22 @@ inline constexpr std::uint64_t PageIsGuard = 256;
 /// Which runs one call gave, and how far it came.
 struct PageScanStep {
     std::span<const PageRegion> regions; // in the room that the caller gave
+    std::uint64_t pages = 0;             // in all regions
     std::uint64_t resume = 0;            // address at which to go on
 };
 
 /// Room for the runs of one call.
 using PageScanRoom = std::array<PageRegion, 512>;
 
-/// Scans [start, end) for present and swapped pages, at most 64 MiB of them a call: the target's own calls
-/// that change its address space wait for a scan, and are let in between two long ones. What is absent costs
-/// next to nothing, but for page tables that were emptied.
+/// Pages that one call looks at most: the target's own calls that change its address space wait for it.
+inline constexpr std::uint64_t mostPagesOfCall = (64 << 20) / basePage;
+
+/// Scans `range` for present and swapped pages, at most `mostPages` of them. Lets others in that wait for the
+/// address space after as many as a call may look at. What is absent costs next to nothing, but for page
+/// tables that were emptied.
 /// @param withFile whether to tell file pages from others, which costs the kernel twice the time.
 /// @return 0, or the error: ESRCH when the task has ended, ENOTTY when this kernel has no such query.
-int scanPages(int pagemap, std::uint64_t start, std::uint64_t end, bool withFile, std::span<PageRegion> room,
-              PageScanStep* step);
-
-/// Finds the first present or swapped page in [start, end). @param found out: its address; `end` for none.
-/// @return as above.
-int findPage(int pagemap, std::uint64_t start, std::uint64_t end, std::uint64_t* found);
+int scanPages(int pagemap, AddressRange range, bool withFile, std::uint64_t mostPages,
+              std::span<PageRegion> room, PageScanStep* step);
 
 } // namespace tally::platform

@@ -66,10 +66,11 @@ std::optional<PageKind> kindOfRegion(const PageRegion& region) {
                                                       : PageKind::swapped;
 }
 
-// What a call walks without finding a page is bounded as well, because page tables that were emptied are
-// walked too: by the mapped addresses, and ever less strictly while nothing comes, for what is only reserved
+// What a call walks without finding pages is bounded as well, because page tables that were emptied are
+// walked too: by the mapped addresses, and ever less strictly while little comes, for what is only reserved
 // has no tables.
 constexpr std::uint64_t usualStep = 1 << 30;
+constexpr std::uint64_t fewPages = 1024;
 constexpr std::uint64_t growthOfEmptySteps = 64;
 
 /// How many pages of a mapping page tables can show: what is swapped out of shared memory they do not.
@@ -90,8 +91,6 @@ std::uint64_t endOfStep(std::span<const Mapping> mappings, std::uint64_t address
 }
 
 } // namespace
-
-bool scansAreAnswered() { return scansAnswered; }
 
 int PageSource::read(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
                      std::size_t* reached) const {
@@ -115,61 +114,74 @@ int PageSource::read(std::size_t first, std::size_t end, AddressRange window, co
     return 0;
 }
 
-std::uint64_t PageSource::nextPage(const Mapping& mapping, std::uint64_t address) const {
-    for (std::uint64_t most = usualStep; address < mapping.end; most *= growthOfEmptySteps) {
-        const std::uint64_t end = std::min(mapping.end, address + most);
-        std::uint64_t found = address;
-        if (findPage(files_.pagemap.number(), address, end, &found) != 0 || found < end) {
-            return found; // whatever is wrong shows when it is read
-        }
-        address = end;
-    }
-    return mapping.end;
-}
-
 int PageSource::scan(std::size_t first, std::size_t end, AddressRange window, bool withFile,
                      const PageRunSink& sink, std::size_t* reached) const {
-    PageScanRoom room;
-    std::size_t mapping = first;
-    std::uint64_t mostMapped = usualStep;
-    std::uint64_t stepEnd = 0;
     const std::uint64_t last = std::min(window.end, mappings_[end - 1].end);
-    for (std::uint64_t address = std::max(window.start, mappings_[first].start); address < last;) {
-        *reached = mapping;
-        if (address >= stepEnd) {
-            stepEnd =
-                std::min(last, endOfStep(mappings_.subspan(mapping, end - mapping), address, mostMapped));
-        }
-        PageScanStep step;
-        if (const int error = scanPages(files_.pagemap.number(), address, stepEnd, withFile, room, &step);
-            error != 0) {
+    ScanCursor cursor{.address = std::max(window.start, mappings_[first].start), .mapping = first};
+    while (cursor.address < last) {
+        *reached = cursor.mapping;
+        if (const int error = scanOn(end, last, withFile, mostPagesOfCall, sink, &cursor); error != 0) {
             return error;
-        }
-        mostMapped = step.regions.empty() ? mostMapped * growthOfEmptySteps : usualStep;
-        for (const PageRegion& region : step.regions) {
-            // A region can reach over several mappings and what lies between them.
-            while (mapping < end && mappings_[mapping].end <= region.start) {
-                ++mapping;
-            }
-            const std::optional<PageKind> kind = memoryOf(kindOfRegion(region));
-            const bool isOwn = kind == PageKind::anonymous;
-            for (std::size_t at = mapping; kind && at < end && mappings_[at].start < region.end; ++at) {
-                sink({at, std::max(region.start, mappings_[at].start),
-                      std::min(region.end, mappings_[at].end),
-                      isOwn && mappings_[at].isSharedMemory() ? PageKind::object : *kind,
-                      (region.categories & PageIsHuge) != 0});
-            }
-        }
-        address = step.resume;
-        while (mapping < end && mappings_[mapping].end <= address) {
-            ++mapping;
-        }
-        if (mapping < end) {
-            address = std::max(address, mappings_[mapping].start); // what lies between is not scanned
         }
     }
     *reached = end;
     return 0;
+}
+
+/// Makes one call, for pages below `last`.
+int PageSource::scanOn(std::size_t end, std::uint64_t last, bool withFile, std::uint64_t mostPages,
+                       const PageRunSink& sink, ScanCursor* cursor) const {
+    std::size_t& mapping = cursor->mapping;
+    if (cursor->address >= cursor->callEnd) {
+        cursor->mostMapped = std::max(cursor->mostMapped, usualStep);
+        cursor->callEnd =
+            endOfStep(mappings_.subspan(mapping, end - mapping), cursor->address, cursor->mostMapped);
+    }
+    PageScanRoom room;
+    PageScanStep step;
+    const int error = scanPages(files_.pagemap.number(), {cursor->address, std::min(last, cursor->callEnd)},
+                                withFile, mostPages, room, &step);
+    if (error != 0) {
+        return error;
+    }
+    cursor->mostMapped = step.pages < fewPages ? cursor->mostMapped * growthOfEmptySteps : usualStep;
+    for (const PageRegion& region : step.regions) {
+        // A region can reach over several mappings and what lies between them.
+        while (mapping < end && mappings_[mapping].end <= region.start) {
+            ++mapping;
+        }
+        const std::optional<PageKind> kind = memoryOf(kindOfRegion(region));
+        const bool isOwn = kind == PageKind::anonymous;
+        for (std::size_t at = mapping; kind && at < end && mappings_[at].start < region.end; ++at) {
+            sink({at, std::max(region.start, mappings_[at].start), std::min(region.end, mappings_[at].end),
+                  isOwn && mappings_[at].isSharedMemory() ? PageKind::object : *kind,
+                  (region.categories & PageIsHuge) != 0});
+        }
+    }
+    cursor->address = step.resume;
+    while (mapping < end && mappings_[mapping].end <= cursor->address) {
+        ++mapping;
+    }
+    if (mapping < end) {
+        cursor->passTo(mappings_[mapping].start); // what lies between is not scanned
+    }
+    return 0;
+}
+
+int PageSource::readOn(std::size_t end, bool withFile, std::uint64_t mostPages, const PageRunSink& sink,
+                       ScanCursor* cursor) const {
+    const std::uint64_t last = mappings_[end - 1].end;
+    if (scansAnswered) {
+        const int error = scanOn(end, last, withFile, mostPages, sink, cursor);
+        if (error != ENOTTY) {
+            return error == 0 && !isAlive() ? ESRCH : error;
+        }
+        scansAnswered = false;
+    }
+    std::size_t reached = 0;
+    const int error = readOlder(cursor->mapping, end, {cursor->address, last}, sink, &reached);
+    cursor->passTo(last);
+    return error;
 }
 
 /// Without swap, what shows as swapped are marks that userfaultfd left where there is no memory.

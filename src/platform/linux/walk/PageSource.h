@@ -34,8 +34,15 @@ struct FoundRun {
 
 using PageRunSink = std::function<void(const FoundRun&)>;
 
-/// Whether the kernel answers PAGEMAP_SCAN, as far as is known: false once it has refused one.
-bool scansAreAnswered();
+/// How far mappings were read.
+struct ScanCursor {
+    std::uint64_t address = 0;
+    std::size_t mapping = 0;      // the first that ends above it
+    std::uint64_t mostMapped = 0; // mapped addresses that the next call may walk; 0 for the usual
+    std::uint64_t callEnd = 0;    // where the next call ends
+
+    void passTo(std::uint64_t to) { address = address < to ? to : address; }
+};
 
 /// Any number of threads may read at once.
 class PageSource {
@@ -49,15 +56,18 @@ class PageSource {
     /// @return 0 or an error: ESRCH when the task has ended.
     int read(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
              std::size_t* reached) const;
-    /// The first page of `mapping` at or above `address`, where the kernel answers scans; the mapping's end
-    /// when there is none.
-    std::uint64_t nextPage(const Mapping& mapping, std::uint64_t address) const;
+    /// Reads on from where `cursor` stands up to the end of mapping `end` - 1: one call of the kernel, or all
+    /// of it where there is no such call. @param withFile as scanPages has it. @return as above.
+    int readOn(std::size_t end, bool withFile, std::uint64_t mostPages, const PageRunSink& sink,
+               ScanCursor* cursor) const;
     /// What a kind that a page table shows stands for on this machine; absent for no memory.
     std::optional<PageKind> memoryOf(std::optional<PageKind> kind) const;
 
   private:
     int scan(std::size_t first, std::size_t end, AddressRange window, bool withFile, const PageRunSink& sink,
              std::size_t* reached) const;
+    int scanOn(std::size_t end, std::uint64_t last, bool withFile, std::uint64_t mostPages,
+               const PageRunSink& sink, ScanCursor* cursor) const;
     int readOlder(std::size_t first, std::size_t end, AddressRange window, const PageRunSink& sink,
                   std::size_t* reached) const;
     bool isAlive() const;
