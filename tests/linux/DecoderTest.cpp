@@ -100,7 +100,6 @@ TEST(DecodeStatus, SumsWhatIsThereAndKnowsAProcessThatHasEnded) {
         decodeStatus("Name:\tRssAnon: 9 kB\nTgid:\t12\nVmHWM:\t  100 kB\nVmLck:\t 8 kB\n"
                      "RssAnon:\t 16 kB\nRssShmem:\t 4 kB\nVmPTE:\t 40 kB\nVmSwap:\t 0 kB\n"
                      "HugetlbPages:\t 2048 kB\n");
-    EXPECT_EQ(status.threadGroup, 12);
     EXPECT_EQ(status.residentAnonymous, 16384U);
     EXPECT_EQ(status.pageTables, 40960U);
     EXPECT_EQ(status.hugetlb, 2097152U);

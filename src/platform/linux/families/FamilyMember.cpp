@@ -249,7 +249,9 @@ bool FamilyMember::readAtOnce(std::span<const MemberMapping> neighbours, Address
     }
     PageRecorder recorder(std::span(space_.mappings).subspan(stretch.firstMapping), &stretch.states);
     RunJoiner runs(recorder, stretch.firstMapping);
+    const std::uint64_t zero = zeroFrame();
     bool framesTold = true;
+    PageKey anyKey = 0;
     auto entry = entries.begin();
     std::uint64_t address = from;
     for (const MemberMapping& mapping : neighbours) {
@@ -257,15 +259,17 @@ bool FamilyMember::readAtOnce(std::span<const MemberMapping> neighbours, Address
             *entry++ = 0; // a hole, or what is not private
         }
         const bool isAnonymous = space_.mappings[mapping.index].isPrivateAnonymous();
-        for (; address < std::min(to, mapping.range.end); address += basePage, ++entry) {
-            const auto kind = source_->memoryOf(kindOfPagemapEntry(*entry, isAnonymous));
+        const std::uint64_t end = std::min(to, mapping.range.end);
+        for (; address < end; address += basePage, ++entry) {
+            const auto kind = source_->memoryOf(kindOfPagemapEntry(*entry, isAnonymous, zero));
             if (kind) {
                 runs.add(mapping.index, address, *kind);
             }
             *entry = kind && *kind != PageKind::object ? keyOf(*entry, number_, &framesTold) : 0;
-            row.holds = *entry != 0 ? WindowRow::Holds::pages : row.holds;
+            anyKey |= *entry;
         }
     }
+    row.holds = anyKey != 0 ? WindowRow::Holds::pages : row.holds;
     return framesTold;
 }
 

@@ -26,27 +26,35 @@ struct LastRead {
 };
 thread_local std::optional<LastRead> lastRead;
 
+Charges chargesOf(const ProcessStatus& status, bool isSecondTenant) {
+    Charges charges;
+    if (status.hasAddressSpace) {
+        charges.pageTable = isSecondTenant ? 0 : status.pageTables + topLevelTable;
+        charges.physTally = status.residentAnonymous + status.residentShared + status.hugetlb +
+                            status.swapped + charges.pageTable;
+        charges.peak = std::max(charges.physTally, status.peakResident);
+        charges.residentAnonymous = status.residentAnonymous;
+    }
+    return charges;
+}
+
 std::optional<Charges> readChargesOfTask(std::int32_t pid) {
+    const std::optional<ProcessStatus> status = readProcessStatus(pid);
+    if (!status) {
+        return std::nullopt;
+    }
     const std::shared_ptr<Task> task = taskOfProcess(pid);
-    return readCharges(pid, task && task->isSecondTenant());
+    if (task) {
+        task->noteStatus(*status);
+    }
+    return chargesOf(*status, task && task->isSecondTenant());
 }
 
 } // namespace
 
 std::optional<Charges> readCharges(std::int32_t pid, bool isSecondTenant) {
     const std::optional<ProcessStatus> status = readProcessStatus(pid);
-    if (!status) {
-        return std::nullopt;
-    }
-    Charges charges;
-    if (status->hasAddressSpace) {
-        charges.pageTable = isSecondTenant ? 0 : status->pageTables + topLevelTable;
-        charges.physTally = status->residentAnonymous + status->residentShared + status->hugetlb +
-                            status->swapped + charges.pageTable;
-        charges.peak = std::max(charges.physTally, status->peakResident);
-        charges.residentAnonymous = status->residentAnonymous;
-    }
-    return charges;
+    return status ? std::optional(chargesOf(*status, isSecondTenant)) : std::nullopt;
 }
 
 int proc_pid_rusage(std::int32_t pid, rusage_info_v5* info) {

@@ -47,7 +47,7 @@ std::optional<std::vector<std::int32_t>> listPids() {
 /// Reads the stat record of a process proper; absent with errno for what is none.
 std::optional<ProcessStat> readUserProcess(std::int32_t pid) {
     std::optional<ProcessStat> stat = readProcessStat(pid);
-    if (stat && stat->isKernelThread()) {
+    if (stat && (stat->isKernelThread() || stat->isThread())) {
         errno = ESRCH;
         return std::nullopt;
     }
@@ -107,11 +107,6 @@ int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
     }
     const std::optional<ProcessStat> stat = readUserProcess(pid);
     if (!stat) {
-        return 0;
-    }
-    const std::optional<ProcessStatus> status = readProcessStatus(pid);
-    if (!status || status->threadGroup != pid) { // the id of a thread opens a folder too
-        errno = ESRCH;
         return 0;
     }
     *info = proc_bsdinfo();

@@ -31,7 +31,8 @@ std::optional<ProcessStat> decodeStat(std::string_view text) {
         return std::nullopt;
     }
     stat.state = state[0];
-    for (int field = 5; field <= 22; ++field) {
+    constexpr int lastNeeded = 22;
+    for (int field = 5; field <= 38; ++field) {
         bool valid = true;
         if (field == 9) {
             valid = takeNumber(rest, &stat.flags);
@@ -39,10 +40,12 @@ std::optional<ProcessStat> decodeStat(std::string_view text) {
             valid = takeNumber(rest, &stat.threads);
         } else if (field == 22) {
             valid = takeNumber(rest, &stat.startTicks);
+        } else if (field == 38) {
+            valid = takeNumber(rest, &stat.exitSignal);
         } else {
             valid = !takeWord(rest).empty();
         }
-        if (!valid) {
+        if (!valid && field <= lastNeeded) {
             return std::nullopt;
         }
     }
@@ -89,9 +92,6 @@ ProcessStatus decodeStatus(std::string_view text) {
     while (!text.empty()) {
         std::string_view line = takeLine(text);
         const std::string_view key = takeUntil(line, ':');
-        if (key == "Tgid") {
-            takeNumber(line, &status.threadGroup);
-        }
         for (const auto& [name, member] : sizes) {
             std::uint64_t kibibytes = 0;
             if (key == name && takeNumber(line, &kibibytes)) {

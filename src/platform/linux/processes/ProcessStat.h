@@ -18,9 +18,12 @@ struct ProcessStat {
     std::uint32_t flags = 0;
     std::int64_t threads = 0;
     std::uint64_t startTicks = 0; // clock ticks since boot
+    std::int32_t exitSignal = 0;  // that its parent gets
 
     static constexpr std::uint32_t KernelThread = 0x00200000;
     bool isKernelThread() const { return (flags & KernelThread) != 0; }
+    /// No process of its own: the id of a thread opens a folder too, and only a process signals its end.
+    bool isThread() const { return exitSignal < 0; }
     /// Ended, with no thread left that lives on without its leader.
     bool isZombie() const { return (state == 'Z' || state == 'X') && threads <= 1; }
 };
@@ -33,7 +36,6 @@ std::optional<ProcessStat> readProcessStat(std::int32_t pid);
 
 /// Figures of a status file; sizes in bytes, 0 where the kernel names none.
 struct ProcessStatus {
-    std::int32_t threadGroup = 0;
     std::uint64_t peakResident = 0;      // VmHWM
     std::uint64_t locked = 0;            // VmLck
     std::uint64_t residentAnonymous = 0; // RssAnon

@@ -184,11 +184,6 @@ int PageSource::readOn(std::size_t end, bool withFile, std::uint64_t mostPages, 
     return error;
 }
 
-/// Without swap, what shows as swapped are marks that userfaultfd left where there is no memory.
-std::optional<PageKind> PageSource::memoryOf(std::optional<PageKind> kind) const {
-    return kind == PageKind::swapped && !swapInUse_ ? std::nullopt : kind;
-}
-
 bool PageSource::isAlive() const {
     std::uint64_t entry = 0;
     return readPagemapEntries(files_.pagemap, 0, std::span(&entry, 1)) == 1;
@@ -230,7 +225,7 @@ bool PageSource::readPagemap(std::size_t index, AddressRange window, std::uint64
         }
         for (std::size_t i = 0; i < count; ++i, address += basePage) {
             const std::optional<PageKind> kind =
-                memoryOf(kindOfPagemapEntry(entries[i], mapping.isPrivateAnonymous()));
+                memoryOf(kindOfPagemapEntry(entries[i], mapping.isPrivateAnonymous(), zeroFrame()));
             if (kind) {
                 sink({index, address, address + basePage, *kind});
                 expected -= expected != 0 ? 1 : 0;

@@ -60,8 +60,11 @@ class PageSource {
     /// of it where there is no such call. @param withFile as scanPages has it. @return as above.
     int readOn(std::size_t end, bool withFile, std::uint64_t mostPages, const PageRunSink& sink,
                ScanCursor* cursor) const;
-    /// What a kind that a page table shows stands for on this machine; absent for no memory.
-    std::optional<PageKind> memoryOf(std::optional<PageKind> kind) const;
+    /// What a kind that a page table shows stands for on this machine; absent for no memory. Without swap,
+    /// what shows as swapped are marks that userfaultfd left.
+    std::optional<PageKind> memoryOf(std::optional<PageKind> kind) const {
+        return kind == PageKind::swapped && !swapInUse_ ? std::nullopt : kind;
+    }
 
   private:
     int scan(std::size_t first, std::size_t end, AddressRange window, bool withFile, const PageRunSink& sink,

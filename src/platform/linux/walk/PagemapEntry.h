@@ -26,10 +26,26 @@ inline constexpr std::uint64_t place = (std::uint64_t{1} << 55) - 1;
 std::size_t readPagemapEntries(const Descriptor& pagemap, std::uint64_t address,
                                std::span<std::uint64_t> entries);
 
-/// Whether entries tell frame numbers, which takes rights.
-bool framesAreTold();
+/// The frame of the kernel's zero page, learnt from a page of our own that was only read; 0 when frames are
+/// hidden.
+std::uint64_t zeroFrame();
 
-/// What an entry shows; absent for no page, guards and, as far as frames are told, the kernel's zero page.
-std::optional<PageKind> kindOfPagemapEntry(std::uint64_t entry, bool inPrivateAnonymous);
+/// Whether entries tell frame numbers, which takes rights.
+inline bool framesAreTold() { return zeroFrame() != 0; }
+
+/// What an entry shows; absent for no page, guards and, as far as frames are told, the zero page.
+inline std::optional<PageKind> kindOfPagemapEntry(std::uint64_t entry, bool inPrivateAnonymous,
+                                                  std::uint64_t zeroFrame) {
+    if ((entry & pagemap::guard) != 0 || (entry & (pagemap::present | pagemap::swapped)) == 0) {
+        return std::nullopt;
+    }
+    const std::uint64_t frame = entry & pagemap::place;
+    const bool isPresent = (entry & pagemap::present) != 0;
+    const bool isOfFile = (entry & pagemap::file) != 0;
+    if (isPresent && (isOfFile ? inPrivateAnonymous : frame != 0 && frame == zeroFrame)) {
+        return std::nullopt; // the huge zero page shows as a file's, the ordinary one by its frame
+    }
+    return isOfFile ? PageKind::object : isPresent ? PageKind::anonymous : PageKind::swapped;
+}
 
 } // namespace tally::platform

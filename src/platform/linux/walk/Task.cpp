@@ -122,7 +122,8 @@ const Walk* Task::walk(kern_return_t* status) {
         if (isSecondTenant() && compareAddressSpaces(owner_.pid, identity_.pid) != 0) {
             owner_ = identity_; // it has loaded another program since
         }
-        Walk::Result result = Walk::read(identity_, key_, owner_, !accountingSwitchIsOn());
+        Walk::Result result =
+            Walk::read(identity_, key_, owner_, !accountingSwitchIsOn(), std::exchange(status_, {}));
         *status = result.status;
         walk_ = std::move(result.walk);
         for (std::string& notice : result.notices) {

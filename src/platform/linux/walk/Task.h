@@ -4,10 +4,12 @@
 
 #include "platform/kern_return.h"
 #include "platform/linux/families/Families.h"
+#include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/Walk.h"
 
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <string>
 #include <utility>
 #include <vector>
@@ -41,6 +43,8 @@ class Task {
     /// @return null with `*status` when the address space cannot be read.
     const Walk* walk(kern_return_t* status);
     void endWalk() { walk_.reset(); }
+    /// Keeps what was just read of the process's status, for the walk that follows.
+    void noteStatus(const ProcessStatus& status) { status_ = status; }
     std::vector<std::string> takeNotices();
 
   private:
@@ -48,6 +52,7 @@ class Task {
     FamilyKey key_;
     MemberIdentity owner_; // of the address space
     std::shared_ptr<Corpse> corpse_;
+    std::optional<ProcessStatus> status_;
     std::unique_ptr<const Walk> walk_;
     std::vector<std::string> notices_;
     std::vector<std::string> given_; // notices that were given once already

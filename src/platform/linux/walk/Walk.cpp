@@ -20,8 +20,10 @@ namespace tally::platform {
 namespace {
 
 /// Finds out which figures that only smaps tells the process can have at all.
-WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView, const std::string& folder) {
-    const ProcessStatus status = decodeStatus(readSystemRecord(folder + "/status").value_or(""));
+WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView, const std::string& folder,
+                      const std::optional<ProcessStatus>& known) {
+    const ProcessStatus status =
+        known ? *known : decodeStatus(readSystemRecord(folder + "/status").value_or(""));
     const MachineState machine = machineState();
     WalkFacts facts{.owner = owner, .objectView = objectView, .swapInUse = machine.swapInUse};
     facts.asksLocked = status.locked != 0;
@@ -61,7 +63,8 @@ constexpr const char* sharingNotice =
 
 } // namespace
 
-Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView) {
+Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView,
+                        std::optional<ProcessStatus> known) {
     Result result;
     std::optional<AddressSpace> withRelatives = takeFamilySpace(key, owner);
     if (withRelatives && withRelatives->status == KERN_FAILURE) {
@@ -78,7 +81,7 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
         walk->statusPastEnd_ = space.status;
         space.mappings.resize(space.states.mappings.size());
     }
-    const WalkFacts facts = gatherFacts(task, owner, objectView, space.folder);
+    const WalkFacts facts = gatherFacts(task, owner, objectView, space.folder, known);
     SmapsOfProcess smaps(space.folder);
     PieceBuilder builder(facts, space, smaps);
     for (std::size_t i = 0; i < space.mappings.size(); ++i) {

@@ -9,11 +9,13 @@
 #include "platform/linux/families/FamilyKey.h"
 #include "platform/linux/families/SharedParts.h"
 #include "platform/linux/pieces/Piece.h"
+#include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/Mapping.h"
 
 #include <array>
 #include <cstdint>
 #include <memory>
+#include <optional>
 #include <span>
 #include <string>
 #include <vector>
@@ -31,7 +33,9 @@ class Walk {
     /// Reads the address space of `task`, with its relatives when a gather measures some.
     /// @param owner who stands for the address space: the task, or one that shares it whole.
     /// @param objectView counts as the VM objects see it instead of as charged to the task.
-    static Result read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView);
+    /// @param known its status, where that was just read.
+    static Result read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView,
+                       std::optional<ProcessStatus> known = {});
 
     /// The first piece that ends above `address`; null when there is none.
     const Piece* pieceAt(std::uint64_t address) const;
