@@ -1,5 +1,6 @@
 #include "base/Format.h"
 
+#include <algorithm>
 #include <cstdarg>
 #include <cstdint>
 #include <cstdio>
@@ -45,12 +46,23 @@ std::size_t utf8SequenceLength(std::string_view text) {
     return character < leastOfLength[length] || isSurrogate || character > 0x10ffff ? 0 : length;
 }
 
+bool isUTF8(std::string_view text) {
+    while (!text.empty()) {
+        const std::size_t length = utf8SequenceLength(text);
+        if (length == 0) {
+            return false;
+        }
+        text.remove_prefix(length);
+    }
+    return true;
+}
+
 namespace {
 
 bool isControl(std::string_view sequence) {
     const auto first = static_cast<unsigned char>(sequence[0]);
     if (sequence.size() == 1) {
-        return first < 0x20 || first == 0x7f || (first >= 0x80 && first <= 0x9f);
+        return first < 0x20 || first == 0x7f;
     }
     if (sequence.size() == 2) {
         return first == 0xc2 && static_cast<unsigned char>(sequence[1]) <= 0x9f;
@@ -67,13 +79,12 @@ std::string printable(std::string_view text) {
     safe.reserve(text.size());
     while (!text.empty()) {
         const std::size_t length = utf8SequenceLength(text);
-        const std::string_view sequence = text.substr(0, length == 0 ? 1 : length);
-        if (isControl(sequence)) {
+        if (length == 0 || isControl(text.substr(0, length))) {
             safe += '?';
         } else {
-            safe += sequence;
+            safe += text.substr(0, length);
         }
-        text.remove_prefix(sequence.size());
+        text.remove_prefix(std::max<std::size_t>(length, 1));
     }
     return safe;
 }

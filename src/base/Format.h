@@ -15,9 +15,12 @@ namespace tally {
 /// forms, surrogates and what lies beyond U+10FFFF are none.
 std::size_t utf8SequenceLength(std::string_view text);
 
-/// `text` with every control character replaced by "?": bytes below 0x20, 0x7f, and the C1 controls
-/// (U+0080 to U+009F, written in UTF-8 or as a lone byte), and marks that turn the direction of text. A name
-/// comes from another process and must not be able to drive the terminal that shows it.
+/// Whether all of `text` is UTF-8.
+bool isUTF8(std::string_view text);
+
+/// `text` with "?" for every control character (U+0000 to U+001F, U+007F to U+009F), every mark that turns
+/// the direction of text and every byte that is not UTF-8. A name comes from another process and must not be
+/// able to drive the terminal that shows it.
 std::string printable(std::string_view text);
 
 /// Writes `printable(message)` and a newline to standard error.

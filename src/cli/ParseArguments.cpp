@@ -48,16 +48,21 @@ std::optional<TLError> setSort(TLTallyArgs& args, const char* value) {
         accepted += (accepted.empty() ? "" : ", ") + name;
     }
     return failure(TLErrorBadSort, formatted("Unrecognized argument '%s' to --sort.\nAccepted arguments: %s",
-                                             value, accepted.c_str()));
+                                             printable(value).c_str(), accepted.c_str()));
 }
 
+/// Takes the number that `value` begins with.
 std::optional<TLError> addPid(TLTallyArgs& args, const char* value) {
     char* end = nullptr;
-    const long pid = std::strtol(value, &end, 10);
+    const long long pid = std::strtoll(value, &end, 10); // one that is too large becomes the largest
     if (end == value) {
         return failure(TLErrorBadPid, formatted("'%s' is not a valid integer for --pid.\n\nUse -p / --proc "
                                                 "if you meant to specify a process name.",
-                                                value));
+                                                printable(value).c_str()));
+    }
+    if (!std::in_range<std::int32_t>(pid)) {
+        return failure(TLErrorBadPid,
+                       formatted("'%s' is out of the range of pids.", printable(value).c_str()));
     }
     args.targetPids[static_cast<std::int32_t>(pid)] = std::nullopt;
     return std::nullopt;
@@ -78,7 +83,8 @@ double leadingDecimal(std::string_view text) {
 std::optional<TLError> setSampleInterval(TLTallyArgs& args, const char* value) {
     const double seconds = leadingDecimal(value);
     if (!std::isnormal(seconds) || seconds < 0) {
-        return failure(TLErrorBadInterval, formatted("Invalid sampling interval '%s'", value));
+        return failure(TLErrorBadInterval,
+                       formatted("Invalid sampling interval '%s'", printable(value).c_str()));
     }
     args.sampleInterval = seconds;
     return std::nullopt;

@@ -38,20 +38,21 @@ class ProcessNames {
     std::vector<std::optional<std::string>> names_;
 };
 
-/// Enters what `description` matches. @return whether it matches anything.
+/// Enters what `description` matches: every process of that name or, where none is called so, the one of that
+/// number. @return whether it matches anything.
 bool addMatches(TLTargetPids& matches, const std::string& description, std::span<const proc_bsdinfo> infos,
                 ProcessNames& names) {
-    const std::optional<std::int64_t> number = leadingInteger(description);
     bool isFound = false;
     for (std::size_t i = 0; i < infos.size(); ++i) {
-        const std::int32_t pid = pidOf(infos[i]);
         if (names[i] == description) {
-            matches[pid] = description;
+            matches[pidOf(infos[i])] = description;
             isFound = true;
-        } else if (number == pid) {
-            matches[pid] = std::nullopt;
-            return true;
         }
+    }
+    const std::optional<std::int64_t> number = leadingInteger(description);
+    if (!isFound && std::ranges::any_of(infos, [&](const auto& info) { return pidOf(info) == number; })) {
+        matches[static_cast<std::int32_t>(*number)] = std::nullopt;
+        isFound = true;
     }
     return isFound;
 }

@@ -43,9 +43,7 @@ Warnings were encountered while examining the process.
 Shared with be?ta [6]:
   Dirty      Clean  Reclaimable    Regions    Category
     ---        ---          ---        ---    ---
-    0 B      80 KB          0 B          2    lib?x .../café)"
-              "\xff"
-              R"(?
+    0 B      80 KB          0 B          2    lib?x .../café??
     ---        ---          ---        ---    ---
     0 B      80 KB          0 B          2    TOTAL
 
@@ -88,9 +86,7 @@ Summary Tally: 1024 KB (may be invalid due to errors)
   Dirty      Clean  Reclaimable    Regions    Category
     ---        ---          ---        ---    ---
 1024 KB      12 KB       4096 B          1    heap
-    0 B      80 KB          0 B          2    lib?x .../café)"
-              "\xff"
-              R"(?
+    0 B      80 KB          0 B          2    lib?x .../café??
     ---        ---          ---        ---    ---
 1024 KB     120 KB       4096 B          4    TOTAL
 

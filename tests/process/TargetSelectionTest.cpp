@@ -35,19 +35,19 @@ class TargetSelection : public testing::Test {
 
 TEST_F(TargetSelection, MatchesNamesThenPids) {
     for (const auto& [pid, name] :
-         {std::pair(10, "sh"), {20, "123"}, {30, "sh"}, {123, "server"}, {200, "123"}}) {
+         {std::pair(10, "sh"), {20, "123"}, {30, "sh"}, {123, "server"}, {200, "123"}, {300, "30zip"}}) {
         kernel.addTask({.pid = pid, .name = name});
     }
     const std::string missing = "Unable to find pid for process matching ";
     EXPECT_EQ(matchesOf({"Sh", "sh"}), "10:sh 30:sh " + missing + "'Sh' ");
-    // Process 20 is called so and the walk goes on; process 123 ends it, before 200.
-    EXPECT_EQ(matchesOf({"123"}), "20:123 123:- ");
+    EXPECT_EQ(matchesOf({"123"}), "20:123 200:123 ") << "names go before pids";
+    EXPECT_EQ(matchesOf({"30zip"}), "300:30zip ");
     EXPECT_EQ(matchesOf({"123abc", " +30", "-10"}), "30:- 123:- " + missing + "'-10' ");
     EXPECT_EQ(matchesOf({"30", "sh", "10"}), "10:- 30:sh ") << "the last description of a pid counts";
     EXPECT_EQ(matchesOf({"", "4294967306"}), missing + "'' " + missing + "'4294967306' ") << "2^32 + 10";
     const std::size_t before = kernel.callCount("sysctl_procargs2");
     matchesOf({"sh", "server", "no"});
-    EXPECT_EQ(kernel.callCount("sysctl_procargs2"), before + 5) << "a name is found out once";
+    EXPECT_EQ(kernel.callCount("sysctl_procargs2"), before + 6) << "a name is found out once";
 }
 
 TEST_F(TargetSelection, WorksOnAListThatMayChangeOrFail) {
