@@ -137,7 +137,11 @@ void TLTally::printReport(bool regionlistLikeOutput, bool summarize) {
     const TLMemoryTotals totals = totalsForCategories(summary);
     for (const auto& formatter : outputFormatters_) {
         formatter->printSummaryCategories(summary, totals, findings.hadErrors());
+    }
+    for (const auto& formatter : outputFormatters_) {
         formatter->printGlobalAuxData(findings.globalAuxData);
+    }
+    for (const auto& formatter : outputFormatters_) {
         formatter->endAtTime(gatherEndTime_);
     }
     for (auto& [region, subranges] : takenSubranges_) {

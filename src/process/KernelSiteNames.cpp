@@ -77,6 +77,9 @@ std::string nameOfCounter(std::uint64_t counter) {
     return prefix + (counter < std::size(counterNames) ? counterNames[counter] : std::to_string(counter));
 }
 
+/// Whether a name of the kernel is one: a text with characters.
+bool isReadable(const std::string& name) { return !name.empty() && isUTF8(name); }
+
 } // namespace
 
 std::string kernelName(const std::string& name) { return name.substr(0, NameFieldSize).c_str(); }
@@ -94,10 +97,12 @@ std::string KernelSiteNames::regionName(const mach_memory_site& site) const {
 }
 
 std::string KernelSiteNames::counterName(const mach_memory_site& site) const {
-    const bool isNamed = (site.flags & KernelSiteIsNamed) != 0;
-    const std::string name =
-        isNamed ? kernelName(site.name) : typeName(site.flags & KernelSiteTypeMask, site.site);
-    return name.empty() ? "unknown" : name;
+    if ((site.flags & KernelSiteIsNamed) != 0) {
+        if (std::string name = kernelName(site.name); isReadable(name)) {
+            return name;
+        }
+    }
+    return typeName(site.flags & KernelSiteTypeMask, site.site);
 }
 
 std::string KernelSiteNames::typeName(std::uint64_t type, std::uint64_t site) const {
@@ -106,11 +111,13 @@ std::string KernelSiteNames::typeName(std::uint64_t type, std::uint64_t site) co
         return tagName(site);
     case KernelSiteIsModule: {
         const auto module = modules_.find(site);
-        return module == modules_.end() ? formatted("unloaded kmod %" PRIu64, site) : module->second;
+        return module != modules_.end() && isReadable(module->second)
+                   ? module->second
+                   : formatted("unloaded kmod %" PRIu64, site);
     }
     case KernelSiteIsCode: {
         const auto symbol = site != 0 && symbolicator_ ? symbolicator_->symbolName(site) : std::nullopt;
-        return symbol ? *symbol : formatted("site 0x%" PRIx64, site);
+        return symbol && isReadable(*symbol) ? *symbol : formatted("site 0x%" PRIx64, site);
     }
     case KernelSiteIsCounter:
         return nameOfCounter(site);

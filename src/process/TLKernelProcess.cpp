@@ -20,8 +20,9 @@ constexpr std::uint64_t SiteObject = std::uint64_t{1} << 32;
 
 TLMemoryRegion regionOfZone(const mach_zone_info& zone, const std::string& name, std::size_t index) {
     const std::uint64_t inUse = zone.elements_in_use * zone.element_size;
+    const std::string known = kernelName(name);
     TLMemoryRegion region;
-    region.name = Name(kernelName(name));
+    region.name = Name(isUTF8(known) ? known : "unknown");
     region.size = zone.current_size;
     region.dirtySize = zone.collectable == 0 ? zone.current_size : std::min(inUse, zone.current_size);
     region.reclaimableSize = zone.current_size - region.dirtySize;

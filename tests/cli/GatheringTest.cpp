@@ -58,13 +58,16 @@ TEST(ThreadGather, AnInterruptStartsNoMore) {
             ++gathered;
             *earlyExit = true;
         }));
+        for (const auto& process : tally.processes()) {
+            process->setHiddenFromDisplay(process->pid() < 3 || process->pid() == 4);
+        }
         earlyExit = &tally.earlyExit;
         tally.earlyExit = beforeTheGather;
         EXPECT_TRUE(tally.gatherAllProcesses());
         EXPECT_EQ(gathered == 0, beforeTheGather);
         EXPECT_LT(gathered, 2500);
         for (const auto& process : tally.processes()) {
-            EXPECT_EQ(process->globalErrors().size(), process->pid() == 1 ? 1 : 0) << process->pid();
+            EXPECT_EQ(process->globalErrors().size(), process->pid() == 3 ? 1 : 0) << process->pid();
         }
         EXPECT_TRUE(tally.gatherEndTime());
     }

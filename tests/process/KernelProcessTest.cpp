@@ -45,17 +45,18 @@ class KernelProcess : public testing::Test {
 
 TEST_F(KernelProcess, ZonesAreDirtyButForWhatTheyCanGiveBack) {
     const std::string longName(90, 'z');
-    kernel.memory.zone_names = {"fixed", "collectable", "racing", longName, std::string("cut\0off", 7),
-                                "extra"};
+    kernel.memory.zone_names = {"fixed",       "collectable", "racing", longName, std::string("cut\0off", 7),
+                                "no\xff text", "extra"};
     kernel.memory.zones = {
         {.elements_in_use = 1, .current_size = 65536, .element_size = 64},
         {.elements_in_use = 10, .current_size = 4096, .element_size = 64, .collectable = 7},
         {.elements_in_use = 99, .current_size = 4096, .element_size = 64, .collectable = 1},
         {.current_size = 1},
-        {.current_size = 2}};
-    EXPECT_EQ(gathered(), (std::vector<std::string>{"fixed d65536 c0 r0", "collectable d640 c0 r3456",
-                                                    "racing d4096 c0 r0",
-                                                    longName.substr(0, 80) + " d1 c0 r0", "cut d2 c0 r0"}));
+        {.current_size = 2},
+        {.current_size = 3}};
+    EXPECT_EQ(gathered(), (std::vector<std::string>{
+                              "fixed d65536 c0 r0", "collectable d640 c0 r3456", "racing d4096 c0 r0",
+                              longName.substr(0, 80) + " d1 c0 r0", "cut d2 c0 r0", "unknown d3 c0 r0"}));
     EXPECT_EQ(process->memoryRegions()[1].object_id, 0x2'0000'0001U);
     EXPECT_EQ(process->memoryRegions()[1].size, 4096U);
     EXPECT_EQ(process->displayString(), "kernel [0]");
@@ -64,9 +65,10 @@ TEST_F(KernelProcess, ZonesAreDirtyButForWhatTheyCanGiveBack) {
 
 TEST_F(KernelProcess, SitesAreDirtyOnlyWhereNothingElseCountsThem) {
     kernel.memory.zone_names = {"a", "b", "c", "zone3"};
-    kernel.loadedModules = {{5, "net.driver"}, {6, ""}};
+    kernel.loadedModules = {{5, "net.driver"}, {6, ""}, {8, "\xff"}};
     kernel.kernelSymbols = {{{.start = 0x8000, .size = 0x100, .name = "alloc", .source{{"mm/alloc.c", 12}}},
-                             {.start = 0x9000, .size = 0x100, .name = "free"}}};
+                             {.start = 0x9000, .size = 0x100, .name = "free"},
+                             {.start = 0xB000, .size = 0x100, .name = ""}}};
     const std::pair<mach_memory_site, std::string> cases[] = {
         {{.flags = wired, .site = 13, .size = 8192, .mapped = 1}, "VM_KERN_MEMORY_KALLOC d8192 c0 r0 w"},
         {{.flags = 0, .site = 13, .size = 8192}, "VM_KERN_MEMORY_KALLOC d0 c8192 r0"},
@@ -80,12 +82,14 @@ TEST_F(KernelProcess, SitesAreDirtyOnlyWhereNothingElseCountsThem) {
         {{.flags = wired, .site = 40, .size = 8}, "VM_KERN_MEMORY_40 d8 c0 r0 w"},
         {{.flags = wired, .site = 255, .size = 8}, "VM_KERN_MEMORY_ANY d8 c0 r0 w"},
         {{.flags = wired | 1, .site = 5, .size = 8}, "net.driver d8 c0 r0 w"},
-        {{.flags = wired | 1, .site = 6, .size = 8}, "unknown d8 c0 r0 w"},
+        {{.flags = wired | 1, .site = 6, .size = 8}, "unloaded kmod 6 d8 c0 r0 w"},
         {{.flags = wired | 1, .site = 7, .size = 8}, "unloaded kmod 7 d8 c0 r0 w"},
+        {{.flags = wired | 1, .site = 8, .size = 8}, "unloaded kmod 8 d8 c0 r0 w"},
         {{.flags = wired | 2, .site = 0x80ff, .size = 8}, "alloc (mm/alloc.c:12) d8 c0 r0 w"},
         {{.flags = hidden | 2, .site = 0x8000, .size = 8}, "alloc (mm/alloc.c:12) d0 c8 r0"},
         {{.flags = wired | 2, .site = 0x9000, .size = 8}, "free d8 c0 r0 w"},
         {{.flags = wired | 2, .site = 0xA000, .size = 8}, "site 0xa000 d8 c0 r0 w"},
+        {{.flags = wired | 2, .site = 0xB000, .size = 8}, "site 0xb000 d8 c0 r0 w"},
         {{.flags = wired | 2, .site = 0, .size = 8}, "site 0x0 d8 c0 r0 w"},
         {{.flags = wired | 3, .site = 6, .size = 8}, "VM_KERN_COUNT_MAP_KERNEL d8 c0 r0 w"},
         {{.flags = ofZone | 3, .site = 20, .size = 8, .zone = 1}, "VM_KERN_COUNT_20[b] d0 c8 r0"},
@@ -93,6 +97,8 @@ TEST_F(KernelProcess, SitesAreDirtyOnlyWhereNothingElseCountsThem) {
         {{.flags = named | ofZone, .site = 1, .size = 8, .zone = 3, .name = "foo"}, "foo[zone3] d0 c8 r0"},
         {{.flags = named | ofZone, .site = 1, .size = 8, .zone = 4, .name = "foo"}, "foo d0 c8 r0"},
         {{.flags = named, .site = 1, .size = 8, .zone = 3, .name = "foo"}, "foo d0 c8 r0"},
+        {{.flags = named, .site = 1, .size = 8, .name = ""}, "VM_KERN_MEMORY_OSFMK d0 c8 r0"},
+        {{.flags = named | 1, .site = 5, .size = 8, .name = "\xff"}, "net.driver d0 c8 r0"},
     };
     for (const auto& [site, line] : cases) {
         EXPECT_EQ(only(site), line);
