@@ -2,6 +2,8 @@
 
 #include "analysis/TLTally.h"
 #include "base/Format.h"
+#include "cli/OutputFiles.h"
+#include "platform/output_file.h"
 #include "platform/quarry.h"
 #include "platform/system.h"
 #include "process/SnapshotCapture.h"
@@ -11,8 +13,6 @@
 #include <array>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
-#include <filesystem>
 #include <optional>
 #include <string>
 #include <system_error>
@@ -123,19 +123,20 @@ std::string defaultFile(const TLProcess& process) {
 }
 
 bool writeFile(const std::string& path, const std::string& contents) {
-    std::FILE* const file = std::fopen(path.c_str(), "wb");
-    const bool isWritten =
-        file != nullptr && std::fwrite(contents.data(), 1, contents.size(), file) == contents.size();
-    const bool isClosed = file != nullptr && std::fclose(file) == 0;
-    if (!isWritten || !isClosed) {
-        std::fprintf(stderr, "Unable to write %s: %s\n", printable(path).c_str(), std::strerror(errno));
-        std::error_code ignored;
-        const auto status = std::filesystem::symlink_status(path, ignored);
-        if (file != nullptr && std::filesystem::is_regular_file(status)) {
-            std::filesystem::remove(path, ignored); // half a snapshot is of no use
-        }
+    const std::unique_ptr<OutputFile> file = OutputFile::open(path);
+    int error = errno;
+    if (file) {
+        file->write(contents);
+        error = file->close();
     }
-    return isWritten && isClosed;
+    if (file && error == 0) {
+        return true;
+    }
+    printLineToStandardError("Unable to write " + path + ": " + std::generic_category().message(error));
+    if (file) {
+        file->discard(); // half a snapshot is of no use
+    }
+    return false;
 }
 
 } // namespace
@@ -159,6 +160,10 @@ int runHeapsnap(int argc, char** argv) {
         return 1;
     }
     const std::string path = args->file.empty() ? defaultFile(*process) : args->file;
+    if (processThatMaps(path, {{process}})) {
+        printLineToStandardError(process->displayString() + " maps " + path + ", which is not written");
+        return 1;
+    }
     if (!writeFile(path, contents)) {
         return 1;
     }

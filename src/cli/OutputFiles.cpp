@@ -4,21 +4,59 @@
 #include "output/TLOutputFormatterBenchlog.h"
 #include "output/TLOutputFormatterJSON.h"
 #include "output/TLOutputFormatterText.h"
-#include "platform/output_file.h"
 
 #include <algorithm>
 #include <cstdio>
-#include <new>
 #include <system_error>
 #include <utility>
 
 namespace tally {
 
+namespace {
+
+/// Whether `output` is asked for and none of the snapshots that are read. A message has gone to standard
+/// error otherwise.
+bool isNoInput(const std::optional<std::string>& output, const TLTallyArgs& args) {
+    const bool isInput =
+        output && std::ranges::any_of(args.potentialTargetProcesses, [&](const std::string& text) {
+            return platform::isOneFile(*output, text);
+        });
+    if (isInput) {
+        printLineToStandardError("What is to be read cannot be written to: " + *output);
+    }
+    return !isInput;
+}
+
+} // namespace
+
+std::shared_ptr<TLProcess> processThatMaps(const std::string& path,
+                                           std::span<const std::shared_ptr<TLProcess>> processes) {
+    const std::optional<platform::FileInMemory> file = platform::fileInMemory(path);
+    if (!file) {
+        return nullptr;
+    }
+    // Of what is untouched only the path is known.
+    const Name name(file->path);
+    const auto showsFile = [&](const TLMemoryRegion& region) {
+        return region.object_id == file->object || region.detailedName == name;
+    };
+    const auto found = std::ranges::find_if(processes, [&](const std::shared_ptr<TLProcess>& process) {
+        return std::ranges::any_of(process->memoryRegions(), showsFile);
+    });
+    return found == processes.end() ? nullptr : *found;
+}
+
 bool OutputFiles::create(const TLTallyArgs& args) {
-    auto* text =
-        new (std::nothrow) TLOutputFormatterText(args.summaryFormat, args.textOptions, args.textSort);
-    if (!add(std::shared_ptr<TLOutputFormatter>(text))) {
+    try {
+        text_ = std::make_unique<platform::StandardOutput>();
+        add(std::make_shared<TLOutputFormatterText>(args.summaryFormat, args.textOptions, args.textSort,
+                                                    text_->stream()));
+    } catch (const std::bad_alloc&) {
         std::fputs("Unable to initialize text output\n", stderr);
+        return false;
+    }
+    const bool isInputKept = isNoInput(args.JSONOutputFile, args) && isNoInput(args.benchlogOutputFile, args);
+    if (!isInputKept) {
         return false;
     }
     if (args.JSONOutputFile &&
@@ -55,14 +93,38 @@ bool OutputFiles::hasFiles() const {
     return std::ranges::any_of(paths_, [](const std::string& path) { return !path.empty(); });
 }
 
+void OutputFiles::leaveOutMapped(std::span<const std::shared_ptr<TLProcess>> processes) {
+    for (std::size_t i = formatters_.size(); i-- > 0;) {
+        const auto mapper = paths_[i].empty() ? nullptr : processThatMaps(paths_[i], processes);
+        if (mapper) {
+            printLineToStandardError(mapper->displayString() + " maps " + paths_[i] +
+                                     ", which is not written");
+            formatters_.erase(formatters_.begin() + static_cast<std::ptrdiff_t>(i));
+            paths_.erase(paths_.begin() + static_cast<std::ptrdiff_t>(i));
+            isLeftOut_ = true;
+        }
+    }
+}
+
+void OutputFiles::stopWaitingForReader() const {
+    if (text_) {
+        text_->stopWaiting();
+    }
+}
+
 bool OutputFiles::close() const {
-    bool isComplete = true;
+    bool isComplete = !isLeftOut_;
     for (std::size_t i = 0; i < formatters_.size(); ++i) {
         if (const int error = formatters_[i]->close(); error != 0) {
             isComplete = false;
             printLineToStandardError("Unable to write all of " + paths_[i] +
                                      ", which is incomplete: " + std::generic_category().message(error));
         }
+    }
+    if (const int error = text_ ? text_->error() : 0; error != 0) {
+        isComplete = false;
+        printLineToStandardError("Unable to write all of the report to standard output: " +
+                                 std::generic_category().message(error));
     }
     return isComplete;
 }

@@ -1,18 +1,27 @@
 // The formatters of one run, and what becomes of the files that they write.
 //
-// A file is made with its formatter, before the targets are known, and must not survive a run that fails. A
-// file whose formatter was never made is not ours.
+// A file is opened with its formatter, before the targets are known, and emptied only when there is a report
+// to write. It must not be what the run reads or measures. One that this run has made does not survive a run
+// that fails.
 
 #pragma once
 
 #include "cli/TLTallyArgs.h"
 #include "output/protocol/TLOutputFormatter.h"
+#include "platform/output_file.h"
+#include "process/TLProcess.h"
 
 #include <memory>
+#include <span>
 #include <string>
 #include <vector>
 
 namespace tally {
+
+/// The first of `processes`, gathered ones, that maps the file of `path`; null when none does, or there is no
+/// such file.
+std::shared_ptr<TLProcess> processThatMaps(const std::string& path,
+                                           std::span<const std::shared_ptr<TLProcess>> processes);
 
 class OutputFiles {
   public:
@@ -30,17 +39,24 @@ class OutputFiles {
     const Formatters& formatters() const { return formatters_; }
     /// Whether some formatter writes to a file.
     bool hasFiles() const;
-    /// Tells every formatter that no report follows. @return whether all they were told is in their files; a
-    /// message per file has gone to standard error otherwise.
+    /// Leaves out, with a message, every file that one of `processes`, gathered ones, maps: emptying it would
+    /// change what is measured, or end it. Before the first report.
+    void leaveOutMapped(std::span<const std::shared_ptr<TLProcess>> processes);
+    /// Lets the text go once nobody reads it, so that the files are completed. From any thread.
+    void stopWaitingForReader() const;
+    /// Tells every formatter that no report follows. @return whether all they were told, and all of the text,
+    /// is where it belongs; a message per output has gone to standard error otherwise.
     bool close() const;
-    /// Deletes the files, as far as the formatters made them.
+    /// Deletes the files that this run has made.
     void discard() const;
 
   private:
     bool createBenchlog(const TLTallyArgs& args);
 
+    std::unique_ptr<platform::StandardOutput> text_; // null without a text formatter of ours
     Formatters formatters_;
     std::vector<std::string> paths_; // of the formatters' files; empty: standard output
+    bool isLeftOut_ = false;         // some file that was asked for
 };
 
 } // namespace tally

@@ -8,7 +8,9 @@
 #include "cli/Usage.h"
 #include "platform/system.h"
 
+#include <atomic>
 #include <cstdio>
+#include <memory>
 #include <utility>
 
 namespace tally {
@@ -40,43 +42,89 @@ TLTally::ProcessList buildTargets(TLTallyArgs& args) {
     return processesOf(*table);
 }
 
-void measureOnce(const TLTallyArgs& args, TLTally::ProcessList targets, const OutputFiles& outputs) {
-    TLTally tally(std::move(targets));
-    std::unique_ptr<platform::SignalSource> interrupts;
-    if (!platform::standardOutputIsTerminal()) {
-        const auto exitEarly = [&tally] {
-            tally.earlyExit = true;
-            std::fputs("Exiting early due to SIGINT\n", stderr);
-        };
-        // Whoever ends a run that writes files, by whichever signal, wants them whole.
-        interrupts = TLTally::installSigintHandler(
-            exitEarly, outputs.hasFiles() ? platform::InterruptSignals::sigintAndTermination
-                                          : platform::InterruptSignals::sigint);
+/// Whoever ends a run, by an interrupt or, where it writes files, by a signal that would end it, gets the
+/// report on what is gathered and whole files. At a terminal that begins with the report of a run that writes
+/// files.
+class Interrupts {
+  public:
+    Interrupts(TLTally& tally, const OutputFiles& outputs) : tally_(tally), outputs_(outputs) {
+        if (!platform::standardOutputIsTerminal()) {
+            listen();
+        }
     }
+    ~Interrupts() { stopListening(); }
+    Interrupts(const Interrupts&) = delete;
+    Interrupts& operator=(const Interrupts&) = delete;
+
+    void beginReport() {
+        isGathered_ = true;
+        if (!hasFiles_) {
+            stopListening();
+        } else if (!source_) {
+            listen();
+        }
+    }
+
+  private:
+    void listen() {
+        source_ = TLTally::installSigintHandler([this] { meet(); },
+                                                hasFiles_ ? platform::InterruptSignals::sigintAndTermination
+                                                          : platform::InterruptSignals::sigint);
+    }
+    void stopListening() {
+        if (source_) {
+            source_->cancel();
+            platform::restoreDefaultInterruptAction();
+            source_.reset();
+        }
+    }
+    void meet() {
+        if (hasFiles_) {
+            platform::restoreDefaultInterruptAction(); // the next signal ends the run
+            outputs_.stopWaitingForReader();
+        }
+        tally_.earlyExit = true;
+        std::fputs(isGathered_ ? "Finishing the output files\n" : "Exiting early due to SIGINT\n", stderr);
+    }
+
+    TLTally& tally_;
+    const OutputFiles& outputs_;
+    const bool hasFiles_ = outputs_.hasFiles();
+    std::atomic<bool> isGathered_ = false;
+    std::unique_ptr<platform::SignalSource> source_;
+};
+
+/// @return whether all of the report is where it belongs.
+bool measureOnce(const TLTallyArgs& args, TLTally::ProcessList targets, OutputFiles& outputs) {
+    TLTally tally(std::move(targets));
+    Interrupts interrupts(tally, outputs);
     tally.gatherAllProcesses();
     tally.analyzeMemoryObjects();
-    if (interrupts) {
-        interrupts->cancel();
-        platform::restoreDefaultInterruptAction();
-    }
+    interrupts.beginReport();
+    outputs.leaveOutMapped(tally.processes());
     for (const auto& formatter : outputs.formatters()) {
         tally.addOutputFormatter(formatter);
     }
     tally.printReport(args.regionlistLikeOutput, args.summarize);
+    return outputs.close();
 }
 
-/// Measures what `args` ask for, into `outputs`. @return whether there was something to report.
-bool measure(TLTallyArgs& args, const OutputFiles& outputs) {
+/// Measures what `args` ask for, into `outputs`. @return whether all of it could be told.
+bool measure(TLTallyArgs& args, OutputFiles& outputs) {
     TLTally::ProcessList targets = buildTargets(args);
     if (targets.empty()) {
+        outputs.discard();
         return false;
     }
-    if (args.sampleInterval != 0) {
-        targets.clear(); // every sample has its own
-        return runSampling(args, outputs);
+    if (args.sampleInterval == 0) {
+        return measureOnce(args, std::move(targets), outputs);
     }
-    measureOnce(args, std::move(targets), outputs);
-    return true;
+    targets.clear(); // every sample has its own
+    if (!runSampling(args, outputs)) {
+        outputs.discard();
+        return false;
+    }
+    return outputs.close();
 }
 
 } // namespace
@@ -98,11 +146,11 @@ int runTally(int argc, char** argv) {
         return 1;
     }
     OutputFiles outputs;
-    if (!outputs.create(args) || !measure(args, outputs)) {
+    if (!outputs.create(args)) {
         outputs.discard();
         return 1;
     }
-    return outputs.close() ? 0 : 1;
+    return measure(args, outputs) ? 0 : 1;
 }
 
 } // namespace tally

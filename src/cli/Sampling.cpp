@@ -68,14 +68,14 @@ void carryUnchangedOver(const TLTally& last, TLProcessTable& targets) {
 class Sampler {
   public:
     /// Throws std::system_error when the system refuses a thread or a timer.
-    Sampler(TLTallyArgs& args, const OutputFiles& outputs);
+    Sampler(TLTallyArgs& args, OutputFiles& outputs);
 
     void run();
 
   private:
     void takeSample(std::uint64_t ticks);
     void stretchInterval(std::uint64_t now);
-    void report(TLTally& tally) const;
+    void report(TLTally& tally);
     void stop();
 
     std::shared_ptr<TLTally> lastTally() {
@@ -83,10 +83,12 @@ class Sampler {
         return lastTally_.lock();
     }
 
-    TLTallyArgs& args_; // of the timer's queue
-    const OutputFiles& outputs_;
+    TLTallyArgs& args_;    // of the timer's queue
+    OutputFiles& outputs_; // of the analysis queue, once there is a sample
+    bool hasReported_ = false;
     const bool regionlistLikeOutput_ = args_.regionlistLikeOutput;
     const bool summarize_ = args_.summarize;
+    const bool hasFiles_ = outputs_.hasFiles();
 
     std::uint64_t interval_ = nanoseconds(args_.sampleInterval); // only grows
     const std::uint64_t leeway_ = std::min(interval_, static_cast<std::uint64_t>(nanosecondsPerSecond)) / 2;
@@ -105,7 +107,7 @@ class Sampler {
         dispatch_source_timer(timerQueue_, [this](std::uint64_t ticks) { takeSample(ticks); });
 };
 
-Sampler::Sampler(TLTallyArgs& args, const OutputFiles& outputs) : args_(args), outputs_(outputs) {
+Sampler::Sampler(TLTallyArgs& args, OutputFiles& outputs) : args_(args), outputs_(outputs) {
     if (!timer_) {
         throw std::system_error(errno, std::generic_category());
     }
@@ -123,7 +125,7 @@ void Sampler::run() {
                          formatter->className());
         }
     }
-    if (!outputs_.hasFiles()) { // nothing is left to sample for where nobody reads the text
+    if (!hasFiles_) { // nothing is left to sample for where nobody reads the text
         endWithClosedPipe();
     }
     timer_->setTimer(0, interval_, leeway_);
@@ -142,6 +144,9 @@ void Sampler::run() {
 void Sampler::stop() {
     timer_->cancel();
     isStopping_ = true;
+    if (hasFiles_) {
+        outputs_.stopWaitingForReader();
+    }
     freePlaces_.signal(); // a sample may be waiting for one
     if (const std::shared_ptr<TLTally> last = lastTally()) {
         last->earlyExit = true;
@@ -193,8 +198,11 @@ void Sampler::takeSample(std::uint64_t ticks) {
     }
 }
 
-void Sampler::report(TLTally& tally) const {
+void Sampler::report(TLTally& tally) {
     tally.analyzeMemoryObjects();
+    if (!std::exchange(hasReported_, true)) {
+        outputs_.leaveOutMapped(tally.processes());
+    }
     for (const auto& formatter : outputs_.formatters()) {
         tally.addOutputFormatter(formatter);
     }
@@ -203,7 +211,7 @@ void Sampler::report(TLTally& tally) const {
 
 } // namespace
 
-bool runSampling(TLTallyArgs& args, const OutputFiles& outputs) {
+bool runSampling(TLTallyArgs& args, OutputFiles& outputs) {
     std::unique_ptr<Sampler> sampler;
     try {
         sampler = std::make_unique<Sampler>(args, outputs);

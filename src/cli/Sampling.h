@@ -13,6 +13,6 @@ namespace tally {
 /// Measures every `args.sampleInterval` seconds into `outputs`, and returns after an interrupt, once
 /// everything gathered before it is reported. Each building of targets changes `args`.
 /// @return false, with a message, when the system refuses what sampling needs.
-bool runSampling(TLTallyArgs& args, const OutputFiles& outputs);
+bool runSampling(TLTallyArgs& args, OutputFiles& outputs);
 
 } // namespace tally

@@ -40,8 +40,8 @@ class OptionScanner {
 };
 
 /// To be called first: opens descriptors 0, 1 and 2 on the null device where they are closed, so that no file
-/// of ours takes their place, ignores the signal of a closed pipe, and has freed memory kept for what comes
-/// next.
+/// of ours takes their place, ignores the signals of a closed pipe and of a file that is too large, and has
+/// freed memory kept for what comes next.
 void prepareOwnProcess();
 /// Lets the signal of a closed pipe end the program again.
 void endWithClosedPipe();

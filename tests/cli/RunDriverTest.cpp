@@ -82,5 +82,20 @@ TEST_F(RunDriver, TerminationEndsEarlyOnlyWhatWritesFiles) {
     }
 }
 
+TEST_F(RunDriver, AnInterruptOfTheReportFinishesTheFiles) {
+    for (const bool isTerminal : {false, true}) {
+        kernel.outputIsTerminal = isTerminal;
+        bool wasTaken = false;
+        kernel.before("fileInMemory", [&] {
+            wasTaken = kernel.terminate();
+            EXPECT_EQ(kernel.callCount("restoreDefaultInterruptAction"), isTerminal ? 3U : 1U)
+                << "the next one ends it";
+        });
+        EXPECT_EQ(run("server -j /dev/null"), 0);
+        EXPECT_TRUE(wasTaken);
+        EXPECT_EQ(messages, "Finishing the output files\n");
+    }
+}
+
 } // namespace
 } // namespace tally

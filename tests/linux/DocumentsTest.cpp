@@ -266,6 +266,18 @@ TEST(Documents, AreCompletedWhenNobodyReadsTheText) {
                  "until [ 0$(stat -c %s x.json) -gt 20000 ]; do sleep 0.1; done; kill -INT $(cat pid); "),
         "0\n");
     EXPECT_TRUE(nlohmann::json::accept(contentsOf(folder.path() + "/x.json")));
+
+    const Puppet many({"maps", "3000"}); // more text than a pipe holds
+    for (const char* signal : {"INT", "TERM", "HUP"}) {
+        run({"/bin/sh", "-c",
+             "rm -f status x.json; { " TALLY_PROGRAM
+             " -v -j x.json --pid $0 & echo $! >pid; wait $!; echo $? >status; } | "
+             "{ read line; kill -$1 $(cat pid); until [ -s status ]; do sleep 0.1; done; }",
+             pidOf(many), signal},
+            folder.path());
+        EXPECT_EQ(contentsOf(folder.path() + "/status"), "0\n") << signal;
+        EXPECT_TRUE(nlohmann::json::accept(contentsOf(folder.path() + "/x.json"))) << signal;
+    }
 }
 
 } // namespace

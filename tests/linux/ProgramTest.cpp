@@ -97,7 +97,26 @@ TEST(Program, ClosedStreamsAndAClosedPipeEndNothing) {
                   .status,
               1);
     EXPECT_EQ(run({"/bin/sh", "-c", "{ " + command + " -v; echo $? >&2; } | true"}).errors, "0\n");
-    EXPECT_EQ(run({"/bin/sh", "-c", command + " >/dev/full"}).status, 0);
+}
+
+TEST(Program, SaysWhatItCouldNotWrite) {
+    const Puppet puppet({"maps", "300"});
+    const TemporaryFolder folder;
+    const std::string command = std::string(TALLY_PROGRAM) + " -v --pid " + pidOf(puppet);
+    const std::string text = "Unable to write all of the report to standard output: ";
+    const std::pair<std::string, std::string> cases[] = {
+        {command + " >/dev/full", text + "No space left on device\n"},
+        {"ulimit -f 1; " + command + " >out", text + "File too large\n"},
+        {"ulimit -f 1; " + command + " -j x.json >/dev/null",
+         "Unable to write all of x.json, which is incomplete: File too large\n"},
+        {"ulimit -f 1; " HEAPSNAP_PROGRAM " -o x.heapsnap " + pidOf(puppet),
+         "Unable to write x.heapsnap: File too large\n"},
+    };
+    for (const auto& [line, errors] : cases) {
+        const Outcome outcome = run({"/bin/sh", "-c", line}, folder.path());
+        EXPECT_EQ(outcome.status, 1) << line;
+        EXPECT_EQ(outcome.errors, errors);
+    }
 }
 
 TEST(Program, ProcessesThatComeAndGoDisturbNothing) {

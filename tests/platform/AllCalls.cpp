@@ -80,6 +80,7 @@ namespace tally::platform {
     &RKResolvedPath,
     &RKCreateKernelSymbolicator,
     &OutputFile::open,
+    &fileInMemory,
     &isOneFile,
     &OptionScanner::next,
     &OptionScanner::argument,
@@ -94,6 +95,7 @@ namespace tally::platform {
 
 void makeAndDestroyEveryClass(int argc, char** argv) {
     const GatherScope gather;
+    const StandardOutput output;
     const OptionScanner scanner(argc, argv, "", {});
 }
 

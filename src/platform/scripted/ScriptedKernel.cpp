@@ -57,12 +57,13 @@ constexpr std::array<std::string_view, 35> callsThatCanFail{
     "task_take_notices",
     "vm_deallocate",
 };
-constexpr std::array<std::string_view, 14> callsThatCannot{
+constexpr std::array<std::string_view, 15> callsThatCannot{
     "GatherScope",
     "QRYTagForRegionTypeDescription",
     "clock_uptime_raw_approx_ns",
     "effectiveUserId",
     "endWithClosedPipe",
+    "fileInMemory",
     "hasInternalContent",
     "mach_timebase_info",
     "ownPid",

@@ -2,6 +2,7 @@
 
 #include "platform/clock.h"
 #include "platform/dispatch.h"
+#include "platform/output_file.h"
 #include "platform/system.h"
 
 #include "platform/scripted/Answer.h"
@@ -98,6 +99,20 @@ std::unique_ptr<TimerSource> dispatch_source_timer(SerialQueue& queue,
         return nullptr;
     }
     return std::make_unique<Timer>(answer.state, queue, std::move(handler));
+}
+
+std::optional<FileInMemory> fileInMemory(const std::string& path) {
+    const Answer answer("fileInMemory", -1, {}, path);
+    for (const auto& task : answer.state.tasks) {
+        std::uint64_t address = 0;
+        while (const ScriptedMapping* mapping = task->findMapping(address, 0).mapping) {
+            if (mapping->file == path) {
+                return FileInMemory{.path = path, .object = *mapping->object};
+            }
+            address = mapping->end();
+        }
+    }
+    return std::nullopt;
 }
 
 void prepareOwnProcess() { const Answer answer("prepareOwnProcess"); }

@@ -12,6 +12,8 @@
 #include <array>
 #include <cerrno>
 #include <cstdio>
+#include <filesystem>
+#include <system_error>
 #include <utility>
 
 namespace tally::platform {
@@ -59,8 +61,19 @@ class DescriptorFile : public OutputFile {
 
 class NamedFile final : public DescriptorFile {
   public:
-    NamedFile(Descriptor descriptor, std::string path)
-        : DescriptorFile(std::move(descriptor)), path_(std::move(path)) {}
+    /// @param madeAt where this run has made the file; empty when it was there before.
+    NamedFile(Descriptor descriptor, std::string madeAt)
+        : DescriptorFile(std::move(descriptor)), madeAt_(std::move(madeAt)) {
+        fstat(descriptor_.number(), &status_);
+    }
+
+    void write(std::string_view bytes) override {
+        if (!std::exchange(isEmptied_, true) && S_ISREG(status_.st_mode) &&
+            ftruncate(descriptor_.number(), 0) != 0) {
+            error_ = errno;
+        }
+        DescriptorFile::write(bytes);
+    }
 
     int close() override {
         // A file system on another machine may tell only now that there was no room.
@@ -69,16 +82,16 @@ class NamedFile final : public DescriptorFile {
     }
 
     void discard() override {
-        struct stat opened {};
         struct stat found {};
-        if (fstat(descriptor_.number(), &opened) == 0 && S_ISREG(opened.st_mode) &&
-            lstat(path_.c_str(), &found) == 0 && isSameFile(opened, found)) {
-            unlink(path_.c_str());
+        if (!madeAt_.empty() && lstat(madeAt_.c_str(), &found) == 0 && isSameFile(status_, found)) {
+            unlink(madeAt_.c_str());
         }
     }
 
   private:
-    std::string path_;
+    std::string madeAt_;
+    struct stat status_ {};
+    bool isEmptied_ = false;
 };
 
 /// Keeps the document in a file without a name until the standard output is complete.
@@ -104,6 +117,11 @@ class FollowingFile final : public DescriptorFile {
     void discard() override {}
 };
 
+std::string withoutLinks(const std::string& path) {
+    std::error_code ignored;
+    return std::filesystem::canonical(path, ignored);
+}
+
 Descriptor openUnnamedFile() {
     const std::unique_ptr<std::FILE, int (*)(std::FILE*)> file(std::tmpfile(), std::fclose);
     return Descriptor(file ? fcntl(fileno(file.get()), F_DUPFD_CLOEXEC, 0) : -1);
@@ -119,8 +137,15 @@ std::unique_ptr<OutputFile> OutputFile::open(const std::string& path) {
         return aside.isOpen() ? std::make_unique<FollowingFile>(std::move(aside)) : nullptr;
     }
     // Not for reading too: a FIFO would be opened before there is a reader, and what is in it then is lost.
-    Descriptor file(::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOCTTY, 0666));
-    return file.isOpen() ? std::make_unique<NamedFile>(std::move(file), path) : nullptr;
+    constexpr int flags = O_WRONLY | O_CREAT | O_CLOEXEC | O_NOCTTY;
+    Descriptor file(::open(path.c_str(), flags | O_EXCL, 0666));
+    bool isMade = file.isOpen();
+    if (!isMade && errno == EEXIST) {
+        isMade = stat(path.c_str(), &there) != 0 && errno == ENOENT; // a link to nothing yet
+        file = Descriptor(::open(path.c_str(), flags, 0666));
+    }
+    return file.isOpen() ? std::make_unique<NamedFile>(std::move(file), isMade ? withoutLinks(path) : "")
+                         : nullptr;
 }
 
 bool isOneFile(const std::string& a, const std::string& b) {

@@ -19,6 +19,7 @@ void prepareOwnProcess() {
         }
     }
     std::signal(SIGPIPE, SIG_IGN);
+    std::signal(SIGXFSZ, SIG_IGN); // a file that may not grow any more is an error of its writing
     // Tables of a large process grow and go one after the other. Given back and asked for again, each page of
     // theirs costs a fault: a fifth of the run for 100,000 mappings.
     mallopt(M_MMAP_THRESHOLD, 32 << 20); // the most that is allowed

@@ -1,0 +1,26 @@
+// Files as the mappings of processes show them.
+
+#include "platform/output_file.h"
+
+#include "platform/linux/objects/ObjectId.h"
+
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+
+#include <filesystem>
+#include <system_error>
+
+namespace tally::platform {
+
+std::optional<FileInMemory> fileInMemory(const std::string& path) {
+    struct stat status {};
+    if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
+        return std::nullopt;
+    }
+    std::error_code ignored;
+    const std::uint64_t device = std::uint64_t{major(status.st_dev)} << 32 | minor(status.st_dev);
+    return FileInMemory{.path = std::filesystem::canonical(path, ignored),
+                        .object = objectIdOfFile({.device = device, .inode = status.st_ino})};
+}
+
+} // namespace tally::platform
