@@ -146,7 +146,7 @@ GroupCategories categoriesForGroup(TLProcessGroup& group, const TLProcess& proce
         looksTheSameToAll = looksTheSameToAll && !object->hasProcessSpecificSizes();
         const auto category =
             categories->try_emplace(categoryKey(*object, summarize), TLMemoryCategory(summarize)).first;
-        category->second.addMemoryObject(std::move(view));
+        category->second.addViewOfObject(std::move(view), object);
     }
     constexpr std::size_t smallestCachedGroup = 26;
     const std::size_t memberCount = group.processes().size();

@@ -21,6 +21,14 @@ void TLMemoryCategory::addMemoryObject(std::shared_ptr<const TLMemoryObject> obj
     }
 }
 
+void TLMemoryCategory::addViewOfObject(std::shared_ptr<const TLMemoryObject> view,
+                                       const std::shared_ptr<const TLMemoryObject>& object) {
+    if (!firstMemoryObject_ && categoryKey(*view, isSummary_) != categoryKey(*object, isSummary_)) {
+        firstMemoryObject_ = object;
+    }
+    addMemoryObject(std::move(view));
+}
+
 Name TLMemoryCategory::name() const { return firstMemoryObject_ ? firstMemoryObject_->name() : Name(); }
 
 Name TLMemoryCategory::detailedName() const {

@@ -19,6 +19,10 @@ class TLMemoryCategory {
 
     /// Folds in one object, which may be null. The first one gives the category its names.
     void addMemoryObject(std::shared_ptr<const TLMemoryObject> object);
+    /// Folds in what a process sees of `object`, under whose key the category is filed. A view that bears
+    /// another name, since others call the memory otherwise, names no category.
+    void addViewOfObject(std::shared_ptr<const TLMemoryObject> view,
+                         const std::shared_ptr<const TLMemoryObject>& object);
 
     bool isSummary() const { return isSummary_; }
     /// Lives no longer than the measurement it comes from.

@@ -62,4 +62,18 @@ void appendJSONString(std::string& document, std::string_view text) {
     document += '"';
 }
 
+std::string DistinctKeys::keyFor(std::string_view name) {
+    const auto written = [](std::string_view text) {
+        std::string quoted;
+        appendJSONString(quoted, text);
+        return quoted;
+    };
+    const auto [met, isNew] = lastNumbers_.try_emplace(written(name), 1);
+    std::string key(name);
+    for (bool isTaken = !isNew; isTaken; isTaken = !lastNumbers_.try_emplace(written(key), 1).second) {
+        key = std::string(name) + " (" + std::to_string(++met->second) + ")";
+    }
+    return key;
+}
+
 } // namespace tally

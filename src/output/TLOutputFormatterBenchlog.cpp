@@ -37,12 +37,17 @@ TLOutputFormatterBenchlog::TLOutputFormatterBenchlog(BenchlogHandle writer) : wr
 
 void TLOutputFormatterBenchlog::addBytes(const std::string& metric, double bytes,
                                          const std::string& process) {
-    blwriter_new_value(*writer_, metric, blunit_B, bytes);
+    blwriter_new_value(*writer_, metrics_.keyFor(metric), blunit_B, bytes);
     blwriter_record_variable_str(*writer_, "process", process);
 }
 
-void TLOutputFormatterBenchlog::printProcessHeader(const TLProcess& process) {
+void TLOutputFormatterBenchlog::beginGroup() {
     blwriter_new_group(*writer_);
+    metrics_ = {};
+}
+
+void TLOutputFormatterBenchlog::printProcessHeader(const TLProcess& process) {
+    beginGroup();
     currentProcess_ = process.name();
 }
 
@@ -100,7 +105,7 @@ void TLOutputFormatterBenchlog::emitAuxEntries(const TLAuxDictionary& dictionary
 
 void TLOutputFormatterBenchlog::printSummaryCategories(const Categories& categories,
                                                        const TLMemoryTotals& total, bool /*hadErrors*/) {
-    blwriter_new_group(*writer_);
+    beginGroup();
     addBytes("total_memory", static_cast<double>(total.dirty + total.swapped), allProcesses);
     blwriter_record_tag(*writer_, bltag_summary);
     for (const auto& [key, category] : categories) {

@@ -5,6 +5,7 @@
 
 #pragma once
 
+#include "base/JSONString.h"
 #include "output/protocol/TLOutputFormatter.h"
 #include "output/protocol/TLTime.h"
 #include "platform/benchlog.h"
@@ -47,6 +48,7 @@ class TLOutputFormatterBenchlog final : public TLOutputFormatter {
     void discard() override { platform::blwriter_discard(std::move(writer_)); }
 
   private:
+    void beginGroup();
     void addCategoryTotals(const Categories& categories);
     void addBytes(const std::string& metric, double bytes, const std::string& process);
     void emitAuxData(const std::optional<TLAuxDictionary>& auxData, const std::string& process);
@@ -54,6 +56,7 @@ class TLOutputFormatterBenchlog final : public TLOutputFormatter {
                         const std::string& process);
 
     platform::BenchlogHandle writer_; // null once closed
+    DistinctKeys metrics_;            // of the group
     std::string currentProcess_;      // name of the process whose section is being told
     std::map<std::string, std::uint64_t> currentProcessTotals_; // its bytes, by category
     std::optional<TLTime> startTime_;

@@ -4,6 +4,7 @@
 
 #include "analysis/TLProcessGroup.h"
 #include "base/BatchEnumeration.h"
+#include "base/JSONString.h"
 #include "output/protocol/TLTime.h"
 #include "platform/clock.h"
 #include "process/TLProcess.h"
@@ -50,9 +51,10 @@ void writeSizes(JSONWriter& json, const TLMemoryTotals& sizes) {
     json.endObject();
 }
 
-void writeCategoryEntries(JSONWriter& json, const TLOutputFormatter::Categories& categories) {
+void writeCategoryEntries(JSONWriter& json, const TLOutputFormatter::Categories& categories,
+                          DistinctKeys keys = {}) {
     for (const auto& [key, category] : categories) {
-        json.key(category.fullName());
+        json.key(keys.keyFor(category.fullName()));
         writeSizes(json, {.dirty = category.totalDirtySize,
                           .swapped = category.totalSwappedSize,
                           .clean = category.totalCleanSize,
@@ -71,8 +73,9 @@ void writeCategories(JSONWriter& json, const TLOutputFormatter::Categories& cate
 
 void writeAuxDictionary(JSONWriter& json, const TLAuxDictionary& dictionary) {
     json.beginObject();
+    DistinctKeys keys;
     for (const auto& [key, datum] : dictionary.entries) {
-        json.key(key);
+        json.key(keys.keyFor(key));
         if (datum.isContainer()) {
             writeAuxDictionary(json, datum.dictionary());
         } else {
@@ -263,8 +266,10 @@ void TLOutputFormatterJSON::printProcessesWithWarnings(const Processes& processe
     }
     std::vector<std::string> warnings;
     for (const auto& process : processesWithWarnings) {
-        const std::vector<std::string>& own = process->warnings();
-        warnings.insert(warnings.end(), own.begin(), own.end());
+        const std::string& whose = process->displayString();
+        for (const std::string& text : process->warnings()) {
+            warnings.push_back(text.starts_with(whose) ? text : whose + ": " + text);
+        }
     }
     writeTexts(json_, "errors", errors);
     writeTexts(json_, "warnings", warnings);
@@ -274,8 +279,10 @@ void TLOutputFormatterJSON::printSummaryCategories(const Categories& categories,
                                                    bool /*hadErrors*/) {
     json_.key("summary");
     json_.beginObject();
-    writeCategoryEntries(json_, categories);
-    json_.key("total");
+    DistinctKeys keys;
+    const std::string sum = keys.keyFor("total"); // whatever a category is called
+    writeCategoryEntries(json_, categories, std::move(keys));
+    json_.key(sum);
     writeSizes(json_, total);
     json_.endObject();
     writeNumber(json_, "total tally", total.dirty + total.swapped);

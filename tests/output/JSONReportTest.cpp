@@ -95,7 +95,7 @@ TEST_F(JSONReport, WritesEveryKeyInItsOrder) {
             R"({"id":0,"name":"rest","addr":262144,"vsize":36864}],)"
             R"("tally":16384,"categories":{)" +
             categories +
-            R"(},"auxiliary":{"own":-5,"sum":{"peak":6}}}],"errors":[],"warnings":["no \"rights\""],"summary":{)" +
+            R"(},"auxiliary":{"own":-5,"sum":{"peak":6}}}],"errors":[],"warnings":["p [7]: no \"rights\""],"summary":{)" +
             categories +
             R"(,"total":{"dirty":16384,"swapped":4096,"clean":12288,"reclaimable":4096,"wired":12288,"regions":4}},)"
             R"("total tally":16384,"auxiliary":{"sum":{"peak":6}},"shared":[],"end_time":)" +
@@ -172,6 +172,34 @@ TEST_F(JSONReport, RecordsAGroupOnceAndEachViewOfItsOwn) {
     EXPECT_EQ(samples["samples"][1]["shared"].size(), 1U);
 }
 
+TEST_F(JSONReport, NoKeyIsThereTwice) {
+    // Names that read the same, and one that the summary has itself.
+    std::vector<RegionRecord> regions;
+    for (const char* name : {"a\xfe", "a\xff", "a\ufffd (2)", "total"}) {
+        regions.push_back(
+            {.name = name, .object = regions.size() + 1, .size = 9, .dirty = 1 + regions.size()});
+    }
+    const json names = json::parse(document({ready(1, regions)}))["summary"];
+    const std::pair<const char*, int> rows[] = {
+        {"a\ufffd (2)", 3}, {"a\ufffd", 1}, {"a\ufffd (3)", 2}, {"total (2)", 4}, {"total", 10}};
+    EXPECT_EQ(names.size(), std::size(rows)) << names;
+    for (const auto& [key, pages] : rows) {
+        EXPECT_EQ(names[key]["dirty"], pages * page) << key;
+    }
+    // Process 1 calls the second object "y", so that is its row's name for process 2 as well.
+    const auto part = [](const char* name, std::uint64_t object, std::uint64_t clean) {
+        return RegionRecord{
+            .name = name, .object = object, .size = 4, .clean = clean, .share_mode = platform::SM_SHARED};
+    };
+    const json views = json::parse(document(
+        {ready(1, {part("x", 1, 1), part("y", 2, 1)}), ready(2, {part("x", 1, 2), part("x", 2, 3)})}));
+    for (const json& view : views["shared"]) {
+        const bool isFirst = view["specific_to_pid"] == 1;
+        EXPECT_EQ(view["categories"]["x"]["clean"], (isFirst ? 1 : 2) * page);
+        EXPECT_EQ(view["categories"]["y"]["clean"], (isFirst ? 1 : 3) * page);
+    }
+}
+
 TEST_F(JSONReport, AProcessWithErrorsHasNoResults) {
     const auto failed = ready(3, {{.object = 1, .size = 1, .dirty = 1}});
     failed->addError("refused");
@@ -211,7 +239,7 @@ TEST_F(JSONReport, StaysValidWhateverTheNamesHold) {
         EXPECT_EQ(parsed["processes"][0]["name"], read);
         EXPECT_EQ(parsed["processes"][0]["regions"][0]["name"], read);
         EXPECT_TRUE(parsed["processes"][0]["categories"].contains(read));
-        EXPECT_EQ(parsed["warnings"][0], read);
+        EXPECT_EQ(parsed["processes"][0]["warnings"][0], read);
         EXPECT_TRUE(parsed["auxiliary"].contains(read));
         for (const char c : text) {
             EXPECT_TRUE(static_cast<unsigned char>(c) >= 0x20 && c != 0x7f) << "a control byte as it is";
