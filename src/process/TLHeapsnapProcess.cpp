@@ -5,11 +5,14 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cinttypes>
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <random>
 #include <string_view>
 #include <system_error>
+#include <unordered_map>
 #include <utility>
 
 namespace tally {
@@ -60,6 +63,42 @@ uuid_t randomUuid() {
     return uuid;
 }
 
+/// Which memory of VM objects the regions of one process have been charged for: a page that it maps twice
+/// counts at its first mapping only.
+class ChargedObjects {
+  public:
+    /// Charges for as much of `bytes` in [offset, offset + length) of `object` as can be there beside what is
+    /// charged for already. @return that much.
+    std::uint64_t charge(std::uint64_t object, std::uint64_t offset, std::uint64_t length,
+                         std::uint64_t bytes) {
+        std::map<std::uint64_t, Extent>& extents = extentsOf_[object];
+        Extent united{.end = offset + std::min(length, ~offset)}; // offsets of devices can be the highest
+        std::uint64_t start = offset;
+        auto next = extents.upper_bound(offset);
+        if (next != extents.begin() && std::prev(next)->second.end > offset) {
+            --next;
+        }
+        while (next != extents.end() && next->first < united.end) {
+            start = std::min(start, next->first);
+            united.end = std::max(united.end, next->second.end);
+            united.charged += next->second.charged;
+            next = extents.erase(next);
+        }
+        const std::uint64_t room = united.end - start - united.charged;
+        const std::uint64_t charged = std::min(bytes, room);
+        united.charged += charged;
+        extents.emplace(start, united);
+        return charged;
+    }
+
+  private:
+    struct Extent {
+        std::uint64_t end = 0;
+        std::uint64_t charged = 0; // bytes
+    };
+    std::unordered_map<std::uint64_t, std::map<std::uint64_t, Extent>> extentsOf_; // by object, by start
+};
+
 bool isPresetName(std::string_view type) {
     return type == "commpage (reserved)" || type == "GPU Carveout (reserved)";
 }
@@ -108,7 +147,18 @@ void TLHeapsnapProcess::_gatherPhysTally() {
 void TLHeapsnapProcess::enumerateRegions(const RegionCallback& callback) {
     static const Name sharedLinkedit("dyld shared cache");
     const TLSharedCache* const cache = sharedCache().get();
-    graph_->enumerateRegions([&](const QRYVMRegion& region) {
+    ChargedObjects charged;
+    std::uint64_t repeated = 0; // bytes
+    graph_->enumerateRegions([&](QRYVMRegion region) {
+        if (graph_->showsPhysTally() && region.object_id != 0 && region.object_id != TLNotSet) {
+            const std::uint64_t told = region.dirty_size + region.swapped_out_size;
+            const std::uint64_t own = charged.charge(region.object_id, region.offset, region.length, told);
+            const std::uint64_t dirty = std::min(region.dirty_size, own);
+            region.resident_size -= region.dirty_size - dirty;
+            region.dirty_size = dirty;
+            region.swapped_out_size = own - dirty;
+            repeated += told - own;
+        }
         const bool inCache = cache != nullptr && cache->contains(region.address);
         TLImage image;
         image.setName(region.type);
@@ -121,6 +171,11 @@ void TLHeapsnapProcess::enumerateRegions(const RegionCallback& callback) {
         }
         return callback(describe(region, inCache));
     });
+    if (repeated != 0) {
+        addWarning(displayString() +
+                   formatted(": %" PRIu64 " bytes of memory that is mapped several times are counted once",
+                             repeated));
+    }
 }
 
 /// A region as the kernel would describe it. Inside the shared cache counts stay bytes: there no page is

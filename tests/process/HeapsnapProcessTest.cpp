@@ -122,6 +122,41 @@ TEST_F(Heapsnap, RegionsAreNamedAndSizedAsTheWalkDoes) {
         << "as the object sees it";
 }
 
+TEST_F(Heapsnap, AnObjectIsChargedForItsPagesOnce) {
+    constexpr std::uint64_t page = 4096;
+    QRYSnapshot snapshot{.pid = 9, .processName = "saved", .architecture = "X86-64", .vmPageSize = page};
+    const auto add = [&](std::uint64_t offset, std::uint64_t dirty, std::uint64_t swapped,
+                         std::uint64_t object = 7) {
+        snapshot.regions.push_back({.address = (snapshot.regions.size() + 1) * 0x10000,
+                                    .length = 8 * page,
+                                    .type = Name("memory"),
+                                    .offset = offset * page,
+                                    .resident_size = (dirty + 1) * page,
+                                    .swapped_out_size = swapped * page,
+                                    .dirty_size = dirty * page,
+                                    .object_id = object});
+    };
+    add(8, 3, 2);           // pages 8 to 15
+    add(8, 2, 3);           // the same pages: room for 3
+    add(0, 5, 0);           // below them
+    add(4, 7, 0);           // across both, of which 3 are left
+    add(4, 7, 0, TLNotSet); // of an object that nobody else can have
+    add(1 << 20, 7, 0);     // far away
+    const std::uint64_t dirty[] = {3, 2, 5, 3, 7, 7};
+    const std::uint64_t swapped[] = {2, 1, 0, 0, 0, 0};
+    for (const bool asCharged : {true, false}) {
+        snapshot.showsPhysTally = asCharged;
+        linesOf(snapshot);
+        for (std::size_t i = 0; i < std::size(dirty) && asCharged; ++i) {
+            const TLMemoryRegion& region = process->memoryRegions()[i];
+            EXPECT_EQ(region.dirtySize, dirty[i] * page) << i;
+            EXPECT_EQ(region.swappedSize, swapped[i] * page) << i;
+            EXPECT_EQ(region.cleanNonSpecSize, page) << i;
+        }
+        EXPECT_EQ(process->warnings().size(), asCharged ? 1U : 0U);
+    }
+}
+
 TEST_F(Heapsnap, CountsInsideTheCacheAreBytes) {
     constexpr std::uint64_t page = 16384;
     const auto at = [&](std::uint64_t offset, std::uint64_t pages, const char* type) {

@@ -43,6 +43,9 @@ struct FlagKey {
 
 // Far above every address that can be mapped, and so small that two of them can be added.
 inline constexpr std::uint64_t snapshotHighest = std::uint64_t{1} << 62;
+inline constexpr std::uint64_t snapshotAnyNumber = std::numeric_limits<std::uint64_t>::max();
+// Regions count their pages in 32 bits.
+inline constexpr std::uint64_t snapshotMostPages = std::numeric_limits<std::uint32_t>::max();
 inline constexpr std::uint64_t snapshotMostTally = std::numeric_limits<std::int64_t>::max();
 
 inline constexpr NumberKey<QRYSnapshot> snapshotNumbers[] = {
@@ -62,7 +65,7 @@ inline constexpr NumberKey<QRYVMRegion> snapshotRegionNumbers[] = {
     numberKey<QRYVMRegion, &QRYVMRegion::length>("length", snapshotHighest, true),
     numberKey<QRYVMRegion, &QRYVMRegion::prot>("prot", 7),
     numberKey<QRYVMRegion, &QRYVMRegion::maxProt>("max_prot", 7),
-    numberKey<QRYVMRegion, &QRYVMRegion::offset>("offset", snapshotHighest),
+    numberKey<QRYVMRegion, &QRYVMRegion::offset>("offset", snapshotAnyNumber), // a device's can be anywhere
     numberKey<QRYVMRegion, &QRYVMRegion::user_tag>("user_tag", 0xFFFFFFFF),
     numberKey<QRYVMRegion, &QRYVMRegion::resident_size>("resident_size", snapshotHighest),
     numberKey<QRYVMRegion, &QRYVMRegion::shared_now_private_size>("shared_now_private_size", snapshotHighest),
@@ -72,7 +75,7 @@ inline constexpr NumberKey<QRYVMRegion> snapshotRegionNumbers[] = {
     numberKey<QRYVMRegion, &QRYVMRegion::ref_count>("ref_count", 0xFFFF),
     numberKey<QRYVMRegion, &QRYVMRegion::external_pager>("external_pager", 1),
     numberKey<QRYVMRegion, &QRYVMRegion::share_mode>("share_mode", 8),
-    numberKey<QRYVMRegion, &QRYVMRegion::object_id>("object_id", std::numeric_limits<std::uint64_t>::max()),
+    numberKey<QRYVMRegion, &QRYVMRegion::object_id>("object_id", snapshotAnyNumber),
     numberKey<QRYVMRegion, &QRYVMRegion::purgeable>("purgeable", 3),
 };
 inline constexpr FlagKey<QRYVMRegion> snapshotRegionFlags[] = {

@@ -284,8 +284,15 @@ bool SnapshotHandler::finishDocument() {
         return false;
     }
     constexpr std::uint32_t smallestPage = 512;
-    return (std::has_single_bit(snapshot_.vmPageSize) && snapshot_.vmPageSize >= smallestPage) ||
-           refuse("\"page_size\" is none");
+    if (!std::has_single_bit(snapshot_.vmPageSize) || snapshot_.vmPageSize < smallestPage) {
+        return refuse("\"page_size\" is none");
+    }
+    const std::uint64_t most = snapshotMostPages * snapshot_.vmPageSize;
+    return std::ranges::none_of(snapshot_.regions,
+                                [&](const QRYVMRegion& region) {
+                                    return region.resident_size > most || region.swapped_out_size > most;
+                                }) ||
+           refuse("a region has more pages than can be counted");
 }
 
 bool SnapshotHandler::start_array(std::size_t /*size*/) {

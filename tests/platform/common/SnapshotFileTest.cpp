@@ -218,6 +218,9 @@ TEST(SnapshotFile, ThatIsWrongSaysWhere) {
          "region 0: its sizes are larger than what they are a part of"},
         {documentWith(region(R"(,"resident_size":2,"dirty_size":1,"reusable_size":2)")),
          "region 0: its sizes are larger than what they are a part of"},
+        // 2^32 pages
+        {documentWith(R"({"address":0,"length":17592186044416,"type":"","resident_size":17592186044416})"),
+         "a region has more pages than can be counted"},
         {documentWith(region(R"(,"user_tag":1,"tag_name":"x")")), "region 0: it has two tags"},
         {documentWith(region(R"(,"path":null)")), "region 0: \"path\" is no value"},
         {documentWith(region(R"(,"path":{"a":1})")), "region 0: \"path\" is an object"},
@@ -228,7 +231,7 @@ TEST(SnapshotFile, ThatIsWrongSaysWhere) {
     for (const auto& [document, error] : cases) {
         EXPECT_EQ(errorOf(document), error) << document.substr(0, 400);
     }
-    EXPECT_EQ(errorOf(documentWith(region(""))), "");
+    EXPECT_EQ(errorOf(documentWith(region(R"(,"offset":18446744073709547520)"))), "");
 }
 
 TEST(SnapshotFile, CutOffOrDamagedIsRefusedOrHoldsTogether) {
