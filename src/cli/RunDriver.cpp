@@ -11,6 +11,7 @@
 #include <atomic>
 #include <cstdio>
 #include <memory>
+#include <new>
 #include <utility>
 
 namespace tally {
@@ -150,7 +151,12 @@ int runTally(int argc, char** argv) {
         outputs.discard();
         return 1;
     }
-    return measure(args, outputs) ? 0 : 1;
+    try {
+        return measure(args, outputs) ? 0 : 1;
+    } catch (const std::bad_alloc&) {
+        outputs.discard(); // half a document is of no use
+        throw;
+    }
 }
 
 } // namespace tally

@@ -66,6 +66,7 @@ TEST_F(HeapsnapDriver, SaysWhyThereIsNone) {
         {"no\tbody", "Unable to find pid for process matching 'no?body'\n"},
         {"kernel", "The kernel has no address space to take a snapshot of\n"},
         {"10", "task_read_for_pid: no access\nUnable to analyze process with pid 10 (try as root?)\n"},
+        {"-o /f 9", "o?e [9] maps /f, which is not written\n"},
         {"-o nowhere/x 7", "Unable to write nowhere/x: No such file or directory\n"},
         {"-o /dev/full 7", "Unable to write /dev/full: No space left on device\n"},
         {"7", "mach_vm_region_recurse: failure\nbailing out for process server [7]; data may be incomplete!\n"

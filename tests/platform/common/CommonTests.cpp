@@ -101,12 +101,7 @@ TEST(OptionScanner, ScansEachVectorFromItsStart) {
     EXPECT_EQ(first.options, (std::vector<int>{'p', 'v', 'p', 1000, 'p'}));
     EXPECT_EQ(first.arguments, (std::vector<std::string>{"7", "-", "8", "-", "9"}));
     EXPECT_EQ(first.rest, (std::vector<std::string>{"bash", "-x"}));
-    // A second scan in the same program, of a shorter vector, and again with diagnostics.
-    EXPECT_EQ(scan({"-v"}).options, std::vector<int>{'v'});
-    testing::internal::CaptureStderr();
-    EXPECT_EQ(scan({"-q", "--pid"}).options, (std::vector<int>(2, OptionScanner::Unknown)));
-    EXPECT_EQ(testing::internal::GetCapturedStderr(),
-              "tally: invalid option -- 'q'\ntally: option '--pid' requires an argument\n");
+    EXPECT_EQ(scan({"-v"}).options, std::vector<int>{'v'}) << "a second scan, of a shorter vector";
 }
 
 } // namespace
