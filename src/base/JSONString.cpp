@@ -69,9 +69,10 @@ std::string DistinctKeys::keyFor(std::string_view name) {
         return quoted;
     };
     const auto [met, isNew] = lastNumbers_.try_emplace(written(name), 1);
+    int& lastNumber = met->second; // stays where it is, as the iterator does not
     std::string key(name);
     for (bool isTaken = !isNew; isTaken; isTaken = !lastNumbers_.try_emplace(written(key), 1).second) {
-        key = std::string(name) + " (" + std::to_string(++met->second) + ")";
+        key = std::string(name) + " (" + std::to_string(++lastNumber) + ")";
     }
     return key;
 }

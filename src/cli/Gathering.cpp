@@ -40,10 +40,10 @@ bool TLTally::gatherAllProcesses() {
     // An interrupted sample is never reported, and the process may be in an earlier one that is.
     if (interrupted && !isSample) {
         // Nobody is told what a hidden process says.
-        std::ranges::stable_partition(sorted,
-                                      [](const auto& process) { return process->hiddenFromDisplay(); });
-        sorted.back()->_addGlobalError(
-            "Tally exited early due to SIGINT and did not finish gathering all data");
+        const auto shown = std::find_if(sorted.rbegin(), sorted.rend(),
+                                        [](const auto& process) { return !process->hiddenFromDisplay(); });
+        (shown == sorted.rend() ? sorted.back() : *shown)
+            ->_addGlobalError("Tally exited early due to SIGINT and did not finish gathering all data");
     }
     gatherEndTime_ = TLTime::now();
     return interrupted;

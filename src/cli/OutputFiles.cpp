@@ -4,6 +4,7 @@
 #include "output/TLOutputFormatterBenchlog.h"
 #include "output/TLOutputFormatterJSON.h"
 #include "output/TLOutputFormatterText.h"
+#include "process/TLHeapsnapProcess.h"
 
 #include <algorithm>
 #include <cstdio>
@@ -14,8 +15,8 @@ namespace tally {
 
 namespace {
 
-/// Whether `output` is asked for and none of the snapshots that are read. A message has gone to standard
-/// error otherwise.
+/// Whether `output`, where it is asked for, is none of the files that are read. A message has gone to
+/// standard error otherwise.
 bool isNoInput(const std::optional<std::string>& output, const TLTallyArgs& args) {
     const bool isInput =
         output && std::ranges::any_of(args.potentialTargetProcesses, [&](const std::string& text) {
@@ -41,7 +42,8 @@ std::shared_ptr<TLProcess> processThatMaps(const std::string& path,
         return region.object_id == file->object || region.detailedName == name;
     };
     const auto found = std::ranges::find_if(processes, [&](const std::shared_ptr<TLProcess>& process) {
-        return std::ranges::any_of(process->memoryRegions(), showsFile);
+        const bool isRunning = dynamic_cast<const TLHeapsnapProcess*>(process.get()) == nullptr;
+        return isRunning && std::ranges::any_of(process->memoryRegions(), showsFile);
     });
     return found == processes.end() ? nullptr : *found;
 }
@@ -55,8 +57,7 @@ bool OutputFiles::create(const TLTallyArgs& args) {
         std::fputs("Unable to initialize text output\n", stderr);
         return false;
     }
-    const bool isInputKept = isNoInput(args.JSONOutputFile, args) && isNoInput(args.benchlogOutputFile, args);
-    if (!isInputKept) {
+    if (!isNoInput(args.JSONOutputFile, args) || !isNoInput(args.benchlogOutputFile, args)) {
         return false;
     }
     if (args.JSONOutputFile &&

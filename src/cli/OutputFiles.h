@@ -18,8 +18,8 @@
 
 namespace tally {
 
-/// The first of `processes`, gathered ones, that maps the file of `path`; null when none does, or there is no
-/// such file.
+/// The first of `processes`, gathered ones, that runs and maps the file of `path`; null when none does, or
+/// there is no such file.
 std::shared_ptr<TLProcess> processThatMaps(const std::string& path,
                                            std::span<const std::shared_ptr<TLProcess>> processes);
 

@@ -153,7 +153,8 @@ void followAPuppet(std::chrono::seconds time) {
     kill(sampling.pid(), SIGINT);
     EXPECT_EQ(sampling.wait(), 0);
     const std::string errors = contentsOf(folder.path() + "/err");
-    EXPECT_TRUE(errors.ends_with("\nStopping...\nAnalyzing and writing output...\n"));
+    EXPECT_TRUE(holds(errors, "\nStopping...\n")); // a sample that is under way may still miss a target
+    EXPECT_TRUE(errors.ends_with("Analyzing and writing output...\n"));
 
     EXPECT_GE(expectAgreementIn(folder.path()), 18U);
     expectValid({folder.path() + "/x.json"});

@@ -30,7 +30,7 @@ TEST_F(Benchlog, HoldsAGroupPerProcessAndOneForTheSummary) {
         ready(12, {{.name = "heap", .object = 1, .size = 9, .dirty = 2, .swapped = 1}, shared}, "a\"b");
     first->aux = TLAuxDictionary{{{"memory", TLAuxDictionary{{{"peak", TLAuxData(-7, true)}}}}}};
     const auto second = ready(3, {shared}, "all shared"); // a header, no categories of its own
-    const auto failed = ready(2, {{.name = "lost", .object = 3, .size = 1, .dirty = 1}}, "failed");
+    const auto failed = ready(2, {{.name = "total_memory", .object = 3, .size = 1, .dirty = 1}}, "failed");
     failed->addError("refused");
     failed->aux = TLAuxDictionary{{{"own", TLAuxData(8, false)}}};
 
@@ -69,7 +69,8 @@ TEST_F(Benchlog, HoldsAGroupPerProcessAndOneForTheSummary) {
              group(4) + summary + R"(28672,"variables":{"process":"ALL_PROCESSES"},"tags":["summary"]})",
              group(4) +
                  R"("metric":"heap","unit":"B","value":24576,"variables":{"process":"ALL_PROCESSES"}})",
-             group(4) + R"("metric":"lost","unit":"B","value":4096,"variables":{"process":"ALL_PROCESSES"}})",
+             group(4) +
+                 R"-("metric":"total_memory (2)","unit":"B","value":4096,"variables":{"process":"ALL_PROCESSES"}})-",
              group(4) + R"("metric":"aux_data.memory.peak","unit":"B","value":-7,"variables":)"
                         R"({"process":"ALL_PROCESSES"},"tags":["context"]})",
              group(4) + R"("metric":"gather_duration","unit":"ms","value":0,"tags":["context"]})"});
