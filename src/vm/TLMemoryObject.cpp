@@ -41,10 +41,10 @@ void TLRegionPointers::push_back(TLMemoryRegion* region) {
         first_ = region;
         return;
     }
-    if (more_.empty()) {
-        more_.push_back(first_);
+    if (!all_) {
+        all_ = std::make_unique<List>(1, first_);
     }
-    more_.push_back(region);
+    all_->push_back(region);
 }
 
 void TLMemoryObject::addRegionForProcess(TLMemoryRegion& region, const MemoryHolder* process) {
@@ -69,7 +69,7 @@ void TLMemoryObject::addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t
         return;
     }
     if (!rangeList_) {
-        rangeList_.emplace();
+        rangeList_ = std::make_unique<TLRangeList>();
     }
     if (onlyRange_ != nullptr) {
         rangeList_->addRegionRange(*std::exchange(onlyRange_, nullptr), onlyRangePageSize_);

@@ -25,16 +25,26 @@ namespace tally {
 /// A list of regions that it does not own. Most lists hold one region, and that one is held in place.
 class TLRegionPointers {
   public:
+    TLRegionPointers() = default;
+    TLRegionPointers(TLRegionPointers&&) = default;
+    TLRegionPointers& operator=(TLRegionPointers&&) = default;
+    ~TLRegionPointers() = default;
+    TLRegionPointers(const TLRegionPointers& other)
+        : first_(other.first_), all_(other.all_ ? std::make_unique<List>(*other.all_) : nullptr) {}
+    TLRegionPointers& operator=(const TLRegionPointers& other) { return *this = TLRegionPointers(other); }
+
     void push_back(TLMemoryRegion* region);
-    std::size_t size() const { return more_.empty() ? (first_ == nullptr ? 0 : 1) : more_.size(); }
+    std::size_t size() const { return all_ ? all_->size() : first_ == nullptr ? 0 : 1; }
     bool empty() const { return first_ == nullptr; }
     TLMemoryRegion* front() const { return first_; }
-    TLMemoryRegion* const* begin() const { return more_.empty() ? &first_ : more_.data(); }
+    TLMemoryRegion* const* begin() const { return all_ ? all_->data() : &first_; }
     TLMemoryRegion* const* end() const { return begin() + size(); }
 
   private:
+    using List = std::vector<TLMemoryRegion*>;
+
     TLMemoryRegion* first_ = nullptr;
-    std::vector<TLMemoryRegion*> more_; // all of them, when there is more than one
+    std::unique_ptr<List> all_; // absent unless there is more than one
 };
 
 class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
@@ -84,7 +94,7 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     const RegionList& memoryRegions() const {
         return original_ == nullptr ? memoryRegions_ : original_->memoryRegions();
     }
-    const TLRangeList* rangeList() const { return rangeList_ ? &*rangeList_ : nullptr; }
+    const TLRangeList* rangeList() const { return rangeList_.get(); }
     /// Lists of regions by rising pid; empty unless they add information.
     const std::vector<ProcessRegionList>& processMemoryRegions() const { return processMemoryRegions_; }
 
@@ -99,7 +109,7 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     RegionList memoryRegions_;                       // in order of adding
     std::shared_ptr<const TLMemoryObject> original_; // of a copy: the object whose regions it has
     std::vector<ProcessRegionList> processMemoryRegions_;
-    std::optional<TLRangeList> rangeList_; // dropped when sizes are final
+    std::unique_ptr<TLRangeList> rangeList_; // dropped when sizes are final
     // Most objects are mapped once, as a whole: their one range is its region's, and no list is made of it.
     const TLMemoryRegion* onlyRange_ = nullptr;
     std::uint64_t onlyRangePageSize_ = 0;
