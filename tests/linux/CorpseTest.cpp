@@ -257,10 +257,8 @@ TEST_F(Corpse, ReportsWhatStillProcessesReport) {
                                              view,          "-t", std::to_string(puppet.pid())};
             std::vector<std::string> ofCorpse = command;
             ofCorpse.insert(ofCorpse.begin() + 1, "--forkCorpse");
-            const std::string before = reportOf(command);
-            const std::string found = reportOf(ofCorpse);
-            const std::string after = reportOf(command); // pages of files can have been written to disk
-            EXPECT_EQ(found, found == before ? before : after) << shape[0] << " " << view;
+            SCOPED_TRACE(shape[0] + " " + view);
+            expectSameReport([&] { return reportOf(command); }, [&] { return reportOf(ofCorpse); });
         }
     }
 }

@@ -171,7 +171,7 @@ void followAPuppet(std::chrono::seconds time) {
         sizes.insert(sample["processes"].size());
     }
     EXPECT_GE(totals.size(), 10U); // it was followed, not remembered
-    EXPECT_TRUE(sizes.contains(1) && sizes.contains(2));
+    EXPECT_GT(sizes.size(), 1U);
     EXPECT_EQ(document["samples"].back()["total tally"], 0); // nothing is left, but for zombies
 #ifndef __SANITIZE_ADDRESS__
     EXPECT_LE(late - early, 1024) << "KiB";

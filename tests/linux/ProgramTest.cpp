@@ -22,16 +22,17 @@ TEST(Program, KernelsWithoutTheNewQueriesGiveTheSameReport) {
     for (const char* view : {"-w", "--vmObjectDirty"}) {
         const std::vector<std::string> command{TALLY_PROGRAM, "-v",          "-f",    "bytes",    view,
                                                "--pid",       pidOf(puppet), "--pid", pidOf(many)};
-        const Outcome plain = run(command);
-        ASSERT_EQ(plain.status, 0) << plain.errors;
+        const auto reportOf = [](const std::vector<std::string>& words) {
+            const Outcome outcome = run(words);
+            EXPECT_EQ(outcome.status, 0);
+            return outcome.errors + outcome.output;
+        };
         for (const char* request :
              {"0xc0686611", "0xc0606610"}) { // the query for a mapping, the scan of pages
+            SCOPED_TRACE(request);
             std::vector<std::string> refused{PUPPET_PROGRAM, "refuse", request};
             refused.insert(refused.end(), command.begin(), command.end());
-            const Outcome older = run(refused);
-            EXPECT_EQ(older.status, 0);
-            EXPECT_EQ(older.errors, plain.errors);
-            EXPECT_EQ(older.output, plain.output) << request;
+            expectSameReport([&] { return reportOf(command); }, [&] { return reportOf(refused); });
         }
     }
 }

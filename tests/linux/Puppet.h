@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <string>
 #include <vector>
@@ -46,6 +47,10 @@ struct Outcome {
 
 /// Runs a program to its end. `folder` is its current folder, empty for the test's own.
 Outcome run(const std::vector<std::string>& command, const std::string& folder = "");
+
+/// Expects that `found` reports what `usual` does, which it is asked before and after until the machine
+/// changed nothing meanwhile (it writes files back, or drops pages of them). The functions give reports.
+void expectSameReport(const std::function<std::string()>& usual, const std::function<std::string()>& found);
 
 /// A program that runs beside the test, with its output in the files "out" and "err" of its folder; ended by
 /// pid when the holder goes away.
