@@ -1,13 +1,17 @@
 // Interrupts as a source: the signal wakes a thread that calls the handler.
+//
+// What happened is counted, and the event only wakes: one that could not be posted delays, and loses nothing.
 
 #include "platform/dispatch.h"
 #include "platform/linux/io/Descriptor.h"
 
+#include <poll.h>
 #include <sys/eventfd.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <cstdint>
 #include <system_error>
@@ -18,19 +22,21 @@ namespace tally::platform {
 
 namespace {
 
-// Where the signal handler writes: one source exists at a time.
+// What the signal handler tells, and where: one source exists at a time.
 std::atomic<int> signalEvent = -1;
+std::atomic<std::uint64_t> signalsSeen = 0;
 
-constexpr std::uint64_t signalled = 1;
-constexpr std::uint64_t cancelled = std::uint64_t{1} << 32;
+constexpr int longestSleep = 100; // milliseconds
 
-void post(int event, std::uint64_t what) {
-    [[maybe_unused]] const ssize_t written = write(event, &what, sizeof(what));
+void wake(int event) {
+    const std::uint64_t one = 1;
+    [[maybe_unused]] const ssize_t written = write(event, &one, sizeof(one));
 }
 
 void onSignal(int /*signal*/) {
     const int error = errno;
-    post(signalEvent, signalled);
+    ++signalsSeen;
+    wake(signalEvent);
     errno = error;
 }
 
@@ -42,32 +48,32 @@ class InterruptSource final : public SignalSource {
 
     void cancel() override {
         if (thread_.joinable()) {
-            signalEvent = -1;
-            post(event_.number(), cancelled);
+            isCancelled_ = true;
+            wake(event_.number());
             thread_.join();
+            signalEvent = -1;
         }
     }
 
   private:
     void run() {
-        for (;;) {
-            std::uint64_t events = 0;
-            const ssize_t count = read(event_.number(), &events, sizeof(events));
-            if (count != sizeof(events)) {
-                continue; // a signal that this thread got to handle itself
+        for (bool isOver = false; !isOver;) {
+            pollfd event{event_.number(), POLLIN, 0};
+            std::uint64_t posted = 0;
+            if (poll(&event, 1, longestSleep) > 0 && read(event_.number(), &posted, sizeof(posted)) < 0) {
+                std::this_thread::sleep_for(std::chrono::milliseconds(longestSleep));
             }
-            for (std::uint64_t i = 0; i < events % cancelled; ++i) {
+            isOver = isCancelled_; // what came before is handled yet
+            for (std::uint64_t left = signalsSeen.exchange(0); left != 0; --left) {
                 handler_();
-            }
-            if (events >= cancelled) {
-                return;
             }
         }
     }
 
     Descriptor event_;
     std::function<void()> handler_;
-    std::thread thread_;
+    std::atomic<bool> isCancelled_ = false;
+    std::thread thread_; // the last: it uses the others
 };
 
 bool isIgnored(int signal) {
@@ -91,6 +97,7 @@ std::unique_ptr<SignalSource> dispatch_source_interrupt(InterruptSignals which,
         return nullptr;
     }
     signalEvent = event.number();
+    signalsSeen = 0;
     std::unique_ptr<SignalSource> source;
     try {
         source = std::make_unique<InterruptSource>(std::move(event), std::move(handler));

@@ -21,6 +21,8 @@ namespace tally::platform {
 
 namespace {
 
+constexpr int longestSleep = 100; // milliseconds: the end is met also where the call that tells of it failed
+
 timespec duration(std::uint64_t nanoseconds) {
     constexpr std::uint64_t perSecond = 1'000'000'000;
     // 0 would switch the timer, or its repetition, off.
@@ -59,7 +61,7 @@ class KernelTimer final : public TimerSource {
             std::array<pollfd, 2> events{pollfd{timer_.number(), POLLIN, 0},
                                          pollfd{end_.number(), POLLIN, 0}};
             std::uint64_t ticks = 0;
-            if (poll(events.data(), events.size(), -1) > 0 && (events[0].revents & POLLIN) != 0 &&
+            if (poll(events.data(), events.size(), longestSleep) > 0 && (events[0].revents & POLLIN) != 0 &&
                 read(timer_.number(), &ticks, sizeof(ticks)) == sizeof(ticks)) {
                 // Not read again before the handler has run: what falls due meanwhile adds up.
                 queue_.sync([this, ticks] {
