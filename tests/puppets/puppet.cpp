@@ -21,9 +21,11 @@
 //                                  and touched
 //   puppet twins                   a second process in the same address space
 //   puppet leaderless              the first thread ends, another lives on
-//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by ENOTTY,
-//                                  for number 0 every ptrace by EPERM; "fixed" in place of a number runs it
-//                                  without randomised addresses
+//   puppet refuse NUMBER COMMAND   runs COMMAND with every ioctl of that request number answered by EPERM, of
+//   a
+//                                  small number the system call, for number 0 ptrace; "NUMBER:ERROR" by
+//                                  another error; "fixed" in place of a number runs it without randomised
+//                                  addresses
 //
 // Every line of output is "name address bytes key=bytes ...", what the mapping must show; "ready" ends the
 // ledger.
@@ -504,18 +506,18 @@ void leaderless() {
     pthread_exit(nullptr);
 }
 
-/// Answers every ioctl with the request `number` by ENOTTY, or for number 0 every ptrace by EPERM, here and
-/// in what is run from here.
-void refuse(std::uint32_t number) {
-    const bool refusesTracing = number == 0;
-    const std::uint32_t call = refusesTracing ? SYS_ptrace : SYS_ioctl;
-    const std::uint32_t place = refusesTracing ? offsetof(seccomp_data, nr) : offsetof(seccomp_data, args[1]);
-    const std::uint32_t error = refusesTracing ? EPERM : ENOTTY;
+/// Answers every ioctl with the request `number`, or every system call of that number where it is a small one
+/// (0 is ptrace), by `error`, here and in what is run from here.
+void refuse(std::uint32_t number, std::uint32_t error) {
+    constexpr std::uint32_t mostCalls = 4096;
+    const bool isCall = number < mostCalls;
+    const std::uint32_t call = !isCall ? SYS_ioctl : number == 0 ? SYS_ptrace : number;
+    const std::uint32_t place = isCall ? offsetof(seccomp_data, nr) : offsetof(seccomp_data, args[1]);
     sock_filter filter[] = {
         BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
         BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, call, 0, 3),
         BPF_STMT(BPF_LD | BPF_W | BPF_ABS, place),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, refusesTracing ? call : number, 0, 1),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, isCall ? call : number, 0, 1),
         BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
         BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
     };
@@ -535,7 +537,11 @@ int main(int argc, char** argv) {
         if (std::string(argv[2]) == "fixed") {
             personality(ADDR_NO_RANDOMIZE);
         } else {
-            refuse(static_cast<std::uint32_t>(number(2)));
+            char* error = nullptr; // NUMBER or NUMBER:ERROR
+            const auto refused = static_cast<std::uint32_t>(std::strtoul(argv[2], &error, 0));
+            const bool isGiven = *error == ':';
+            refuse(refused,
+                   isGiven ? static_cast<std::uint32_t>(std::strtoul(error + 1, nullptr, 0)) : EPERM);
         }
         execv(argv[3], argv + 3);
         fail(argv[3]);

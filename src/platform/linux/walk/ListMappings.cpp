@@ -48,6 +48,11 @@ constexpr std::size_t mostQueries = 2'000;
 
 enum class QueryResult { listed, unavailable, tooMany, failed };
 
+/// Whether an error of a request means that there is no use in asking again.
+bool saysUnknown(int error) {
+    return error == ENOTTY || error == ENOSYS || error == EPERM || error == EACCES;
+}
+
 Mapping mappingFromAnswer(const procmap_query& answer, const char* name) {
     Mapping mapping;
     mapping.start = answer.vma_start;
@@ -84,9 +89,9 @@ QueryResult queryMappings(const Descriptor& maps, std::vector<Mapping>* mappings
             if (errno == ENOENT) {
                 return QueryResult::listed;
             }
-            // A path of more than a page, as bind mounts can make, only the text gives in full.
-            const bool byText = errno == ENOTTY || errno == EINVAL || errno == ENAMETOOLONG;
-            return byText ? QueryResult::unavailable : QueryResult::failed;
+            // Older kernels and filters refuse it, and a path of more than a page, as bind mounts can make,
+            // only the text gives in full.
+            return errno == ESRCH ? QueryResult::failed : QueryResult::unavailable;
         }
         mappings->push_back(mappingFromAnswer(query, name.data()));
         address = query.vma_end;
@@ -104,7 +109,7 @@ bool listMappings(const Descriptor& maps, std::vector<Mapping>* mappings) {
         if (result == QueryResult::listed || result == QueryResult::failed) {
             return result == QueryResult::listed;
         }
-        if (result == QueryResult::unavailable && errno == ENOTTY) {
+        if (result == QueryResult::unavailable && saysUnknown(errno)) {
             queriesAnswered = false;
         }
     }

@@ -40,13 +40,16 @@ constexpr std::size_t mostRegions = 512;
 /// the lock before it, again and again, for milliseconds.
 void letWaitersIn() { std::this_thread::sleep_for(std::chrono::microseconds(1)); }
 
+/// Whether what a filter answers in the place of the kernel says that there is no such query.
+bool saysUnknown(int error) { return error == EPERM || error == EACCES || error == ENOSYS; }
+
 } // namespace
 
 int scanPages(int pagemap, AddressRange range, bool withFile, std::uint64_t mostPages,
               std::span<PageRegion> room, PageScanStep* step) {
     static std::atomic<bool> tellsGuards = true; // false once this kernel has refused the category
     const std::span<PageRegion> used = room.first(std::min(room.size(), mostRegions));
-    for (;;) {
+    for (bool isSecond = false;; isSecond = true) {
         const bool withGuards = tellsGuards;
         pm_scan_arg query{};
         query.size = sizeof(query);
@@ -59,15 +62,15 @@ int scanPages(int pagemap, AddressRange range, bool withFile, std::uint64_t most
         query.return_mask = PageIsPresent | PageIsSwapped | PageIsZero | PageIsHuge |
                             (withFile ? PageIsFile : 0) | (withGuards ? PageIsGuard : 0);
         const int count = ioctl(pagemap, PAGEMAP_SCAN, &query);
+        if (count < 0 && errno == EINVAL && withGuards) {
+            tellsGuards = false;
+            continue;
+        }
+        if (count < 0 && (isSecond || errno == ESRCH || errno == ENOTTY) && errno != EINTR) {
+            return saysUnknown(errno) ? ENOTTY : errno;
+        }
         if (count < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            if (errno == EINVAL && withGuards) {
-                tellsGuards = false;
-                continue;
-            }
-            return errno;
+            continue;
         }
         step->regions = used.first(static_cast<std::size_t>(count));
         step->pages = 0;
