@@ -14,9 +14,10 @@
 //                                  ten, drawn by the child's number), drop (the second half unmapped),
 //                                  huge (huge pages, the first 4 KiB of each written), grow (the parent's
 //                                  and the children's mappings grow apart), leaderless (nothing changes, the
-//                                  children's first threads end), freed (lazily, before), swapped (nothing
-//                                  changes: it was swapped out before, and shared memory of as many pages
-//                                  with it)
+//                                  children's first threads end), reserveN (mappings of N TiB, private
+//                                  and shared, with 16 pages each, are inherited as well), freed (lazily,
+//                                  before), swapped (nothing changes: it was swapped out before, and shared
+//                                  memory of as many pages with it)
 //   puppet memory PAGES            a memfd of PAGES pages, all written, of which only the first are mapped
 //                                  and touched
 //   puppet twins                   a second process in the same address space
@@ -422,6 +423,17 @@ void* sayReady(void* pipe) {
     }
 }
 
+/// Makes a private and a shared mapping of `tebibytes` TiB each, with a page in each of their first 16 GiB.
+void reserve(std::size_t tebibytes) {
+    const std::size_t size = tebibytes << 40;
+    for (char* m : {map(size, readWrite, privateAnonymous | MAP_NORESERVE),
+                    map(size, readWrite, MAP_SHARED | MAP_NORESERVE, makeMemfd("sparse", size / page))}) {
+        for (std::size_t i = 0; i < 16; ++i) {
+            write(m, i << 18, 1);
+        }
+    }
+}
+
 void family(std::size_t kids, std::size_t pages, const std::string& how) {
     char* m = how == "huge" ? map((pages + 512) * page, readWrite, privateAnonymous) : anonymous(pages);
     if (how == "huge") {
@@ -429,6 +441,9 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
         madvise(m, pages * page, MADV_HUGEPAGE);
     }
     write(m, 0, pages);
+    if (how.starts_with("reserve")) {
+        reserve(std::stoul(how.substr(7)));
+    }
     if (how == "freed") {
         madvise(m, pages * page, MADV_FREE);
     }
