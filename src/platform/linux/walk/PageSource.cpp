@@ -1,5 +1,7 @@
 #include "platform/linux/walk/PageSource.h"
 
+#include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/objects/MapFiles.h"
 #include "platform/linux/walk/PagemapEntry.h"
 
 #include <unistd.h>
@@ -216,7 +218,19 @@ bool PageSource::readPagemap(std::size_t index, AddressRange window, std::uint64
     const Mapping& mapping = mappings_[index];
     const std::uint64_t end = std::min(mapping.end, window.end);
     std::array<std::uint64_t, 4096> entries;
+    // Shared memory itself tells where it has pages; nobody waits for a server there.
+    const Descriptor object = mapping.isSharedMemory() && mapping.pages() > entries.size()
+                                  ? openForReading(mapFilePath(files_.folder, mapping))
+                                  : Descriptor();
     for (std::uint64_t address = std::max(mapping.start, window.start); address < end && expected != 0;) {
+        if (object.isOpen()) {
+            const std::uint64_t offset = address - mapping.start + mapping.fileOffset;
+            const off_t next = lseek(object.number(), static_cast<off_t>(offset), SEEK_DATA);
+            address += next < 0 ? 0 : (static_cast<std::uint64_t>(next) - offset) / basePage * basePage;
+            if (address >= end || (next < 0 && errno == ENXIO)) {
+                break;
+            }
+        }
         const std::uint64_t wanted = std::min<std::uint64_t>(entries.size(), (end - address) / basePage);
         const std::size_t count =
             readPagemapEntries(files_.pagemap, address, std::span(entries).first(wanted));
