@@ -1,3 +1,4 @@
+#include "cli/GuardedMain.h"
 #include "cli/RunDriver.h"
 
-int main(int argc, char** argv) { return tally::runTally(argc, argv); }
+int main(int argc, char** argv) { return tally::guardedMain(tally::runTally, argc, argv); }

@@ -1,3 +1,4 @@
+#include "cli/GuardedMain.h"
 #include "cli/HeapsnapDriver.h"
 
-int main(int argc, char** argv) { return tally::runHeapsnap(argc, argv); }
+int main(int argc, char** argv) { return tally::guardedMain(tally::runHeapsnap, argc, argv); }

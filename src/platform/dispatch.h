@@ -26,7 +26,7 @@ struct ConcurrentQueue {
 };
 
 /// Runs `item(0)` to `item(count - 1)`, started in index order, as many at a time as there are processors,
-/// and returns when all have finished. An item must not throw.
+/// and returns when all have finished. An item that throws ends the program.
 void dispatch_apply(std::size_t count, const ConcurrentQueue& queue,
                     const std::function<void(std::size_t)>& item);
 

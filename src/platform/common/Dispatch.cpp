@@ -14,7 +14,7 @@ namespace tally::platform {
 void dispatch_apply(std::size_t count, const ConcurrentQueue& /*queue*/,
                     const std::function<void(std::size_t)>& item) {
     std::atomic<std::size_t> next = 0;
-    const auto work = [&] {
+    const auto work = [&]() noexcept { // one that is left half done, others could wait for
         for (std::size_t index = next++; index < count; index = next++) {
             item(index);
         }

@@ -1,0 +1,12 @@
+// GuardedMain: how a program ends that could not go on, in whichever of its threads.
+
+#pragma once
+
+namespace tally {
+
+/// Runs `program`. What it, or a thread of it, throws is a message on standard error and the exit status 1:
+/// lack of memory or of threads, in the first place.
+/// @return the exit status.
+int guardedMain(int (*program)(int argc, char** argv), int argc, char** argv);
+
+} // namespace tally
