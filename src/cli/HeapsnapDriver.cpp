@@ -148,6 +148,10 @@ int runHeapsnap(int argc, char** argv) {
         std::fputs(usage, args ? stdout : stderr);
         return args ? 0 : 1;
     }
+    if (const std::string lack = whatMeasuringLacks(); !lack.empty()) {
+        printLineToStandardError(lack);
+        return 1;
+    }
     TLTally::setPhysTallyCollectionEnabled(args->vmObjectDirty ? 0 : 1);
     const std::optional<std::int32_t> pid = findProcess(args->target);
     const std::shared_ptr<SnapshotCapture> process = pid ? openProcess(*pid) : nullptr;

@@ -56,6 +56,7 @@ class TargetBuilder {
     bool addChildren();
     bool searchAllProcessesBut(TLPidSet excluded);
     std::optional<TLProcessTable> allReadableProcesses(const TLPidSet& excluded) const;
+    bool canMeasure() const;
     void noticePidsNamedTwice() const;
     void notice(const std::string& text) const;
     std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name) const;
@@ -80,6 +81,10 @@ bool TargetBuilder::build() {
         !args_.targetAll) {
         return fail(TLErrorNoTargets, "Must specify at least one process or heapsnap");
     }
+    if (!canMeasure()) {
+        table_.clear();
+        return true;
+    }
     const TLPidSet excluded = exclusionSet();
     if (!(args_.targetAll ? targetEveryProcess(excluded) : targetNamedProcesses(excluded))) {
         return false;
@@ -89,6 +94,18 @@ bool TargetBuilder::build() {
         table_ = removeIdleExitCleanProcessesFrom(table_);
     }
     return true;
+}
+
+/// Whether the machine lets processes be measured, if there is one to measure; what it lacks is said.
+bool TargetBuilder::canMeasure() const {
+    if (args_.targetPids.empty() && args_.potentialTargetProcesses.empty() && !args_.targetAll) {
+        return true; // snapshots need nothing of it
+    }
+    const std::string lack = whatMeasuringLacks();
+    if (!lack.empty()) {
+        notice(lack + "\n");
+    }
+    return lack.empty();
 }
 
 /// Reports go by pid: a process and its snapshot, or two snapshots of it, are one entry there.

@@ -46,6 +46,9 @@ void prepareOwnProcess();
 /// Lets the signal of a closed pipe end the program again.
 void endWithClosedPipe();
 
+/// What the machine lacks for processes to be measured, as a message; empty when it lacks nothing.
+std::string whatMeasuringLacks();
+
 bool standardOutputIsTerminal();
 std::uint32_t effectiveUserId();
 std::int32_t ownPid();
