@@ -25,7 +25,7 @@ const char* mach_error_string(kern_return_t status) {
     case KERN_NOT_SUPPORTED:
         return "operation not supported";
     case KERN_OPERATION_TIMED_OUT:
-        return "operation timed out";
+        return "timed out: its threads did not hold still";
     default:
         return "unknown error code";
     }

@@ -18,17 +18,18 @@
 #include <optional>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 namespace tally::platform {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
 // A thread that waits for a disk or a vfork does not react before that is over, and one that makes threads
 // without end is never caught; the others would wait for it.
-constexpr std::chrono::milliseconds patience(1000);
+constexpr std::chrono::milliseconds mostPatience(1000);
+constexpr std::chrono::microseconds usualRound(250);
+constexpr std::chrono::seconds longestWait(10);
 
 std::string threadFolder(std::int32_t pid, std::int32_t thread) {
     return processFolder(pid) + "/task/" + std::to_string(thread);
@@ -48,10 +49,16 @@ std::vector<std::int32_t> listThreads(std::int32_t pid) {
     return threads;
 }
 
+/// The state of the thread, as a letter; that of one that has ended when it is not listed.
+char stateOf(std::int32_t pid, std::int32_t thread) {
+    const auto stat = decodeStat(readSystemRecord(threadFolder(pid, thread) + "/stat").value_or(""));
+    return stat ? stat->state : 'X';
+}
+
 /// Whether the thread has ended, though it is still listed: a first thread is until the others have.
 bool hasEnded(std::int32_t pid, std::int32_t thread) {
-    const auto stat = decodeStat(readSystemRecord(threadFolder(pid, thread) + "/stat").value_or(""));
-    return !stat || stat->state == 'Z' || stat->state == 'X';
+    const char state = stateOf(pid, thread);
+    return state == 'Z' || state == 'X';
 }
 
 /// The process that traces the thread; 0 when none does.
@@ -71,6 +78,12 @@ long trace(__ptrace_request request, std::int32_t thread, int signal = 0) {
 }
 
 } // namespace
+
+bool Patience::isOver() {
+    const auto now = Clock::now();
+    spent_ += std::min<Clock::duration>(now - std::exchange(last_, now), usualRound);
+    return spent_ > mostPatience || now - begin_ > longestWait;
+}
 
 void SeizedThreads::add(std::int32_t id) {
     const std::scoped_lock lock(mutex_);
@@ -107,9 +120,9 @@ kern_return_t StoppedThreads::stopAll() {
     if (tracerOf(getpid(), getpid()) == pid_) { // the two would wait for each other
         return KERN_NO_ACCESS;
     }
-    const auto deadline = Clock::now() + patience;
+    Patience patience;
     for (bool isNew = true;;) {
-        const kern_return_t status = seizeNewThreads(&isNew);
+        const kern_return_t status = seizeNewThreads(&isNew, patience);
         if (status != KERN_SUCCESS) {
             return status;
         }
@@ -121,7 +134,7 @@ kern_return_t StoppedThreads::stopAll() {
                 trace(PTRACE_INTERRUPT, id);
             }
         }
-        if (!awaitThreads(deadline)) {
+        if (!awaitThreads(patience)) {
             return KERN_OPERATION_TIMED_OUT;
         }
     }
@@ -132,7 +145,7 @@ kern_return_t StoppedThreads::stopAll() {
 }
 
 /// Threads go on while others are seized, so that none stands still for longer than it must.
-kern_return_t StoppedThreads::seizeNewThreads(bool* isNew) {
+kern_return_t StoppedThreads::seizeNewThreads(bool* isNew, Patience& patience) {
     *isNew = false;
     for (const std::int32_t id : listThreads(pid_)) {
         if (isStillKnown(id)) {
@@ -140,7 +153,7 @@ kern_return_t StoppedThreads::seizeNewThreads(bool* isNew) {
         }
         // One that has just ended can have cut the list off: it is read again.
         *isNew = true;
-        if (const kern_return_t status = seize(id); status != KERN_SUCCESS) {
+        if (const kern_return_t status = seize(id, patience); status != KERN_SUCCESS) {
             return status;
         }
     }
@@ -153,13 +166,18 @@ bool StoppedThreads::isStillKnown(std::int32_t id) const {
     if (found == threads_.end()) {
         return false;
     }
-    return found->second.state == Thread::State::gone ? hasEnded(pid_, id)
-                                                      : id != pid_ || tracerOf(pid_, id) == gettid();
+    if (found->second.state == Thread::State::gone) {
+        return hasEnded(pid_, id);
+    }
+    return id != pid_ || (tracerOf(pid_, id) == gettid() && stateOf(pid_, id) == 't');
 }
 
-kern_return_t StoppedThreads::seize(std::int32_t id) {
-    for (int attempt = 0; attempt < 3; ++attempt) { // its number can go over to another thread meanwhile
+kern_return_t StoppedThreads::seize(std::int32_t id, Patience& patience) {
+    // Its number can go over to another thread meanwhile, again and again in a process that loads programs
+    // all the time. A refusal is one when it stays.
+    for (int refusals = 0; refusals < 50;) {
         const bool isSeized = trace(PTRACE_SEIZE, id) == 0;
+        const bool isRefused = !isSeized && errno != ESRCH;
         const std::int32_t tracer = isSeized ? gettid() : tracerOf(pid_, id);
         if (tracer == gettid()) { // also one that was seized under another number
             threads_[id] = {};
@@ -173,19 +191,23 @@ kern_return_t StoppedThreads::seize(std::int32_t id) {
         if (tracer != 0) {
             return KERN_RIGHT_EXISTS;
         }
-        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        refusals += isRefused ? 1 : 0;
+        if (patience.isOver()) {
+            return isRefused ? KERN_NO_ACCESS : KERN_OPERATION_TIMED_OUT;
+        }
+        std::this_thread::sleep_for(std::chrono::microseconds(200));
     }
     return KERN_NO_ACCESS;
 }
 
 /// Waits until every thread has stopped or ended. @return false when time is up before.
-bool StoppedThreads::awaitThreads(std::chrono::steady_clock::time_point deadline) {
+bool StoppedThreads::awaitThreads(Patience& patience) {
     for (;;) {
         bool isAllStill = true;
         for (auto& [id, thread] : threads_) {
             isAllStill = look(id, thread) && isAllStill;
         }
-        const bool isLate = Clock::now() > deadline;
+        const bool isLate = patience.isOver();
         if (isAllStill || isLate) {
             return isAllStill && !isLate;
         }

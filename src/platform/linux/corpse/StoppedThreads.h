@@ -33,6 +33,22 @@ class SeizedThreads {
     std::set<std::int32_t> ids_;
 };
 
+/// How long threads are given to hold still: a second in which the tool looks at them again and again. On a
+/// busy machine neither they nor the tool run all of the time; what is beyond a usual round does not count,
+/// up to a limit.
+class Patience {
+  public:
+    /// To be called once a round. @return whether it is at an end.
+    bool isOver();
+
+  private:
+    using Clock = std::chrono::steady_clock;
+
+    Clock::time_point begin_ = Clock::now();
+    Clock::time_point last_ = begin_;
+    Clock::duration spent_{};
+};
+
 class StoppedThreads {
   public:
     /// Stops all threads of process `pid`. To be made by a thread that ends soon after.
@@ -53,10 +69,10 @@ class StoppedThreads {
     };
 
     kern_return_t stopAll();
-    kern_return_t seizeNewThreads(bool* isNew);
+    kern_return_t seizeNewThreads(bool* isNew, Patience& patience);
     bool isStillKnown(std::int32_t id) const;
-    kern_return_t seize(std::int32_t id);
-    bool awaitThreads(std::chrono::steady_clock::time_point deadline);
+    kern_return_t seize(std::int32_t id, Patience& patience);
+    bool awaitThreads(Patience& patience);
     bool look(std::int32_t id, Thread& thread);
 
     std::int32_t pid_;
