@@ -3,9 +3,13 @@
 #include "platform/bsd_process.h"
 #include "platform/linux/corpse/CorpseFamilies.h"
 #include "platform/linux/corpse/KcdataWriter.h"
+#include "platform/linux/corpse/StopSignals.h"
 #include "platform/linux/corpse/StoppedThreads.h"
 #include "platform/linux/images/SymbolOwners.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/objects/FilesAhead.h"
+#include "platform/linux/processes/Executable.h"
 #include "platform/linux/processes/Ledgers.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/AccountingSwitch.h"
@@ -41,7 +45,7 @@ constexpr std::uint32_t flag64bit = 0x4;
 
 /// Who the process is, as its crash information says it.
 struct Identification {
-    std::string path; // of the executable, or a name
+    std::string path; // the link to the executable, or a name
     std::uint32_t flags = 0;
 };
 
@@ -52,13 +56,8 @@ Identification identify(std::int32_t pid) {
         return identification;
     }
     identification.flags = (info.pbi_flags & PROC_FLAG_LP64) != 0 ? flag64bit : 0;
-    constexpr std::string_view deleted = " (deleted)";
-    identification.path =
-        readSystemLink(processFolder(pid) + "/exe")
-            .value_or(std::string(info.pbi_name, strnlen(info.pbi_name, sizeof info.pbi_name)));
-    if (identification.path.ends_with(deleted)) {
-        identification.path.resize(identification.path.size() - deleted.size());
-    }
+    identification.path = executableLink(pid).value_or(
+        std::string(info.pbi_name, strnlen(info.pbi_name, sizeof info.pbi_name)));
     return identification;
 }
 
@@ -66,7 +65,7 @@ std::vector<std::byte> crashInformationOf(std::int32_t pid, const Identification
                                           const Charges& charges) {
     KcdataWriter writer;
     writer.addNumber(pidItem, static_cast<std::uint32_t>(pid));
-    writer.addText(pathItem, identification.path);
+    writer.addText(pathItem, executablePath(pid, identification.path));
     writer.addNumber(flagsItem, identification.flags);
     writer.addNumber(dirtyFlagsItem, std::uint32_t{0}); // nothing is tracked for idle exit here
     writer.addNumber(pageTableItem, charges.pageTable);
@@ -81,37 +80,64 @@ bool hasLiveRelatives(std::int32_t pid, const FamilyKey& key) {
     pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
     return key.isKnown() && std::ranges::any_of(pids, [&](std::int32_t other) {
                return other != pid &&
-                      familyKeyOf(other, readSystemRecord(processFolder(other) + "/stat").value_or("")) == key;
+                      familyKeyOf(other, readSystemRecord(processFolder(other) + "/stat").value_or("")) ==
+                          key;
            });
 }
 
-/// Reads what of a running process may take its time, so that it need not while the process holds still.
-void readAhead(MemberIdentity task) {
+/// Asks of a running process's files what is needed of them, so that none is asked while the process holds
+/// still.
+FilesAhead askAhead(MemberIdentity task) {
+    FilesAhead ahead;
     ProcessMemoryFiles files;
     std::vector<Mapping> mappings;
     if (files.open(task.pid, task.startTicks, &mappings) == KERN_SUCCESS) {
+        ahead.ask(files.folder, mappings, !accountingSwitchIsOn());
         symbolOwnersOf(mappings, files.folder); // the headers of its files are remembered
     }
+    return ahead;
+}
+
+/// The images of a corpse, of files that were asked ahead; and of others as long as the process still maps
+/// them.
+void nameImages(CorpseSpace& space) {
+    const NoteTaker taker(space.notices);
+    space.images = symbolOwnersOf(space.walk->mappings(), space.walk->folder());
 }
 
 /// What is found out while the process holds still.
 struct Capture {
+    FilesAhead files;
     bool hasRelatives = false; // by which it is known what else to read
     Identification identification;
     Charges charges;
 };
 
-/// Looks at the process, whose key is that of `space`. To be run by a thread of its own, at whose end every
-/// thread of the process runs on.
+/// Enters of what exec the process is. @return false when it is another process.
+bool identifyProgram(MemberIdentity task, CorpseSpace& space, Capture& capture) {
+    const std::optional<std::string> text = readSystemRecord(processFolder(task.pid) + "/stat");
+    const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
+    if (!stat || stat->startTicks != task.startTicks) {
+        return false;
+    }
+    if (const FamilyKey key = familyKeyOf(task.pid, *text);
+        key != space.key) { // it has loaded a program since
+        space.key = key;
+        space.execRandom = isLayoutFixed(task.pid) ? readExecRandom(task.pid) : decltype(space.execRandom){};
+        capture.hasRelatives = true; // for all that is known
+    }
+    return true;
+}
+
+/// Looks at the process. To be run by a thread of its own, at whose end every thread of the process runs on.
 kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& space, Capture& capture) {
+    const FilesAhead::Use asksNoFile(capture.files);
     const StoppedThreads stopped(task.pid, seized);
     if (stopped.status() != KERN_SUCCESS) {
         return stopped.status();
     }
-    const std::optional<std::string> text = readSystemRecord(processFolder(task.pid) + "/stat");
-    const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
-    if (!stat || stat->startTicks != task.startTicks || familyKeyOf(task.pid, *text) != space.key) {
-        return KERN_TERMINATED; // or it has loaded another program since
+    if (!identifyProgram(task, space, capture)) {
+        return KERN_TERMINATED;
     }
     space.owner = task;
     capture.identification = identify(task.pid);
@@ -126,25 +152,25 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
     }
     space.walk = std::move(result.walk);
     space.notices = std::move(result.notices);
-    space.images = symbolOwnersOf(space.walk->mappings(), space.walk->folder());
     if (capture.hasRelatives) {
         space.held = readHeldPages(task, space.walk->mappings());
     }
     return KERN_SUCCESS;
 }
 
-/// Runs `work` on a thread of its own, and `meanwhile` on this one again and again.
+/// Runs `work` on a thread of its own, and `meanwhile` on this one again and again. Throws what `work`
+/// throws.
 /// @return KERN_NO_SPACE where the system refuses a thread.
 template <typename Work, typename Meanwhile>
 kern_return_t runApart(const Work& work, const Meanwhile& meanwhile) {
-    std::promise<kern_return_t> promise;
-    std::future<kern_return_t> result = promise.get_future();
+    std::packaged_task<kern_return_t()> task(work);
+    std::future<kern_return_t> result = task.get_future();
     try {
-        std::thread worker([&] { promise.set_value(work()); });
+        const StopSignals putOff;
+        const std::jthread worker([&] { task(); });
         while (result.wait_for(std::chrono::milliseconds(2)) != std::future_status::ready) {
             meanwhile();
         }
-        worker.join();
     } catch (const std::system_error&) { // no thread is to be had
         return KERN_NO_SPACE;
     }
@@ -187,12 +213,14 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
     if (isLayoutFixed(task.pid)) {
         space->execRandom = readExecRandom(task.pid);
     }
-    Capture capture{.hasRelatives = hasLiveRelatives(task.pid, key), .identification = {}, .charges = {}};
-    readAhead(task);
+    Capture capture;
+    capture.hasRelatives = hasLiveRelatives(task.pid, key);
+    capture.files = askAhead(task);
     SeizedThreads seized;
     const kern_return_t status =
         runApart([&] { return lookAt(task, seized, *space, capture); }, [&] { seized.takeNoteOfEnds(); });
     if (status == KERN_SUCCESS) {
+        nameImages(*space);
         enterCorpse(space);
         *corpse = std::make_shared<Corpse>(
             task, space, crashInformationOf(task.pid, capture.identification, capture.charges));

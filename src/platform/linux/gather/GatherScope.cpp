@@ -4,7 +4,8 @@
 #include "platform/linux/gather/LazyFree.h"
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/images/LayoutTable.h"
-#include "platform/linux/objects/Backing.h"
+#include "platform/linux/io/FileInquiry.h"
+#include "platform/linux/objects/FileSystems.h"
 #include "platform/linux/owned/OwnedGather.h"
 
 namespace tally::platform {
@@ -23,6 +24,7 @@ GatherScope::~GatherScope() {
     endFamilies();
     endOwned();
     endMachineState();
+    endInquiries();
 }
 
 } // namespace tally::platform

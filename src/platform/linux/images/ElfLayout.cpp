@@ -39,10 +39,10 @@ ElfHandle elfOf(std::vector<char>& bytes) {
 
 /// None when they cannot be read. The library is given a copy of the headers alone: of a whole file it makes
 /// a record of every section too, and a file of 4 KiB can claim billions.
-std::vector<GElf_Phdr> programHeaders(const Descriptor& file) {
+std::vector<GElf_Phdr> programHeaders(const FileReader& read) {
     std::vector<char> bytes(sizeof(Elf64_Ehdr)); // of both classes: a file with something to load is longer
     GElf_Ehdr header;
-    if (!readExactly(file, 0, std::as_writable_bytes(std::span(bytes))) ||
+    if (!read(0, std::as_writable_bytes(std::span(bytes))) ||
         gelf_getehdr(elfOf(bytes).get(), &header) == nullptr || header.e_phnum > mostHeaders) {
         return {};
     }
@@ -50,8 +50,7 @@ std::vector<GElf_Phdr> programHeaders(const Descriptor& file) {
     const std::size_t size = gelf_fsize(elfOf(bytes).get(), ELF_T_PHDR, header.e_phnum, EV_CURRENT);
     bytes.resize(start + size);
     const ElfHandle elf = elfOf(bytes);
-    const bool isRead =
-        readExactly(file, header.e_phoff, std::as_writable_bytes(std::span(bytes).subspan(start)));
+    const bool isRead = read(header.e_phoff, std::as_writable_bytes(std::span(bytes).subspan(start)));
     header.e_phoff = start;
     if (!isRead || gelf_update_ehdr(elf.get(), &header) == 0) {
         return {};
@@ -80,8 +79,13 @@ std::uint64_t LoadSegment::endOfFilePages() const {
 std::uint64_t LoadSegment::endPage() const { return pageAbove(address + memorySize); }
 
 std::optional<ElfLayout> readElfLayout(const Descriptor& file) {
+    return readElfLayout(
+        [&](std::uint64_t offset, std::span<std::byte> bytes) { return readExactly(file, offset, bytes); });
+}
+
+std::optional<ElfLayout> readElfLayout(const FileReader& read) {
     ElfLayout layout;
-    for (const GElf_Phdr& header : programHeaders(file)) {
+    for (const GElf_Phdr& header : programHeaders(read)) {
         if (header.p_type == PT_LOAD && header.p_memsz != 0) {
             layout.loads.push_back({.address = header.p_vaddr,
                                     .memorySize = header.p_memsz,

@@ -4,8 +4,11 @@
 
 #include "platform/linux/io/Descriptor.h"
 
+#include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <optional>
+#include <span>
 #include <vector>
 
 namespace tally::platform {
@@ -32,8 +35,12 @@ struct ElfLayout {
     std::uint64_t relroEnd = 0;
 };
 
+/// Fills `bytes` with what stands in a file from `offset` on. @return false when it cannot.
+using FileReader = std::function<bool(std::uint64_t offset, std::span<std::byte> bytes)>;
+
 /// Reads the layout from a regular file of either class. Reads the headers only, however large the file is.
 /// @return absent when it is no ELF file, has nothing to load, or its headers contradict themselves.
+std::optional<ElfLayout> readElfLayout(const FileReader& read);
 std::optional<ElfLayout> readElfLayout(const Descriptor& file);
 
 } // namespace tally::platform

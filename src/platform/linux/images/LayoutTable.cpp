@@ -1,9 +1,14 @@
 #include "platform/linux/images/LayoutTable.h"
 
+#include "base/Format.h"
+#include "platform/linux/io/FileInquiry.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/objects/MapFiles.h"
 
 #include <sys/stat.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -30,6 +35,33 @@ FileVersion versionOf(const Descriptor& file) {
         return {};
     }
     return {status.st_size, status.st_mtim.tv_sec, status.st_mtim.tv_nsec};
+}
+
+FileVersion versionOf(const FileAnswer& file) {
+    return {static_cast<std::int64_t>(file.status.stx_size), file.status.stx_mtime.tv_sec,
+            file.status.stx_mtime.tv_nsec};
+}
+
+/// Reads from the head of a file, which linkers put the headers into.
+FileReader readerOf(const FileAnswer& file) {
+    return [bytes = file.firstBytes()](std::uint64_t offset, std::span<std::byte> part) {
+        const bool isThere = offset <= bytes.size() && part.size() <= bytes.size() - offset;
+        if (isThere) {
+            std::ranges::copy(bytes.subspan(offset, part.size()), part.begin());
+        }
+        return isThere;
+    };
+}
+
+/// Says why a file was not looked at.
+void noteUnread(const Mapping& mapping, int error) {
+    constexpr const char* consequence = "their segments are not told apart";
+    if (error == ETIMEDOUT) {
+        note(formatted("Files of device %u:%u were not looked at, it does not answer: %s",
+                       mapping.deviceMajor, mapping.deviceMinor, consequence));
+    } else {
+        noteRefusal("Mapped files could not be opened", error, consequence);
+    }
 }
 
 /// One file. Its own lock is held while it is read, so that one slow file holds up no other.
@@ -79,12 +111,16 @@ std::shared_ptr<const ElfLayout> layoutOfFile(const BackingObject& object, const
         return entry->layout;
     }
     const Descriptor file = openMappedFile(folder, mapping);
-    if (!file.isOpen()) {
+    const std::optional<FileAnswer> answer =
+        file.isOpen() || errno != EAGAIN ? std::nullopt : inquireMappedFile(folder, mapping);
+    if (!file.isOpen() && !answer) {
+        noteUnread(mapping, errno);
         return nullptr; // another process may show it
     }
     entry->gather = gather;
-    if (const FileVersion version = versionOf(file); version != entry->version) {
-        std::optional<ElfLayout> layout = readElfLayout(file);
+    if (const FileVersion version = answer ? versionOf(*answer) : versionOf(file);
+        version != entry->version) {
+        std::optional<ElfLayout> layout = answer ? readElfLayout(readerOf(*answer)) : readElfLayout(file);
         entry->layout = layout ? std::make_shared<const ElfLayout>(*std::move(layout)) : nullptr;
         entry->version = version;
     }

@@ -5,6 +5,7 @@
 #include "platform/linux/corpse/Corpse.h"
 #include "platform/linux/images/ImageSegments.h"
 #include "platform/linux/images/LayoutTable.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/walk/Task.h"
@@ -12,6 +13,7 @@
 
 #include <algorithm>
 #include <map>
+#include <utility>
 
 namespace tally::platform {
 
@@ -74,9 +76,15 @@ void RKForeachSymbolOwner(mach_port_t port, const std::function<void(const RKSym
     }
     kern_return_t status = KERN_SUCCESS;
     const Walk* walk = task ? task->walk(&status) : nullptr;
-    if (walk != nullptr) { // else the walk of the regions meets that too, and reports it
+    if (walk == nullptr) {
+        return; // the walk of the regions meets that too, and reports it
+    }
+    std::vector<std::string> notes;
+    {
+        const NoteTaker taker(notes);
         std::ranges::for_each(symbolOwnersOf(walk->mappings(), walk->folder()), handler);
     }
+    task->addNotices(std::move(notes));
 }
 
 // The kernel lists files by the paths that they were found at in the end, as the task sees them.

@@ -32,7 +32,4 @@ struct BackingObject {
 BackingObject backingOf(const Mapping& mapping, const std::string& folder,
                         const std::string& descriptor = "");
 
-/// Forgets what is known of file systems: their device numbers can be used again.
-void forgetFileSystems();
-
 } // namespace tally::platform

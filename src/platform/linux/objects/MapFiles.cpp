@@ -1,9 +1,13 @@
 #include "platform/linux/objects/MapFiles.h"
 
 #include "base/Format.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/objects/FileSystems.h"
+#include "platform/linux/objects/FilesAhead.h"
 
 #include <fcntl.h>
+#include <linux/openat2.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/sysmacros.h>
@@ -31,11 +35,18 @@ constexpr long cachestatCall = 451;
 
 /// Where no disk is behind a mount, the list of mappings can name another device than the file itself does,
 /// as with subvolumes.
-bool isFileOf(const Descriptor& file, const Mapping& mapping) {
-    struct stat status {};
-    return fstat(file.number(), &status) == 0 && S_ISREG(status.st_mode) && status.st_ino == mapping.inode &&
-           major(status.st_dev) == mapping.deviceMajor &&
-           (minor(status.st_dev) == mapping.deviceMinor || mapping.deviceMajor == 0);
+bool isFileOf(std::uint32_t deviceMajor, std::uint32_t deviceMinor, std::uint64_t inode,
+              const Mapping& mapping) {
+    return inode == mapping.inode && deviceMajor == mapping.deviceMajor &&
+           (deviceMinor == mapping.deviceMinor || mapping.deviceMajor == 0);
+}
+
+std::string pathByName(const std::string& folder, const Mapping& mapping) {
+    return folder + "/root" + mapping.name;
+}
+
+Descriptor openForStates(const std::string& path) {
+    return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
 }
 
 } // namespace
@@ -47,22 +58,77 @@ std::string mapFilePath(const std::string& folder, const Mapping& mapping) {
 
 Descriptor openRegularFile(const std::string& path) {
     struct stat status {};
-    if (stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
+    if (stat(path.c_str(), &status) != 0) {
         return Descriptor();
     }
-    return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    if (!S_ISREG(status.st_mode)) {
+        errno = ENOENT;
+        return Descriptor();
+    }
+    return openForStates(path);
+}
+
+Descriptor findByName(const std::string& folder, const Mapping& mapping) {
+    if (!mapping.name.starts_with('/')) {
+        errno = ENOENT;
+        return Descriptor();
+    }
+    const Descriptor root(open((folder + "/root").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    open_how how{.flags = O_PATH | O_CLOEXEC | O_NOFOLLOW, .mode = 0, .resolve = RESOLVE_CACHED};
+    // A file that is mapped is in the kernel's cache of names, and so is the way to it.
+    Descriptor file(
+        static_cast<int>(syscall(SYS_openat2, root.number(), mapping.name.c_str() + 1, &how, sizeof how)));
+    if (!file.isOpen()) {
+        errno = !root.isOpen() || errno == ENOENT || errno == EACCES ? errno : EAGAIN;
+        return Descriptor();
+    }
+    struct stat status {};
+    if (fstat(file.number(), &status) != 0 ||
+        !isFileOf(major(status.st_dev), minor(status.st_dev), status.st_ino, mapping)) {
+        errno = ENOENT;
+        return Descriptor();
+    }
+    return file;
 }
 
 Descriptor openMappedFile(const std::string& folder, const Mapping& mapping) {
-    Descriptor file = openRegularFile(mapFilePath(folder, mapping));
-    if (!file.isOpen() && mapping.name.starts_with('/')) {
-        // Without the right to follow that link: by name, as the process sees it, if it is still the same
-        // file.
-        file = openRegularFile(folder + "/root" + mapping.name);
-        if (file.isOpen() && !isFileOf(file, mapping)) {
-            return Descriptor();
-        }
+    if (const FilesAhead* ahead = FilesAhead::ofThisThread(); ahead != nullptr) {
+        errno = ENOENT;
+        return ahead->fileOf(mapping);
     }
+    if (!isLocalFileSystem(mapping, folder)) {
+        errno = EAGAIN;
+        return Descriptor();
+    }
+    Descriptor file = openRegularFile(mapFilePath(folder, mapping));
+    if (file.isOpen()) {
+        return file;
+    }
+    // Without the right to follow that link: by name.
+    const int refusal = errno;
+    const Descriptor found = findByName(folder, mapping);
+    file = found.isOpen() ? openRegularFile(systemPath("/proc/self/fd/" + std::to_string(found.number())))
+                          : Descriptor();
+    errno = isRefusal(errno) ? errno : refusal;
+    return file;
+}
+
+std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Mapping& mapping) {
+    const bool isLocal = isLocalFileSystem(mapping, folder);
+    // On the way to a file of a disk can be anybody's mount.
+    const std::uint64_t device = isLocal ? unknownDevice : deviceOf(mapping);
+    std::optional<FileAnswer> file = inquire(device, mapFilePath(folder, mapping));
+    if (file || errno == ETIMEDOUT || !mapping.name.starts_with('/')) {
+        return file;
+    }
+    const int refusal = errno;
+    file = inquire(device, pathByName(folder, mapping));
+    if (file &&
+        !isFileOf(file->status.stx_dev_major, file->status.stx_dev_minor, file->status.stx_ino, mapping)) {
+        file.reset();
+        errno = ENOENT;
+    }
+    errno = isRefusal(errno) ? errno : refusal;
     return file;
 }
 

@@ -6,6 +6,7 @@
 #pragma once
 
 #include "platform/linux/io/Descriptor.h"
+#include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/walk/Mapping.h"
 
 #include <cstdint>
@@ -20,8 +21,18 @@ std::string mapFilePath(const std::string& folder, const Mapping& mapping);
 /// Opens `path` for reading if a regular file is there: opening anything else can wait, or act on a device.
 Descriptor openRegularFile(const std::string& path);
 
-/// Opens the file behind `mapping`. Not open when it is no regular file or may not be opened.
+/// Finds the file behind `mapping` by its name, as the process sees it, if it is still the same file. The
+/// descriptor is not for reading. Not open with EAGAIN when the way there is not known at once, as where a
+/// server is on it.
+Descriptor findByName(const std::string& folder, const Mapping& mapping);
+
+/// Opens the file behind `mapping`. Not open, with errno, when it is no regular file, may not be opened, or
+/// is on a file system that could keep us waiting (EAGAIN).
 Descriptor openMappedFile(const std::string& folder, const Mapping& mapping);
+
+/// What is known of the file behind `mapping` by a question that is given up when it takes too long; absent
+/// with errno.
+std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Mapping& mapping);
 
 /// Pages of a byte range of a file in the page cache.
 struct CachedPages {

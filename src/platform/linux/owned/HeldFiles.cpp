@@ -1,6 +1,7 @@
 #include "platform/linux/owned/HeldFiles.h"
 
 #include "platform/linux/gather/MachineState.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/objects/MapFiles.h"
@@ -10,10 +11,12 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <climits>
 #include <memory>
 #include <optional>
@@ -27,13 +30,37 @@ constexpr std::uint64_t blockSize = 512;
 
 std::uint64_t wholePages(std::uint64_t size) { return (size + basePage - 1) / basePage * basePage; }
 
+constexpr const char* descriptorsUnread = "Descriptors could not be looked at";
+constexpr const char* memoryLeftOut = "memory that only they keep is left out";
+
+/// What is known of the file will do: asking a server could take long.
+bool readStatus(const std::string& descriptor, struct statx& status) {
+    if (statx(AT_FDCWD, descriptor.c_str(), AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &status) == 0) {
+        return true;
+    }
+    struct stat older {}; // filters that do not know the newer call refuse it
+    if (errno == ENOENT || errno == ESRCH || stat(descriptor.c_str(), &older) != 0) {
+        return false;
+    }
+    status.stx_mode = static_cast<std::uint16_t>(older.st_mode);
+    status.stx_nlink = static_cast<std::uint32_t>(older.st_nlink);
+    status.stx_dev_major = major(older.st_dev);
+    status.stx_dev_minor = minor(older.st_dev);
+    status.stx_ino = older.st_ino;
+    status.stx_size = static_cast<std::uint64_t>(older.st_size);
+    status.stx_blocks = static_cast<std::uint64_t>(older.st_blocks);
+    return true;
+}
+
 /// A file without a name that only its descriptors, or mappings, keep: absent when it is none in memory.
 std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::string& descriptor,
                                       std::string_view link) {
     struct statx status {};
-    // What is known of it will do: asking a server could take long.
-    if (statx(AT_FDCWD, descriptor.c_str(), AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &status) != 0 ||
-        !S_ISREG(status.stx_mode) || status.stx_nlink != 0 || status.stx_dev_major != 0) {
+    if (!readStatus(descriptor, status)) {
+        noteRefusal(descriptorsUnread, errno, memoryLeftOut);
+        return std::nullopt;
+    }
+    if (!S_ISREG(status.stx_mode) || status.stx_nlink != 0 || status.stx_dev_major != 0) {
         return std::nullopt;
     }
     Mapping file;
@@ -68,8 +95,14 @@ std::optional<OwnedRecord> recordOf(const std::string& folder, const char* numbe
                         : link.starts_with("/dev/dri/")                            ? decodeGraphicsClient
                         : link == "anon_inode:bpf-map"                             ? decodeBpfMap
                                                                                    : nullptr;
-    return decode == nullptr ? std::nullopt
-                             : decode(readSystemRecord(folder + "/fdinfo/" + number).value_or(""));
+    if (decode == nullptr) {
+        return std::nullopt;
+    }
+    const std::optional<std::string> text = readSystemRecord(folder + "/fdinfo/" + number);
+    if (!text) {
+        noteRefusal(descriptorsUnread, errno, memoryLeftOut);
+    }
+    return text ? decode(*text) : std::nullopt;
 }
 
 } // namespace
@@ -77,17 +110,22 @@ std::optional<OwnedRecord> recordOf(const std::string& folder, const char* numbe
 bool forEachHeldObject(const std::string& folder, const std::function<void(const OwnedRecord&)>& found) {
     const std::unique_ptr<DIR, int (*)(DIR*)> descriptors(opendir((folder + "/fd").c_str()), closedir);
     if (!descriptors) {
+        const int error = errno;
+        noteRefusal(descriptorsUnread, error, memoryLeftOut);
+        errno = error;
         return false;
     }
     std::array<char, PATH_MAX> link; // the kernel shows no longer one
-    while (const dirent* entry = readdir(descriptors.get())) {
+    errno = 0;
+    for (const dirent* entry = nullptr; (entry = readdir(descriptors.get())) != nullptr; errno = 0) {
         const char* const number = entry->d_name;
         if (number[0] == '.') {
             continue; // the folder itself and the one above
         }
         const ssize_t length = readlinkat(dirfd(descriptors.get()), number, link.data(), link.size());
-        if (length <= 0) {
-            continue; // closed meanwhile, or no descriptor
+        if (length <= 0) { // closed meanwhile, or refused
+            noteRefusal(descriptorsUnread, errno, memoryLeftOut);
+            continue;
         }
         auto record = recordOf(folder, number, {link.data(), static_cast<std::size_t>(length)});
         if (record && record->holdsMemory()) {
@@ -95,6 +133,7 @@ bool forEachHeldObject(const std::string& folder, const std::function<void(const
             found(*record);
         }
     }
+    noteRefusal(descriptorsUnread, errno, memoryLeftOut);
     return true;
 }
 

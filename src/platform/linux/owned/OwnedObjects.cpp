@@ -1,6 +1,7 @@
 // The list of the objects that a task owns without mapping them.
 
 #include "platform/bsd_process.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/owned/HeldFiles.h"
@@ -13,8 +14,10 @@
 #include <cstring>
 #include <map>
 #include <optional>
+#include <string>
 #include <unordered_set>
 #include <utility>
+#include <vector>
 
 namespace tally::platform {
 
@@ -76,14 +79,17 @@ std::optional<Records> ownedBy(Task& task) {
     }
     Records records;
     MappedObjects mapped(*walk);
+    std::vector<std::string> notes;
+    const NoteTaker taker(notes);
     const bool isListed = forEachHeldObject(walk->folder(), [&](const OwnedRecord& record) {
         if (!mapped.contain(record.objectId)) {
             records.emplace(record.objectId, record);
         }
     });
-    if (!isListed) {
-        return std::nullopt;
+    if (!isListed && !isRefusal(errno)) {
+        return std::nullopt; // the process has ended
     }
+    task.addNotices(std::move(notes));
     listSegments(task, mapped, &records);
     std::erase_if(records, [&](const auto& record) { return !claimOwnedObject(record.first, task.pid()); });
     return records;

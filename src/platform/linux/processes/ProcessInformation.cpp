@@ -4,14 +4,13 @@
 
 #include "platform/bsd_process.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/processes/Executable.h"
 #include "platform/linux/processes/ProcessStat.h"
 
 #include <dirent.h>
-#include <elf.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <charconv>
 #include <cstring>
@@ -61,19 +60,6 @@ std::string nameFromArguments(std::int32_t pid, const std::string& fallback) {
     first = first.substr(0, first.find_first_of(" :"));
     first.remove_prefix(first.rfind('/') + 1);
     return first.empty() ? fallback : std::string(first);
-}
-
-/// Whether the executable of `pid` is a 64-bit program; one that cannot be looked at is taken to be like the
-/// tool.
-bool is64bitProgram(std::int32_t pid) {
-    std::array<unsigned char, EI_NIDENT> head{};
-    const Descriptor file = openForReading(processFolder(pid) + "/exe");
-    if (!file.isOpen() ||
-        read(file.number(), head.data(), head.size()) != static_cast<ssize_t>(head.size()) ||
-        std::memcmp(head.data(), ELFMAG, SELFMAG) != 0) {
-        return sizeof(void*) == 8;
-    }
-    return head[EI_CLASS] == ELFCLASS64;
 }
 
 template <std::size_t Size>
@@ -147,21 +133,17 @@ int sysctl_argmax(std::uint64_t* size) {
 }
 
 std::ptrdiff_t sysctl_procargs2(std::int32_t pid, std::span<char> area) {
-    std::optional<std::string> path = readSystemLink(processFolder(pid) + "/exe");
+    const std::optional<std::string> link = executableLink(pid);
     const std::optional<std::string> arguments = readSystemRecord(processFolder(pid) + "/cmdline");
-    if (!path || !arguments) {
+    if (!link || !arguments) {
         errno = errno == ENOENT ? ESRCH : errno;
         return -1;
-    }
-    constexpr std::string_view deleted = " (deleted)";
-    if (path->ends_with(deleted)) {
-        path->resize(path->size() - deleted.size());
     }
     // Readers look for the path behind the NULs of the count, so the count is kept below 256.
     const auto count = static_cast<std::int32_t>(
         std::min<std::ptrdiff_t>(std::count(arguments->begin(), arguments->end(), '\0'), 255));
     std::string text(reinterpret_cast<const char*>(&count), sizeof(count));
-    text += *path;
+    text += executablePath(pid, *link);
     text += '\0';
     text += *arguments;
     const std::size_t length = std::min(text.size(), area.size());

@@ -1,11 +1,18 @@
 #include "platform/linux/tags/PresentMemory.h"
 
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/walk/Mapping.h"
+
+#include <cerrno>
+#include <utility>
 
 namespace tally::platform {
 
 namespace {
+
+constexpr const char* memoryUnread = "Memory could not be looked into";
+constexpr const char* unnamed = "what allocators hold is not told apart";
 
 constexpr std::uint64_t pagemapPresent = std::uint64_t{1} << 63;
 
@@ -14,18 +21,34 @@ constexpr std::uint64_t pagemapPresent = std::uint64_t{1} << 63;
 bool PresentMemory::open() {
     if (!isTried_) {
         isTried_ = true;
-        memory_ = openForReading(*folder_ + "/mem");
-        pagemap_ = openForReading(*folder_ + "/pagemap");
+        for (const auto& [file, name] : {std::pair(&memory_, "/mem"), std::pair(&pagemap_, "/pagemap")}) {
+            *file = openForReading(*folder_ + name);
+            if (!file->isOpen()) {
+                noteRefusal(memoryUnread, errno, unnamed);
+            }
+        }
     }
     return memory_.isOpen() && pagemap_.isOpen();
 }
 
 bool PresentMemory::read(std::uint64_t address, std::span<std::uint64_t> words) {
+    if (!open()) {
+        return false;
+    }
     std::uint64_t entry = 0;
-    return open() &&
-           readExactly(pagemap_, address / basePage * sizeof entry,
-                       std::as_writable_bytes(std::span(&entry, 1))) &&
-           (entry & pagemapPresent) != 0 && readExactly(memory_, address, std::as_writable_bytes(words));
+    errno = 0;
+    const bool isRead = readExactly(pagemap_, address / basePage * sizeof entry,
+                                    std::as_writable_bytes(std::span(&entry, 1)));
+    if (isRead && (entry & pagemapPresent) == 0) {
+        return false;
+    }
+    if (isRead && readExactly(memory_, address, std::as_writable_bytes(words))) {
+        return true;
+    }
+    if (errno != EIO) { // so the kernel tells of what was unmapped meanwhile
+        noteRefusal(memoryUnread, errno, unnamed);
+    }
+    return false;
 }
 
 } // namespace tally::platform

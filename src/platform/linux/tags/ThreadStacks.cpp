@@ -1,5 +1,6 @@
 #include "platform/linux/tags/ThreadStacks.h"
 
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
 #include "platform/linux/processes/ProcessStat.h"
@@ -9,6 +10,7 @@
 #include <dirent.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstddef>
 #include <memory>
 #include <vector>
@@ -19,6 +21,8 @@ namespace {
 
 constexpr std::uint64_t largestGuard = 64 << 10;
 constexpr std::size_t mostThreadsAsked = 1024; // 14 us each
+
+constexpr const char* stacksUnnamed = "stacks of threads are not told apart";
 
 /// The mappings that lie as stacks do.
 std::vector<std::size_t> candidates(std::span<const Mapping> mappings, std::span<const std::uint32_t> tags) {
@@ -48,6 +52,9 @@ std::vector<std::uint64_t> stackPointers(const std::string& folder) {
         if (thread->d_name[0] != '.') {
             ++asked;
             const auto text = readSystemRecord(parent + "/" + thread->d_name + "/syscall");
+            if (!text) {
+                noteRefusal("Stack pointers could not be read", errno, stacksUnnamed);
+            }
             if (const auto pointer = decodeStackPointer(text.value_or(""))) {
                 pointers.push_back(*pointer);
             }
@@ -85,7 +92,11 @@ void tagThreadStacks(const std::string& folder, std::span<const Mapping> mapping
     if (found.empty()) {
         return;
     }
-    const std::optional<ProcessStat> stat = decodeStat(readSystemRecord(folder + "/stat").value_or(""));
+    const auto text = readSystemRecord(folder + "/stat");
+    if (!text) {
+        noteRefusal("The number of threads could not be read", errno, stacksUnnamed);
+    }
+    const std::optional<ProcessStat> stat = decodeStat(text.value_or(""));
     const std::size_t others = stat && stat->threads > 1 ? static_cast<std::size_t>(stat->threads) - 1 : 0;
     if (others == 0) {
         return; // a forked child keeps the stacks of threads that it does not have

@@ -126,14 +126,18 @@ const Walk* Task::walk(kern_return_t* status) {
             Walk::read(identity_, key_, owner_, !accountingSwitchIsOn(), std::exchange(status_, {}));
         *status = result.status;
         walk_ = std::move(result.walk);
-        for (std::string& notice : result.notices) {
-            if (std::find(given_.begin(), given_.end(), notice) == given_.end()) {
-                given_.push_back(notice);
-                notices_.push_back(std::move(notice));
-            }
-        }
+        addNotices(std::move(result.notices));
     }
     return walk_.get();
+}
+
+void Task::addNotices(std::vector<std::string> notices) {
+    for (std::string& notice : notices) {
+        if (std::find(given_.begin(), given_.end(), notice) == given_.end()) {
+            given_.push_back(notice);
+            notices_.push_back(std::move(notice));
+        }
+    }
 }
 
 mach_port_t makePort(std::shared_ptr<Task> task) { return portTable().add(std::move(task)); }

@@ -46,6 +46,8 @@ class Task {
     /// Keeps what was just read of the process's status, for the walk that follows.
     void noteStatus(const ProcessStatus& status) { status_ = status; }
     std::vector<std::string> takeNotices();
+    /// Adds notices; each is given once.
+    void addNotices(std::vector<std::string> notices);
 
   private:
     MemberIdentity identity_;

@@ -3,6 +3,7 @@
 #include "platform/linux/families/Families.h"
 #include "platform/linux/gather/LazyFree.h"
 #include "platform/linux/gather/MachineState.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
 #include "platform/linux/pieces/PieceBuilder.h"
@@ -66,6 +67,7 @@ constexpr const char* sharingNotice =
 Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView,
                         std::optional<ProcessStatus> known) {
     Result result;
+    const NoteTaker taker(result.notices);
     std::optional<AddressSpace> withRelatives = takeFamilySpace(key, owner);
     if (withRelatives && withRelatives->status == KERN_FAILURE) {
         withRelatives.reset();
