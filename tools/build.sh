@@ -2,7 +2,7 @@
 
 packages_to_build='g++ cmake ninja-build pkg-config libbsd-dev libelf-dev nlohmann-json3-dev'
 packages_to_test="$packages_to_build libgtest-dev libbenchmark-dev clang-format clang-tidy clang \
-    libclang-rt-dev python3 python3-jsonschema"
+    libclang-rt-dev python3 python3-jsonschema bindfs"
 
 # Sees to it that the named Debian packages are there: root installs what is missing, others are told.
 # Elsewhere than on Debian it is left to CMake to say what it lacks.

@@ -121,7 +121,7 @@ TEST_F(Corpse, ShowsOneInstantOfTwoHundredThreadsThatMapAndUnmap) {
     EXPECT_GT(tallies.size(), 5U) << "nothing changes, so that nothing is shown";
 }
 
-TEST_F(Corpse, LetsGoOfEveryThreadWhenTheToolIsKilled) {
+TEST_F(Corpse, LetsGoOfEveryThreadWhenTheToolIsKilledOrStopped) {
     const Puppet busy({"churn", "200"});
     const Puppet stopped({"churn", "20"});
     stop(stopped.pid());
@@ -134,15 +134,28 @@ TEST_F(Corpse, LetsGoOfEveryThreadWhenTheToolIsKilled) {
         posix_spawn_file_actions_t actions;
         posix_spawn_file_actions_init(&actions);
         posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
+        posix_spawnattr_t
+            group; // of its own, as a shell gives it, or the terminal's signal would stop nothing
+        posix_spawnattr_init(&group);
+        posix_spawnattr_setflags(&group, POSIX_SPAWN_SETPGROUP);
         pid_t tool = 0;
-        ASSERT_EQ(posix_spawn(&tool, words[0], &actions, nullptr, words, environ), 0);
+        ASSERT_EQ(posix_spawn(&tool, words[0], &actions, &group, words, environ), 0);
         posix_spawn_file_actions_destroy(&actions);
+        posix_spawnattr_destroy(&group);
         awaitTracer(pid);
         std::this_thread::sleep_for(std::chrono::microseconds(random() % 4000));
-        kill(tool, SIGKILL);
-        waitpid(tool, nullptr, 0);
+        if (round % 4 < 2) {
+            kill(tool, SIGTSTP);
+        } else {
+            kill(tool, SIGKILL);
+            waitpid(tool, nullptr, 0);
+        }
         expectThreads(busy.pid(), 201, "RSD");
         expectThreads(stopped.pid(), 21, "T");
+        if (round % 4 < 2) {
+            kill(tool, SIGKILL);
+            waitpid(tool, nullptr, 0);
+        }
     }
 }
 
@@ -351,6 +364,19 @@ TEST_F(Corpse, ThatCannotBeHadIsSaidAndTheRunGoesOn) {
     expectRefused("no access", {PUPPET_PROGRAM, "refuse", "0"}, 0); // as where tracing is forbidden
     puppet.end(true);
     expectRefused("terminated", {}, 1);
+    const pid_t waiting = fork();
+    if (waiting == 0) { // in the kernel, for what a child of it does
+        if (vfork() == 0) {
+            alarm(60);
+            pause();
+        }
+        _exit(0);
+    }
+    std::this_thread::sleep_for(100ms);
+    mach_port_t corpse = MACH_PORT_NULL;
+    EXPECT_EQ(task_generate_corpse(portOf(waiting).name(), &corpse), KERN_OPERATION_TIMED_OUT);
+    kill(waiting, SIGKILL);
+    waitpid(waiting, nullptr, 0);
 }
 
 } // namespace

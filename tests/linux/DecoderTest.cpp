@@ -3,6 +3,7 @@
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/pieces/CountedPages.h"
+#include "platform/linux/processes/Executable.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/DecodeMaps.h"
 
@@ -54,6 +55,17 @@ TEST(DecodeMaps, ReadsWhateverAPathHolds) {
     EXPECT_EQ(two[0].deviceMajor, 0xfdU);
     EXPECT_EQ(two[0].deviceMinor, 0x10U);
     EXPECT_TRUE(two[1].isPrivateAnonymous());
+}
+
+TEST(DecodeAuxiliary, TellsTheClassOfAProgram) {
+    const auto vector = [](auto type, auto value) { // the type of a 64-bit or of a 32-bit word
+        const decltype(type) words[] = {6, 4096, type, value, 0, 0};
+        return std::string(reinterpret_cast<const char*>(words), sizeof words);
+    };
+    EXPECT_EQ(decodeIs64bit(vector(std::uint64_t{4}, std::uint64_t{56})), true);
+    EXPECT_EQ(decodeIs64bit(vector(std::uint32_t{4}, std::uint32_t{32})), false);
+    EXPECT_EQ(decodeIs64bit(vector(std::uint64_t{3}, std::uint64_t{64})), std::nullopt);
+    EXPECT_EQ(decodeIs64bit(""), std::nullopt);
 }
 
 TEST(DecodeSmaps, TakesTheFiguresOfEachMapping) {

@@ -3,10 +3,12 @@
 #include "linux/Puppet.h"
 
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <csignal>
 #include <filesystem>
 #include <fstream>
 
@@ -101,6 +103,9 @@ TEST(Program, ClosedStreamsAndAClosedPipeEndNothing) {
                   .status,
               1);
     EXPECT_EQ(run({"/bin/sh", "-c", "{ " + command + " -v; echo $? >&2; } | true"}).errors, "0\n");
+    const Outcome few = run({"/bin/sh", "-c", "ulimit -n 8; exec " + command});
+    EXPECT_EQ(few.status, 1);
+    EXPECT_TRUE(few.errors.starts_with("Too few file descriptors are allowed: 8, ")) << few.errors;
 }
 
 TEST(Program, SaysWhatItCouldNotWrite) {
@@ -121,6 +126,74 @@ TEST(Program, SaysWhatItCouldNotWrite) {
         EXPECT_EQ(outcome.status, 1) << line;
         EXPECT_EQ(outcome.errors, errors);
     }
+}
+
+TEST(Program, WhatMayNotBeLookedAtIsAWarning) {
+    const Puppet puppet({"idle"});
+    const Outcome outcome = run({PUPPET_PROGRAM, "refuse", std::to_string(SYS_readlinkat) + ":13",
+                                 TALLY_PROGRAM, "--pid", pidOf(puppet)});
+    const std::string warning = "Descriptors could not be looked at (Permission denied): "
+                                "memory that only they keep is left out\n";
+    const std::size_t at = outcome.output.find(warning);
+    EXPECT_NE(at, std::string::npos) << outcome.output;
+    EXPECT_EQ(outcome.output.find(warning, at + 1), std::string::npos) << "once";
+}
+
+TEST(Program, OnlyTheMarkOfADeletedExecutableIsTakenOffItsName) {
+    const TemporaryFolder folder;
+    for (const std::string& name : {std::string("alive-7 (deleted)"), std::string("gone-7")}) {
+        const std::string path = folder.path() + "/" + name;
+        std::filesystem::copy_file(PUPPET_PROGRAM, path);
+        const Puppet puppet({"idle"}, path);
+        if (name == "gone-7") {
+            std::filesystem::remove(path);
+        }
+        for (const char* way : {"-w", "--forkCorpse"}) {
+            const Outcome outcome = run({TALLY_PROGRAM, way, "-p", name});
+            EXPECT_TRUE(holds(outcome.output, "\n" + name + " [" + pidOf(puppet) + "]")) << outcome.errors;
+        }
+    }
+}
+
+/// A program that is mapped from a mount of which nobody answers.
+TEST(Program, AFileSystemThatDoesNotAnswerHoldsUpNothing) {
+    const std::string server = "/usr/bin/bindfs";
+    if (geteuid() != 0 || !std::filesystem::exists(server) || access("/dev/fuse", R_OK | W_OK) != 0) {
+        GTEST_SKIP() << "needs root, /dev/fuse and bindfs";
+    }
+    const TemporaryFolder folder;
+    const std::string mount = folder.path() + "/mount";
+    std::filesystem::create_directories(folder.path() + "/source");
+    std::filesystem::create_directories(mount);
+    std::filesystem::copy_file(PUPPET_PROGRAM, folder.path() + "/source/program");
+    const Background bindfs({server, "-f", folder.path() + "/source", mount}, folder.path());
+    for (int i = 0; i < 500 && !std::filesystem::exists(mount + "/program"); ++i) {
+        usleep(10'000);
+    }
+    if (!std::filesystem::exists(mount + "/program")) {
+        GTEST_SKIP() << "nothing can be mounted here";
+    }
+    {
+        const Puppet puppet({"idle"}, mount + "/program");
+        const Puppet other({"idle"});
+        kill(bindfs.pid(), SIGSTOP);
+        const std::string file = folder.path() + "/snapshot";
+        const std::vector<std::string> ways[] = {{TALLY_PROGRAM, "-p", "program"},
+                                                 {TALLY_PROGRAM, "--forkCorpse", "-p", "program"},
+                                                 {TALLY_PROGRAM, "--vmObjectDirty", "-p", "program"},
+                                                 {HEAPSNAP_PROGRAM, "-o", file, pidOf(puppet)},
+                                                 {TALLY_PROGRAM, "--pid", pidOf(other)}};
+        for (const std::vector<std::string>& way : ways) {
+            std::vector<std::string> command{"/usr/bin/timeout", "-s", "KILL", "60"};
+            command.insert(command.end(), way.begin(), way.end());
+            const Outcome outcome = run(command);
+            EXPECT_EQ(outcome.status, 0) << way[1] << outcome.errors;
+            EXPECT_EQ(holds(outcome.output + outcome.errors, "it does not answer"), way[1] != "--pid")
+                << way[1];
+        }
+        kill(bindfs.pid(), SIGCONT);
+    }
+    umount2(mount.c_str(), MNT_DETACH);
 }
 
 TEST(Program, ProcessesThatComeAndGoDisturbNothing) {

@@ -74,12 +74,15 @@ Descriptor findByName(const std::string& folder, const Mapping& mapping) {
         return Descriptor();
     }
     const Descriptor root(open((folder + "/root").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    open_how how{.flags = O_PATH | O_CLOEXEC | O_NOFOLLOW, .mode = 0, .resolve = RESOLVE_CACHED};
+    if (!root.isOpen()) {
+        return Descriptor();
+    }
     // A file that is mapped is in the kernel's cache of names, and so is the way to it.
+    open_how how{.flags = O_PATH | O_CLOEXEC | O_NOFOLLOW, .mode = 0, .resolve = RESOLVE_CACHED};
     Descriptor file(
         static_cast<int>(syscall(SYS_openat2, root.number(), mapping.name.c_str() + 1, &how, sizeof how)));
     if (!file.isOpen()) {
-        errno = !root.isOpen() || errno == ENOENT || errno == EACCES ? errno : EAGAIN;
+        errno = errno == ENOENT || errno == EACCES ? errno : EAGAIN;
         return Descriptor();
     }
     struct stat status {};
