@@ -12,6 +12,7 @@
 #include <iterator>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <utility>
 #include <vector>
@@ -43,8 +44,10 @@ Search& search() {
     return current;
 }
 
-std::uint64_t lazilyFreed(const std::string& folder) {
-    return decodeRollupLazyFree(readSystemRecord(folder + "/smaps_rollup").value_or(""));
+/// Bytes of it; absent when the kernel does not tell, and smaps must be asked.
+std::optional<std::uint64_t> lazilyFreed(const std::string& folder) {
+    const std::optional<std::string> text = readSystemRecord(folder + "/smaps_rollup");
+    return text ? std::optional(decodeRollupLazyFree(*text)) : std::nullopt;
 }
 
 void prepare(Search& search) {
@@ -55,17 +58,17 @@ void prepare(Search& search) {
         if (!pids.insert(task->pid()).second) {
             continue;
         }
-        if (const std::optional<ProcessStatus> status = readProcessStatus(task->pid())) {
-            search.candidates.push_back({task->pid(), status->residentAnonymous, task->familyKey()});
-        }
+        const std::optional<ProcessStatus> status = readProcessStatus(task->pid());
+        search.candidates.push_back({task->pid(), status ? status->residentAnonymous : 0, task->familyKey()});
     }
     std::sort(search.candidates.begin(), search.candidates.end(),
               [](const auto& a, const auto& b) { return a.residentAnonymous < b.residentAnonymous; });
 }
 
 /// Takes what one process has off what is left to be found.
-void enter(Search& search, const Search::Candidate& candidate, std::uint64_t found) {
-    search.answers[candidate.pid] = found != 0;
+void enter(Search& search, const Search::Candidate& candidate, std::optional<std::uint64_t> answer) {
+    const std::uint64_t found = answer.value_or(0);
+    search.answers[candidate.pid] = answer != 0;
     std::uint64_t known = 0;
     if (candidate.family.isKnown() && found != 0) {
         std::uint64_t& largest = search.largestOfFamily[candidate.family];
@@ -81,7 +84,7 @@ void ask(Search& search, std::vector<Search::Candidate>::iterator candidate,
     search.candidates.erase(candidate);
     ++search.asked;
     lock.unlock();
-    const std::uint64_t found = lazilyFreed(processFolder(asked.pid));
+    const std::optional<std::uint64_t> found = lazilyFreed(processFolder(asked.pid));
     lock.lock();
     --search.asked;
     enter(search, asked, found);

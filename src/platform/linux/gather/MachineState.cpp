@@ -4,7 +4,11 @@
 #include "platform/linux/io/TextScan.h"
 #include "platform/linux/walk/Mapping.h"
 
+#include <sys/sysinfo.h>
+
 #include <algorithm>
+#include <cerrno>
+#include <limits>
 #include <mutex>
 #include <optional>
 #include <thread>
@@ -34,13 +38,20 @@ std::int64_t noisePages() {
     return ofOneProcessor * std::max<std::int64_t>(std::thread::hardware_concurrency(), 1);
 }
 
+/// The same without a file; true when that cannot be had either.
+bool swapInUseBySystem() {
+    struct sysinfo system {};
+    return sysinfo(&system) != 0 || system.totalswap != system.freeswap;
+}
+
 MachineState readMachineState() {
-    const std::string meminfo = readSystemFile(systemPath("/proc/meminfo")).value_or("");
-    const std::string vmstat = readSystemFile(systemPath("/proc/vmstat")).value_or("");
-    const std::string merged = readSystemFile(systemPath("/sys/kernel/mm/ksm/pages_shared")).value_or("");
-    return {.swapInUse = decodeSwapInUse(meminfo),
-            .mergesPages = numberOf(merged, "") != 0,
-            .lazyFree = decodeLazyFree(vmstat)};
+    const std::optional<std::string> meminfo = readSystemFile(systemPath("/proc/meminfo"));
+    const std::optional<std::string> vmstat = readSystemFile(systemPath("/proc/vmstat"));
+    const std::optional<std::string> merged = readSystemFile(systemPath("/sys/kernel/mm/ksm/pages_shared"));
+    const bool cannotMerge = !merged && errno == ENOENT;
+    return {.swapInUse = meminfo ? decodeSwapInUse(*meminfo) : swapInUseBySystem(),
+            .mergesPages = merged ? numberOf(*merged, "") != 0 : !cannotMerge,
+            .lazyFree = vmstat ? decodeLazyFree(*vmstat) : std::numeric_limits<std::uint64_t>::max()};
 }
 
 struct CurrentGather {

@@ -8,10 +8,12 @@
 
 namespace tally::platform {
 
+/// What cannot be read is taken for what makes processes be asked themselves.
 struct MachineState {
     bool swapInUse = false;
-    bool mergesPages = false;   // pages of the same content are one (KSM)
-    std::uint64_t lazyFree = 0; // bytes that processes have given up and the kernel may take, about
+    bool mergesPages = false; // pages of the same content are one (KSM)
+    // Bytes that processes have given up and the kernel may take, about; the most where that is not known.
+    std::uint64_t lazyFree = 0;
 };
 
 /// Bytes of lazily freed memory by a vmstat text: such pages stand on the lists of inactive file pages, but

@@ -12,6 +12,7 @@ bool SmapsOfProcess::isReadable() {
         const auto take = [&](std::string_view lines) { decodeSmaps(lines, &entries_); };
         if (!file.isOpen() || !readLines(file, take)) {
             entries_.clear();
+            isMissed_ = true;
         }
     });
     return !entries_.empty();

@@ -23,10 +23,13 @@ class SmapsOfProcess {
     const SmapsEntry* entryFor(const Mapping& mapping);
     /// Whether smaps could be read and has entries.
     bool isReadable();
+    /// Whether it was asked for and could not be read. No other thread may ask meanwhile.
+    bool wasMissed() const { return isMissed_; }
 
   private:
     std::string folder_;
     std::once_flag isRead_;
+    bool isMissed_ = false;
     std::vector<SmapsEntry> entries_;
 };
 

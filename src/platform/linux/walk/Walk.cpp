@@ -22,13 +22,15 @@ namespace {
 
 /// Finds out which figures that only smaps tells the process can have at all.
 WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView, const std::string& folder,
-                      const std::optional<ProcessStatus>& known) {
-    const ProcessStatus status =
-        known ? *known : decodeStatus(readSystemRecord(folder + "/status").value_or(""));
+                      std::optional<ProcessStatus> known) {
     const MachineState machine = machineState();
     WalkFacts facts{.owner = owner, .objectView = objectView, .swapInUse = machine.swapInUse};
-    facts.asksLocked = status.locked != 0;
-    facts.asksLazyFree = hasLazilyFreedMemory(task.pid, folder, status.residentAnonymous);
+    if (!known) {
+        const std::optional<std::string> text = readSystemRecord(folder + "/status");
+        known = text ? std::optional(decodeStatus(*text)) : std::nullopt;
+    }
+    facts.asksLocked = !known || known->locked != 0;
+    facts.asksLazyFree = !known || hasLazilyFreedMemory(task.pid, folder, known->residentAnonymous);
     return facts;
 }
 
@@ -57,6 +59,8 @@ constexpr const char* mergedPagesNotice =
     "Pages that the kernel has merged by their content (KSM) count for every process that has them";
 constexpr const char* pageCacheNotice =
     "The page cache could not be asked: shared memory and files are counted by the process's own page tables";
+constexpr const char* missedSmapsNotice =
+    "Its smaps could not be read: lazily freed memory counts as dirty, and none as locked";
 constexpr const char* unreadRelativesNotice =
     "What is shared with forked relatives counts for each of them: they could not be read side by side";
 constexpr const char* sharingNotice =
@@ -97,6 +101,9 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
     walk->words_ = builder.takeWords();
     if (machineState().mergesPages && hasMergedPages(space.folder)) {
         result.notices.emplace_back(mergedPagesNotice);
+    }
+    if (smaps.wasMissed()) {
+        result.notices.emplace_back(missedSmapsNotice);
     }
     if (builder.usedEstimates()) {
         result.notices.emplace_back(pageCacheNotice);
