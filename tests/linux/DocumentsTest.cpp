@@ -79,8 +79,8 @@ TEST(Documents, GoWhereverAPathLeads) {
     EXPECT_EQ(busy.errors, "Unable to open JSON writer: Text file busy\nUnable to create JSON output\n");
 }
 
-/// Waits until the run in `folder` has printed `count` samples more.
-void awaitSamples(const std::string& folder, std::size_t count) {
+/// Waits until `run` in `folder` has printed `count` samples more; throws when it ends before.
+void awaitSamples(const Background& run, const std::string& folder, std::size_t count) {
     const auto printed = [&] {
         const std::string text = contentsOf(folder + "/out");
         std::size_t found = 0;
@@ -90,6 +90,9 @@ void awaitSamples(const std::string& folder, std::size_t count) {
         return found;
     };
     for (const std::size_t before = printed(); printed() < before + count;) {
+        if (run.hasEnded()) {
+            throw std::runtime_error("the run has ended: " + contentsOf(folder + "/err"));
+        }
         std::this_thread::sleep_for(std::chrono::milliseconds(20));
     }
 }
@@ -102,8 +105,7 @@ TEST(Documents, AFullDiskIsSaidAndLeavesWholeLines) {
                      "-m",
                      "/bin/sh",
                      "-c",
-                     "mount -t tmpfs -o size=64k none /mnt || exit 77; cd /mnt; exec " TALLY_PROGRAM
-                     " --pid $0 " +
+                     "mount -t tmpfs -o size=64k none /mnt && cd /mnt && exec " TALLY_PROGRAM " --pid $0 " +
                          words,
                      pidOf(puppet)};
     };
@@ -111,18 +113,17 @@ TEST(Documents, AFullDiskIsSaidAndLeavesWholeLines) {
         return holds(contentsOf(folder.path() + "/err"),
                      "Unable to write all of " + file + ", which is incomplete: No space left on device\n");
     };
-    const int status = Background(onSmallDisk("-v -j x.json"), folder.path()).wait();
-    if (geteuid() != 0 || status == 77) {
+    if (run({"/usr/bin/unshare", "-m", "mount", "-t", "tmpfs", "none", "/mnt"}).status != 0) {
         GTEST_SKIP() << "no file system can be mounted here";
     }
-    EXPECT_EQ(status, 1);
+    EXPECT_EQ(Background(onSmallDisk("-v -j x.json"), folder.path()).wait(), 1);
     EXPECT_TRUE(incomplete("x.json"));
 
     Background sampling(onSmallDisk("--sample 0.02 --benchlog x.blj"), folder.path());
-    awaitSamples(folder.path(), 2);
+    awaitSamples(sampling, folder.path(), 2);
     const std::string disk = "/proc/" + std::to_string(sampling.pid()) + "/cwd/";
     { std::ofstream(disk + "rest") << std::string(65536, 'x'); }
-    awaitSamples(folder.path(), 10);
+    awaitSamples(sampling, folder.path(), 10);
     const std::string lines = contentsOf(disk + "x.blj");
     EXPECT_TRUE(lines.ends_with("}\n")) << lines;
     kill(sampling.pid(), SIGINT);
@@ -144,12 +145,12 @@ void followAPuppet(std::chrono::seconds time) {
         }
         return -1L;
     };
-    awaitSamples(folder.path(), 10);
+    awaitSamples(sampling, folder.path(), 10);
     [[maybe_unused]] const long early = anonymous();
     std::this_thread::sleep_for(time);
     [[maybe_unused]] const long late = anonymous();
     puppet.reset();
-    awaitSamples(folder.path(), 8); // its children last a little longer
+    awaitSamples(sampling, folder.path(), 8); // its children last a little longer
     kill(sampling.pid(), SIGINT);
     EXPECT_EQ(sampling.wait(), 0);
     const std::string errors = contentsOf(folder.path() + "/err");
@@ -238,10 +239,10 @@ TEST(Documents, AreWholeWhicheverSignalEndsSampling) {
     };
     for (const int signal : {SIGINT, SIGTERM, SIGHUP, 0}) {
         Background tally(sampling(signal == 0 ? "trap '' HUP; " : ""), folder.path());
-        awaitSamples(folder.path(), 1);
+        awaitSamples(tally, folder.path(), 1);
         if (signal == 0) { // a hang-up that was ignored from the start ends nothing
             kill(tally.pid(), SIGHUP);
-            awaitSamples(folder.path(), 3);
+            awaitSamples(tally, folder.path(), 3);
         }
         kill(tally.pid(), signal == 0 ? SIGINT : signal);
         EXPECT_EQ(tally.wait(), 0) << signal;

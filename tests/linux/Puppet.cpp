@@ -15,6 +15,7 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
+#include <stdexcept>
 #include <thread>
 #include <utility>
 
@@ -113,7 +114,11 @@ Puppet::Puppet(std::vector<std::string> arguments, const std::string& program) {
         }
     }
     std::fclose(stream);
-    EXPECT_TRUE(ready) << "the puppet ended before it was ready";
+    if (!ready) {
+        end();
+        close(input_);
+        throw std::runtime_error("the puppet ended before it was ready");
+    }
 }
 
 void Puppet::end(bool leaveZombie) {
@@ -176,6 +181,12 @@ Background::~Background() {
         kill(pid_, SIGKILL);
         wait();
     }
+}
+
+bool Background::hasEnded() const {
+    siginfo_t ended{};
+    return waitid(P_PID, static_cast<id_t>(pid_), &ended, WEXITED | WNOHANG | WNOWAIT) == 0 &&
+           ended.si_pid != 0;
 }
 
 int Background::wait() { return waitFor(std::exchange(pid_, -1)); }

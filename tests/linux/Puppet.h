@@ -21,7 +21,7 @@ class Puppet {
         std::map<std::string, std::string> figures; // "dirty" and so on: bytes, or "any"
     };
 
-    /// Starts a puppet program with `arguments` and waits until it is ready.
+    /// Starts a puppet program with `arguments` and waits until it is ready; throws when it ends before.
     explicit Puppet(std::vector<std::string> arguments, const std::string& program = PUPPET_PROGRAM);
     ~Puppet();
     Puppet(const Puppet&) = delete;
@@ -62,6 +62,7 @@ class Background {
     Background& operator=(const Background&) = delete;
 
     int pid() const { return pid_; }
+    bool hasEnded() const;
     /// Waits for the end. @return the exit status, or 128 + the signal.
     int wait();
 
