@@ -15,6 +15,15 @@ kern_return_t statusForErrno(int error) {
                                                                    : KERN_INVALID_ARGUMENT;
 }
 
+namespace {
+
+bool firstThreadHasEnded(std::int32_t pid) {
+    const std::optional<ProcessStat> stat = readProcessStat(pid);
+    return stat && stat->state == 'Z';
+}
+
+} // namespace
+
 kern_return_t ProcessMemoryFiles::openFolder(std::string path, std::vector<Mapping>* mappings) {
     folder = std::move(path);
     maps = openForReading(folder + "/maps");
@@ -34,6 +43,9 @@ kern_return_t ProcessMemoryFiles::openFolder(std::string path, std::vector<Mappi
 kern_return_t ProcessMemoryFiles::open(std::int32_t pid, std::uint64_t startTicks,
                                        std::vector<Mapping>* mappings) {
     kern_return_t status = openFolder(processFolder(pid), mappings);
+    if (status == KERN_NO_ACCESS && firstThreadHasEnded(pid)) {
+        status = KERN_INVALID_ARGUMENT; // of a thread that has ended nothing is shown to ordinary users
+    }
     if (status == KERN_INVALID_ARGUMENT) {
         for (std::string& thread : threadFolders(pid)) {
             status = openFolder(std::move(thread), mappings);
