@@ -22,12 +22,12 @@ class HeapsnapDriver : public testing::Test {
         kernel.addTask({.pid = 9, .name = "one", .path = "/bin/o\033e"})
             .map({.start = 0x1000, .pages = "CC", .file = "/f"});
         kernel.addTask({.pid = 10, .name = "guarded", .portStatus = KERN_NO_ACCESS});
-        std::filesystem::create_directories("heapsnaps");
-        std::filesystem::current_path("heapsnaps");
+        std::filesystem::create_directories(folder);
+        std::filesystem::current_path(folder);
     }
     ~HeapsnapDriver() override {
         std::filesystem::current_path("..");
-        std::filesystem::remove_all("heapsnaps");
+        std::filesystem::remove_all(folder);
     }
 
     int run(const std::string& words) {
@@ -43,6 +43,7 @@ class HeapsnapDriver : public testing::Test {
         return QRYDirectedGraphWithData(std::string(std::istreambuf_iterator<char>(stream), {}), &error);
     }
 
+    const std::string folder = "heapsnaps-" + std::to_string(getpid()); // tests run side by side
     ScriptedKernel kernel;
     std::string output, messages;
 };

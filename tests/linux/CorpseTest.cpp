@@ -264,6 +264,9 @@ TEST_F(Corpse, ReportsWhatStillProcessesReport) {
                                                {"family", "2", "2048", "huge"},
                                                {"family", "2", "600", "grow"}};
     for (const std::vector<std::string>& shape : shapes) {
+        if (&shape != shapes && geteuid() != 0) {
+            GTEST_SKIP() << "relatives of corpses are told by frame numbers, which are for root";
+        }
         const Puppet puppet(shape);
         for (const std::string view : {"--swapped", "--vmObjectDirty"}) { // the first changes no figure
             std::vector<std::string> command{TALLY_PROGRAM, "-f", "bytes",

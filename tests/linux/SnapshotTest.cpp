@@ -64,26 +64,28 @@ TEST_F(Snapshot, ReportsWhatTheProcessReports) {
     const Puppet big({"big", "64"});
     const Puppet* const puppets[] = {&zoo, &big};
     for (const std::string view : {"--swapped", "--vmObjectDirty"}) { // the first changes nothing here
+        if (view == "--vmObjectDirty" && geteuid() != 0) {
+            GTEST_SKIP() << "the page cache is asked for root only";
+        }
         for (const Puppet* puppet : puppets) {
             const std::string pid = std::to_string(puppet->pid());
-            take(*puppet, pid, view == "--swapped" ? "--" : view);
-            const Outcome live = tally({view, "--pid", pid});
-            const Outcome saved = tally({view, path(pid)});
-            EXPECT_EQ(saved.errors, "");
-            Rows expected = rowsOf(live.output);
-            // A snapshot has no page tables.
-            const bool hasTables = std::erase_if(expected, [](const auto& row) {
-                                       return row.first.ends_with(": page table");
-                                   }) != 0;
-            EXPECT_EQ(hasTables, view == "--swapped");
-            Rows found = rowsOf(saved.output);
-            if (hasTables) {
-                for (Rows* rows : {&expected, &found}) {
-                    std::erase_if(*rows, [](const auto& row) { return row.first.ends_with(": TOTAL"); });
+            const auto figuresOf = [&](const std::string& target) {
+                const Outcome outcome = tally({view, target == pid ? "--pid" : "--", target});
+                EXPECT_EQ(outcome.errors, "");
+                std::string text;
+                for (const auto& [row, figures] : rowsOf(outcome.output)) {
+                    // A snapshot has no page tables, which only the first view shows.
+                    const bool mayDiffer = row.ends_with(": page table") || row.ends_with(": TOTAL");
+                    text += mayDiffer && view == "--swapped" ? "" : row + " " + figures + "\n";
                 }
-            }
-            EXPECT_GT(found.size(), 8U);
-            EXPECT_EQ(found, expected);
+                EXPECT_GT(text.size(), 500U);
+                return text;
+            };
+            expectSameReport([&] { return figuresOf(pid); },
+                             [&] {
+                                 take(*puppet, pid, view == "--swapped" ? "--" : view);
+                                 return figuresOf(path(pid));
+                             });
         }
     }
 }
