@@ -15,17 +15,19 @@ using namespace platform;
 namespace {
 
 constexpr std::uint64_t PagesPerQuery = 4096;
+constexpr std::uint64_t PagesBehindGap = 64; // of the first query there; of each that follows twice as many
 
 /// Asks for the state of `pageCount` pages from `start` on and calls handler(words, index of the first of
-/// them) for each chunk of them. Chunks of absent pages behind another such chunk are left out, but for the
-/// last: what is only reserved can be a billion times what is there.
+/// them) for each chunk of them. Of what is absent behind a chunk only the last page is told: what is only
+/// reserved can be a billion times what is there.
 /// @return false, with the error recorded, when the kernel refuses.
 template <typename Handler>
 bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t pageCount,
                            Handler&& handler) {
     std::array<std::int32_t, PagesPerQuery> words;
+    std::uint64_t wanted = PagesPerQuery;
     for (std::uint64_t first = 0; first < pageCount;) {
-        std::uint64_t count = std::min(pageCount - first, PagesPerQuery);
+        std::uint64_t count = std::min(pageCount - first, wanted);
         const std::span<std::int32_t> chunk = std::span(words).first(count);
         const std::uint64_t address = start + first * task.pageSize();
         const kern_return_t status =
@@ -36,13 +38,14 @@ bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t 
             return false;
         }
         handler(std::span<const std::int32_t>(chunk.first(count)), first);
-        first += PagesPerQuery;
-        if (first < pageCount &&
-            std::ranges::all_of(chunk.first(count), [](auto word) { return word == 0; })) {
+        first += chunk.size();
+        wanted = std::min(2 * wanted, PagesPerQuery);
+        if (first < pageCount) {
             const std::uint64_t next = mach_vm_next_page(task.task(), start + first * task.pageSize(),
                                                          start + pageCount * task.pageSize());
             const std::uint64_t index = std::min((next - start) / task.pageSize(), pageCount - 1);
-            first = std::max(first, index / PagesPerQuery * PagesPerQuery);
+            wanted = index == first ? wanted : PagesBehindGap;
+            first = index;
         }
     }
     return true;
@@ -100,8 +103,14 @@ class PageRun {
         (kind == Kind::absent ? start_ : length_) += pageSize_;
     }
 
-    /// Passes over pages that are absent, behind one that is.
-    void skip(std::uint64_t pages) { start_ += pages * pageSize_; }
+    /// Passes over pages that are absent.
+    void skip(std::uint64_t pages) {
+        if (pages != 0) {
+            finish();
+            kind_ = Kind::absent;
+            start_ += pages * pageSize_;
+        }
+    }
 
     /// Hands the run to the region, unless it is one of absent pages.
     void finish() {
