@@ -34,6 +34,7 @@
 #include <fcntl.h>
 #include <linux/audit.h>
 #include <linux/filter.h>
+#include <linux/io_uring.h>
 #include <linux/seccomp.h>
 #include <linux/userfaultfd.h>
 #include <pthread.h>
@@ -268,6 +269,13 @@ void zooOfSharedMemory() {
         shmctl(id, IPC_RMID, nullptr);
         write(m, 0, 9);
         tell("sysv", m, 16, figure("dirty", 9));
+    }
+
+    io_uring_params parameters{};
+    const int ring = static_cast<int>(syscall(SYS_io_uring_setup, 8, &parameters));
+    if (ring >= 0) { // else it is forbidden here
+        m = map(page, readWrite, MAP_SHARED, ring);
+        tell("ring", m, 1, figure("dirty", 1));
     }
 
     constexpr std::size_t hugePages = 512;

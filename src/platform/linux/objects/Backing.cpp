@@ -60,8 +60,9 @@ BackingObject backingOf(const Mapping& mapping, const std::string& folder, const
     object.isSysV = internal && mapping.name.starts_with("/SYSV");
     if (system == FileSystemKind::hugetlb || mapping.pageSize > basePage) {
         object.backing = Backing::hugetlb;
-    } else if (mapping.name.starts_with("/dev/") && !internal &&
-               !isRegularFile(statusOf(mapping, folder, descriptor))) {
+    } else if (mapping.name.starts_with("anon_inode:") ||
+               (mapping.name.starts_with("/dev/") && !internal &&
+                !isRegularFile(statusOf(mapping, folder, descriptor)))) {
         object.backing = Backing::device; // device files live on a tmpfs too
     } else {
         object.backing = system == FileSystemKind::sharedMemory ? Backing::sharedMemory : Backing::file;

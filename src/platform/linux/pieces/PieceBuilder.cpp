@@ -16,8 +16,10 @@ constexpr std::int32_t cleanFilePage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUER
 constexpr std::int32_t dirtyFilePage = cleanFilePage | VM_PAGE_QUERY_PAGE_DIRTY;
 constexpr std::int32_t sharedMemoryPage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
 
-bool isSharedMemory(const BackingObject& object) {
-    return object.backing == Backing::sharedMemory || object.backing == Backing::hugetlb;
+/// Whether its pages are the only copy, so that the kernel can drop none of them.
+bool isOnlyCopy(const BackingObject& object) {
+    return object.backing == Backing::sharedMemory || object.backing == Backing::hugetlb ||
+           object.backing == Backing::device;
 }
 
 std::uint64_t filePage(const Mapping& mapping) { return mapping.fileOffset / basePage; }
@@ -116,12 +118,12 @@ PieceBuilder::ObjectPages PieceBuilder::chargedObjectPages(std::size_t index) {
             counted_.take(id, {base + run.firstPage, base + run.endPage()}, &fresh);
         }
     }
-    const std::int32_t word = isSharedMemory(backing) ? sharedMemoryPage : cleanFilePage;
+    const std::int32_t word = isOnlyCopy(backing) ? sharedMemoryPage : cleanFilePage;
     for (const PageRange& range : fresh) {
         pages.resident += range.pages();
         pages.words.push_back(wordsOf(range, base, word));
     }
-    if (isSharedMemory(backing)) {
+    if (isOnlyCopy(backing)) {
         pages.dirty = pages.resident;
         if (facts_.swapInUse && backing.backing == Backing::sharedMemory) {
             markSwapped(index, openMappedFile(folder_, mapping), pages);
