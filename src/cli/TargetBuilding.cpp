@@ -59,7 +59,8 @@ class TargetBuilder {
     bool canMeasure() const;
     void noticePidsNamedTwice() const;
     void notice(const std::string& text) const;
-    std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name) const;
+    std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name,
+                                          const TLOpenedProcess& opened) const;
 
     bool fail(int code, std::string message) {
         error_ = TLError{TLTallyErrorDomain, code, std::move(message)};
@@ -242,8 +243,14 @@ bool TargetBuilder::targetNamedProcesses(const TLPidSet& excluded) {
     if (args_.searchForUnmapped && !searchAllProcessesBut(excluded)) {
         return false;
     }
+    std::vector<std::int32_t> pids;
     for (const auto& [pid, name] : args_.targetPids) {
-        if (auto process = liveTarget(pid, name)) {
+        pids.push_back(pid);
+    }
+    const std::vector<TLOpenedProcess> opened = openProcesses(pids);
+    auto next = opened.begin();
+    for (const auto& [pid, name] : args_.targetPids) {
+        if (auto process = liveTarget(pid, name, *next++)) {
             table_[static_cast<std::uint64_t>(pid)] = std::move(process);
         }
     }
@@ -298,9 +305,13 @@ bool TargetBuilder::searchAllProcessesBut(TLPidSet excluded) {
 }
 
 /// The process of a targeted pid, or its corpse; null when there is none.
-std::shared_ptr<TLProcess> TargetBuilder::liveTarget(std::int32_t pid, const TLTargetName& name) const {
-    std::shared_ptr<TLProcess> process = TLProcess::processWithPid(pid);
+std::shared_ptr<TLProcess> TargetBuilder::liveTarget(std::int32_t pid, const TLTargetName& name,
+                                                     const TLOpenedProcess& opened) const {
+    std::shared_ptr<TLProcess> process = opened.process;
     if (!process) {
+        if (opened.refusal != KERN_SUCCESS) {
+            mach_error("task_read_for_pid", opened.refusal);
+        }
         if (name) {
             std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n",
                          printable(*name).c_str(), long{pid});

@@ -9,9 +9,12 @@ namespace tally {
 
 using namespace platform;
 
-std::shared_ptr<TLProcess> TLProcess::processWithPid(std::int32_t pid) {
+std::shared_ptr<TLProcess> TLProcess::processWithPid(std::int32_t pid, kern_return_t* refusal) {
+    if (refusal != nullptr) {
+        *refusal = KERN_SUCCESS;
+    }
     proc_bsdinfo info;
-    return proc_pidinfo(pid, &info) == sizeof info ? processWithBsdInfo(info) : nullptr;
+    return proc_pidinfo(pid, &info) == sizeof info ? processWithBsdInfo(info, refusal) : nullptr;
 }
 
 std::shared_ptr<TLProcess> TLProcess::processWithBsdInfo(const proc_bsdinfo& info, kern_return_t* refusal) {

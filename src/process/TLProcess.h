@@ -34,8 +34,9 @@ class TLProcess : public virtual MemoryHolder {
     TLProcess(const TLProcess&) = delete;
     TLProcess& operator=(const TLProcess&) = delete;
 
-    /// The process of `pid`; null when it does not exist or cannot be read.
-    static std::shared_ptr<TLProcess> processWithPid(std::int32_t pid);
+    /// The process of `pid`; null when it does not exist or cannot be read. `refusal` as below.
+    static std::shared_ptr<TLProcess> processWithPid(std::int32_t pid,
+                                                     platform::kern_return_t* refusal = nullptr);
     /// The right kind of process for `info`; null when it cannot be read. The kernel's refusal goes to
     /// `refusal` where that is given (KERN_SUCCESS: there was none), else to standard error.
     static std::shared_ptr<TLProcess> processWithBsdInfo(const platform::proc_bsdinfo& info,

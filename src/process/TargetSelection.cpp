@@ -1,7 +1,10 @@
 #include "process/TargetSelection.h"
 
+#include "platform/dispatch.h"
+
 #include <algorithm>
 #include <cstdlib>
+#include <functional>
 #include <unordered_map>
 #include <unordered_set>
 #include <utility>
@@ -11,6 +14,11 @@ namespace tally {
 using namespace platform;
 
 namespace {
+
+/// Calls item(0) to item(count - 1) on all processors.
+void forEachOnAllProcessors(std::size_t count, const std::function<void(std::size_t)>& item) {
+    dispatch_apply(count, {.label = "org.tally.opening"}, item);
+}
 
 std::int32_t pidOf(const proc_bsdinfo& info) { return static_cast<std::int32_t>(info.pbi_pid); }
 
@@ -71,32 +79,47 @@ std::optional<std::vector<proc_bsdinfo>> copyAllBsdInfos() {
         return std::nullopt;
     }
     pids.resize(std::min(pids.size(), static_cast<std::size_t>(listed)));
-    std::vector<proc_bsdinfo> infos;
-    infos.reserve(pids.size());
-    for (const std::int32_t pid : pids) {
+    std::vector<std::optional<proc_bsdinfo>> found(pids.size());
+    forEachOnAllProcessors(pids.size(), [&](std::size_t i) {
         proc_bsdinfo info;
-        if (proc_pidinfo(pid, &info) == sizeof info) {
-            infos.push_back(info);
+        if (proc_pidinfo(pids[i], &info) == sizeof info) {
+            found[i] = info;
+        }
+    });
+    std::vector<proc_bsdinfo> infos;
+    for (const auto& info : found) {
+        if (info) {
+            infos.push_back(*info);
         }
     }
     return infos.empty() ? std::nullopt : std::optional(std::move(infos));
 }
 
+std::vector<TLOpenedProcess> openProcesses(std::span<const std::int32_t> pids) {
+    std::vector<TLOpenedProcess> opened(pids.size());
+    forEachOnAllProcessors(pids.size(), [&](std::size_t i) {
+        opened[i].process = TLProcess::processWithPid(pids[i], &opened[i].refusal);
+    });
+    return opened;
+}
+
 std::optional<TLProcessTable> allProcessesExcludingPids(const TLPidSet& pids,
                                                         TLUnreadableProcesses* unreadable) {
-    const auto infos = copyAllBsdInfos();
+    auto infos = copyAllBsdInfos();
     if (!infos) {
         return std::nullopt;
     }
+    std::erase_if(*infos, [&](const proc_bsdinfo& info) { return pids.contains(pidOf(info)); });
+    std::vector<TLOpenedProcess> opened(infos->size());
+    forEachOnAllProcessors(infos->size(), [&](std::size_t i) {
+        opened[i].process = TLProcess::processWithBsdInfo((*infos)[i], &opened[i].refusal);
+    });
     TLProcessTable table;
-    for (const proc_bsdinfo& info : *infos) {
-        if (pids.contains(pidOf(info))) {
-            continue;
-        }
-        kern_return_t refusal = KERN_SUCCESS;
-        if (auto process = TLProcess::processWithBsdInfo(info, &refusal)) {
-            table[info.pbi_pid] = std::move(process);
-        } else if (refusal == KERN_NO_ACCESS && unreadable != nullptr) {
+    for (std::size_t i = 0; i < opened.size(); ++i) {
+        const proc_bsdinfo& info = (*infos)[i];
+        if (opened[i].process) {
+            table[info.pbi_pid] = std::move(opened[i].process);
+        } else if (opened[i].refusal == KERN_NO_ACCESS && unreadable != nullptr) {
             rusage_info_v5 usage;
             if (proc_pid_rusage(pidOf(info), &usage) == 0) {
                 unreadable->residentAnonymous += usage.ri_resident_anonymous;

@@ -29,6 +29,15 @@ using TLPidSet = std::set<std::int32_t>;
 /// the list cannot be obtained.
 std::optional<std::vector<platform::proc_bsdinfo>> copyAllBsdInfos();
 
+/// A process that was asked for, or why it could not be read.
+struct TLOpenedProcess {
+    std::shared_ptr<TLProcess> process; // null when there is none, or it may not be read
+    platform::kern_return_t refusal = platform::KERN_SUCCESS;
+};
+
+/// The processes of `pids`, opened on all processors. @return one for each, in the order of `pids`.
+std::vector<TLOpenedProcess> openProcesses(std::span<const std::int32_t> pids);
+
 /// What could not be read among the processes of a table.
 struct TLUnreadableProcesses {
     std::size_t count = 0;
