@@ -9,6 +9,7 @@
 #include <array>
 #include <span>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace tally {
@@ -17,8 +18,8 @@ namespace {
 
 struct Column {
     const char* title;
-    int widthFormatted;
-    int widthOtherwise;
+    std::size_t widthFormatted;
+    std::size_t widthOtherwise;
     std::int64_t option; // the option that shows it; 0: always shown
     std::uint64_t (*value)(const TLMemoryTotals& row);
 };
@@ -31,18 +32,29 @@ constexpr std::array<Column, 5> columns = {{
     {"(Wired)", 11, 14, TLTextOptionWired, [](const TLMemoryTotals& row) { return row.wired; }},
 }};
 
+void appendRightAligned(std::string& line, std::string_view text, std::size_t width) {
+    line.append(width - std::min(width, text.size()), ' ');
+    line += text;
+}
+
 /// Prints one line; `cellOf(column)` gives the text of a sized column.
 template <typename CellOf>
-void printLine(std::FILE* output, const ValueFormat& format, CellOf cellOf, const std::string& regions,
-               const std::string& category) {
+void printLine(std::FILE* output, const ValueFormat& format, CellOf cellOf, std::string_view regions,
+               std::string_view category) {
+    const bool isFormatted = format.summaryFormat == TLSummaryFormat::formatted;
+    std::string line;
     for (const Column& column : columns) {
         if (column.option == 0 || format.shows(column.option)) {
-            const bool isFormatted = format.summaryFormat == TLSummaryFormat::formatted;
-            std::fprintf(output, "%*s", isFormatted ? column.widthFormatted : column.widthOtherwise,
-                         std::string(cellOf(column)).c_str());
+            appendRightAligned(line, cellOf(column),
+                               isFormatted ? column.widthFormatted : column.widthOtherwise);
         }
     }
-    std::fprintf(output, " %10s    %s\n", regions.c_str(), category.c_str());
+    line += ' ';
+    appendRightAligned(line, regions, 10);
+    line += "    ";
+    line += category;
+    line += '\n';
+    std::fwrite(line.data(), 1, line.size(), output);
 }
 
 void printDashLine(std::FILE* output, const ValueFormat& format) {
