@@ -4,48 +4,14 @@
   bench.py TALLY PROGRAMS [NAME ...]
 
 TALLY is the tool, PROGRAMS the folder of puppet, latency and stop. NAMEs choose among: population libraries big mappings
-scaling latency stop (all). Commands that are compared run in turn, five times each after one run that does not count;
-figures are medians.
-Everything that is started is ended by pid.
+scaling sparse containers latency stop (all). Commands that are compared run in turn, five times each after one run that does
+not count; figures are medians. Everything that is started is ended by pid.
 """
-import contextlib, json, os, platform, resource, shutil, signal, statistics, subprocess, sys, tempfile, time
+import contextlib, os, platform, resource, shutil, statistics, subprocess, sys, tempfile, time
+
+from measure import Child, medians_of, peak_of
 
 HERE = os.path.dirname(os.path.abspath(__file__))
-RUNS = 5
-
-
-class Child:
-    """A program that says when it is ready; ended when the block is left."""
-
-    def __init__(self, command, ready):
-        self.process = subprocess.Popen(command, stdin=subprocess.PIPE, stdout=subprocess.PIPE, text=True)
-        self.output = ""
-        for line in self.process.stdout:
-            self.output += line
-            if line.rstrip() == ready:
-                return
-        raise SystemExit("did not get ready: %s" % command)
-
-    def __enter__(self):
-        return self
-
-    def __exit__(self, *_):
-        self.process.send_signal(signal.SIGTERM)
-        self.process.stdin.close()
-        self.process.wait()
-
-
-def run(command):
-    """Wall seconds, processor seconds and peak resident MiB of one run, the last not below what this program has."""
-    before = resource.getrusage(resource.RUSAGE_CHILDREN)
-    start = time.monotonic()
-    process = subprocess.Popen(command, shell=isinstance(command, str), stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
-    _, _, usage = os.wait4(process.pid, 0)
-    wall = time.monotonic() - start
-    process.returncode = 0
-    after = resource.getrusage(resource.RUSAGE_CHILDREN)
-    spent = after.ru_utime + after.ru_stime - before.ru_utime - before.ru_stime
-    return wall, spent, usage.ru_maxrss / 1024
 
 
 def run_sampling(command, seconds):
@@ -61,21 +27,15 @@ def run_sampling(command, seconds):
 
 def compare(title, commands):
     """Runs the commands in turn and prints a table; the last one is what the others are measured by."""
-    results = {name: [] for name, _ in commands}
-    for turn in range(RUNS + 1):
-        for name, command in commands:
-            result = run(command)
-            if turn > 0:
-                results[name].append(result)
-    medians = {name: [statistics.median(column) for column in zip(*rows)] for name, rows in results.items()}
+    medians = medians_of(commands)
     base = medians[commands[-1][0]]
     print("\n### %s\n" % title)
     print("| command | wall | of the last | processor time | of the last | peak memory |")
     print("|---|---|---|---|---|---|")
-    for name, _ in commands:
-        wall, spent, peak = medians[name]
-        print("| %s | %.0f ms | %.2f | %.0f ms | %.2f | %.0f MiB |" %
-              (name, wall * 1e3, wall / base[0], spent * 1e3, spent / base[1] if base[1] else 0, peak), flush=True)
+    for name, command in commands:
+        wall, spent = medians[name]
+        print("| %s | %.1f ms | %.2f | %.1f ms | %.2f | %.1f MiB |" %
+              (name, wall * 1e3, wall / base[0], spent * 1e3, spent / base[1] if base[1] else 0, peak_of(command)), flush=True)
     return medians
 
 
@@ -157,6 +117,40 @@ def scaling(tally, programs):
                 sleeper.wait()
 
 
+def sparse(tally, programs):
+    for kids, pages, tebibytes in ((8, 512, 8), (0, 50, 40)):
+        shape = [str(kids), str(pages), "reserve%d" % tebibytes]
+        with Child([programs + "/puppet", "family"] + shape, "ready") as child:
+            lines = [line.split() for line in child.output.splitlines()]
+            pids = [str(child.process.pid)] + [words[2] for words in lines if words[0] == "child"]
+            compare("%d processes that reserve %d TiB, private and shared, and touched %d pages of each" % (len(pids), tebibytes, pages),
+                    [("tally --pid", [tally] + [word for pid in pids for word in ("--pid", pid)]),
+                     ("cat of smaps", ["cat"] + ["/proc/%s/smaps" % pid for pid in pids])])
+
+
+# Programs that wait for their input, or for time to pass.
+SMALL = [["sleep", "600"], ["cat"], ["tail", "-f", "/dev/null"], ["sh", "-c", "read line"], ["sort"], ["tr", "a", "b"],
+         ["wc"], ["sed", "p"], ["grep", "x"], ["awk", "{}"]]
+
+
+def containers(tally, programs):
+    reader, writer = os.pipe()
+    processes = []
+    try:
+        for command in SMALL * 100:
+            processes.append(subprocess.Popen(command, stdin=reader, stdout=subprocess.DEVNULL))
+        pids = [str(process.pid) for process in processes]
+        compare("1000 processes of 10 different small programs",
+                [("tally", [tally] + [word for pid in pids for word in ("--pid", pid)]),
+                 ("cat of smaps", ["cat"] + ["/proc/%s/smaps" % pid for pid in pids])])
+    finally:
+        for process in processes:
+            process.kill()
+            process.wait()
+        os.close(reader)
+        os.close(writer)
+
+
 def latency(tally, programs):
     print("\n### What a process of 2 GiB sees of its own mmap and munmap\n")
     print("| measured by | median | 99th percentile | maximum |\n|---|---|---|---|")
@@ -186,7 +180,8 @@ def stop(tally, programs):
 def main():
     tally, programs = sys.argv[1:3]
     print("Linux %s, %d processors, %s" % (platform.release(), os.cpu_count(), time.strftime("%Y-%m-%d")))
-    measurements = {each.__name__: each for each in (population, libraries, big, mappings, scaling, latency, stop)}
+    measurements = {each.__name__: each for each in
+                    (population, libraries, big, mappings, scaling, sparse, containers, latency, stop)}
     for name in sys.argv[3:] or measurements:
         measurements[name](os.path.abspath(tally), os.path.abspath(programs))
 

@@ -15,9 +15,9 @@
 //                                  huge (huge pages, the first 4 KiB of each written), grow (the parent's
 //                                  and the children's mappings grow apart), leaderless (nothing changes, the
 //                                  children's first threads end), reserveN (mappings of N TiB, private
-//                                  and shared, with 16 pages each, are inherited as well), freed (lazily,
-//                                  before), swapped (nothing changes: it was swapped out before, and shared
-//                                  memory of as many pages with it)
+//                                  and shared, with PAGES pages all over each, are inherited as well), freed
+//                                  (lazily, before), swapped (nothing changes: it was swapped out before, and
+//                                  shared memory of as many pages with it)
 //   puppet memory PAGES            a memfd of PAGES pages, all written, of which only the first are mapped
 //                                  and touched
 //   puppet twins                   a second process in the same address space
@@ -431,13 +431,13 @@ void* sayReady(void* pipe) {
     }
 }
 
-/// Makes a private and a shared mapping of `tebibytes` TiB each, with a page in each of their first 16 GiB.
-void reserve(std::size_t tebibytes) {
+/// Makes a private and a shared mapping of `tebibytes` TiB each, with `pages` pages all over them.
+void reserve(std::size_t tebibytes, std::size_t pages) {
     const std::size_t size = tebibytes << 40;
     for (char* m : {map(size, readWrite, privateAnonymous | MAP_NORESERVE),
                     map(size, readWrite, MAP_SHARED | MAP_NORESERVE, makeMemfd("sparse", size / page))}) {
-        for (std::size_t i = 0; i < 16; ++i) {
-            write(m, i << 18, 1);
+        for (std::size_t i = 0; i < pages; ++i) {
+            write(m, size / page / pages * i, 1);
         }
     }
 }
@@ -450,7 +450,7 @@ void family(std::size_t kids, std::size_t pages, const std::string& how) {
     }
     write(m, 0, pages);
     if (how.starts_with("reserve")) {
-        reserve(std::stoul(how.substr(7)));
+        reserve(std::stoul(how.substr(7)), pages);
     }
     if (how == "freed") {
         madvise(m, pages * page, MADV_FREE);
