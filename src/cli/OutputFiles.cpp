@@ -36,14 +36,12 @@ std::shared_ptr<TLProcess> processThatMaps(const std::string& path,
     if (!file) {
         return nullptr;
     }
-    // Of what is untouched only the path is known.
-    const Name name(file->path);
-    const auto showsFile = [&](const TLMemoryRegion& region) {
-        return region.object_id == file->object || region.detailedName == name;
-    };
+    const auto showsFile = [&](const TLMemoryRegion& region) { return region.object_id == file->object; };
     const auto found = std::ranges::find_if(processes, [&](const std::shared_ptr<TLProcess>& process) {
         const bool isRunning = dynamic_cast<const TLHeapsnapProcess*>(process.get()) == nullptr;
-        return isRunning && std::ranges::any_of(process->memoryRegions(), showsFile);
+        // No object stands behind what is untouched, which only the process itself can tell then.
+        return isRunning && (std::ranges::any_of(process->memoryRegions(), showsFile) ||
+                             platform::mapsFile(process->pid(), *file));
     });
     return found == processes.end() ? nullptr : *found;
 }

@@ -65,10 +65,14 @@ bool isOneFile(const std::string& a, const std::string& b);
 
 /// By what a file is known in the memory of processes.
 struct FileInMemory {
-    std::string path;         // that mappings of it show, unless it was opened by another link
-    std::uint64_t object = 0; // the VM object behind them
+    std::string path; // that mappings of it show, unless it was opened by another link
+    std::uint64_t device = 0;
+    std::uint64_t inode = 0;
+    std::uint64_t object = 0; // the VM object behind them, once they are touched
 };
 /// Absent where `path` leads to no regular file.
 std::optional<FileInMemory> fileInMemory(const std::string& path);
+/// Whether process `pid` maps the file now, touched or not. False where its mappings cannot be read.
+bool mapsFile(std::int32_t pid, const FileInMemory& file);
 
 } // namespace tally::platform

@@ -3,8 +3,10 @@
 #include "linux/Agreement.h"
 #include "linux/Puppet.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
+#include <sys/mman.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -74,6 +76,13 @@ TEST(Documents, GoWhereverAPathLeads) {
     EXPECT_TRUE(json::accept(fifo.output)) << fifo.output;
     EXPECT_EQ(shell("", "-j closed.json >&- 2>&-").status, 0);
     EXPECT_TRUE(json::accept(contentsOf(folder.path() + "/closed.json")));
+
+    const std::string other = folder.path() + "/f2"; // another name of a file that is mapped and untouched
+    std::filesystem::create_hard_link(folder.path() + "/closed.json", other);
+    const auto size = std::filesystem::file_size(other);
+    mmap(nullptr, size, PROT_READ, MAP_SHARED, open(other.c_str(), O_RDONLY), 0);
+    EXPECT_EQ(shell("", "--pid $PPID -j closed.json").status, 1);
+    EXPECT_EQ(std::filesystem::file_size(other), size);
     if (access(TALLY_PROGRAM, W_OK) != 0) {
         GTEST_SKIP() << "this user may not write to the program";
     }

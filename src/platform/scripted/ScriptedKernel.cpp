@@ -57,7 +57,7 @@ constexpr std::array<std::string_view, 35> callsThatCanFail{
     "task_take_notices",
     "vm_deallocate",
 };
-constexpr std::array<std::string_view, 15> callsThatCannot{
+constexpr std::array<std::string_view, 16> callsThatCannot{
     "GatherScope",
     "QRYTagForRegionTypeDescription",
     "clock_uptime_raw_approx_ns",
@@ -66,6 +66,7 @@ constexpr std::array<std::string_view, 15> callsThatCannot{
     "fileInMemory",
     "hasInternalContent",
     "mach_timebase_info",
+    "mapsFile",
     "ownPid",
     "prepareOwnProcess",
     "restoreDefaultInterruptAction",

@@ -53,6 +53,15 @@ class Timer final : public TimerSource {
     ScriptedKernel::State::Timer timer_;
 };
 
+/// The first mapping of `task` that shows the file of `path`; null when there is none.
+const ScriptedMapping* mappingOfFile(const ScriptedTask& task, const std::string& path) {
+    const ScriptedMapping* mapping = task.findMapping(0, 0).mapping;
+    while (mapping != nullptr && mapping->file != path) {
+        mapping = task.findMapping(mapping->end(), 0).mapping;
+    }
+    return mapping;
+}
+
 } // namespace
 
 int mach_get_times(mach_times* times) {
@@ -104,15 +113,17 @@ std::unique_ptr<TimerSource> dispatch_source_timer(SerialQueue& queue,
 std::optional<FileInMemory> fileInMemory(const std::string& path) {
     const Answer answer("fileInMemory", -1, {}, path);
     for (const auto& task : answer.state.tasks) {
-        std::uint64_t address = 0;
-        while (const ScriptedMapping* mapping = task->findMapping(address, 0).mapping) {
-            if (mapping->file == path) {
-                return FileInMemory{.path = path, .object = *mapping->object};
-            }
-            address = mapping->end();
+        if (const ScriptedMapping* mapping = mappingOfFile(*task, path)) {
+            return FileInMemory{.path = path, .object = *mapping->object};
         }
     }
     return std::nullopt;
+}
+
+bool mapsFile(std::int32_t pid, const FileInMemory& file) {
+    const Answer answer("mapsFile", pid, {}, file.path);
+    const ScriptedTask* const task = answer.runningTask(pid);
+    return task != nullptr && mappingOfFile(*task, file.path) != nullptr;
 }
 
 void prepareOwnProcess() { const Answer answer("prepareOwnProcess"); }
