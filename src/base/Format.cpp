@@ -64,11 +64,13 @@ bool isControl(std::string_view sequence) {
     if (sequence.size() == 1) {
         return first < 0x20 || first == 0x7f;
     }
-    if (sequence.size() == 2) {
-        return first == 0xc2 && static_cast<unsigned char>(sequence[1]) <= 0x9f;
+    if (sequence.size() == 2 && first == 0xc2) {
+        return static_cast<unsigned char>(sequence[1]) <= 0x9f;
     }
-    // U+202A to U+202E and U+2066 to U+2069 turn the direction of what follows.
-    return (sequence >= "\xe2\x80\xaa" && sequence <= "\xe2\x80\xae") ||
+    // U+061C, U+200E, U+200F, U+202A to U+202E and U+2066 to U+2069 turn the direction of text, U+2028 and
+    // U+2029 end a line.
+    return sequence == "\xd8\x9c" || (sequence >= "\xe2\x80\x8e" && sequence <= "\xe2\x80\x8f") ||
+           (sequence >= "\xe2\x80\xa8" && sequence <= "\xe2\x80\xae") ||
            (sequence >= "\xe2\x81\xa6" && sequence <= "\xe2\x81\xa9");
 }
 

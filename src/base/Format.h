@@ -19,8 +19,8 @@ std::size_t utf8SequenceLength(std::string_view text);
 bool isUTF8(std::string_view text);
 
 /// `text` with "?" for every control character (U+0000 to U+001F, U+007F to U+009F), every mark that turns
-/// the direction of text and every byte that is not UTF-8. A name comes from another process and must not be
-/// able to drive the terminal that shows it.
+/// the direction of text or ends a line and every byte that is not UTF-8. A name comes from another process
+/// and must not be able to drive the terminal that shows it.
 std::string printable(std::string_view text);
 
 /// Writes `printable(message)` and a newline to standard error.

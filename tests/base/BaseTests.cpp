@@ -25,6 +25,9 @@ TEST(Printable, ReplacesWhatCouldDriveATerminalAndNothingElse) {
         {"\xff\xc3", "??"}, // cut off at the end
         {"\xc3\n", "??"},   // a cut-off letter hides no control
         {"\xe2\x82\x1b", "???"},
+        // marks of direction and line ends, and their neighbours
+        {"\u061c\u200e\u200f\u2028\u202e\u2066\u2069", "???????"},
+        {"\u061b\u200d\u2010\u2027\u202f\u2065\u206a", "\u061b\u200d\u2010\u2027\u202f\u2065\u206a"},
     };
     for (const auto& [text, safe] : cases) {
         EXPECT_EQ(printable(text), safe);
