@@ -71,8 +71,11 @@ class ChargedObjects {
     /// charged for already. @return that much.
     std::uint64_t charge(std::uint64_t object, std::uint64_t offset, std::uint64_t length,
                          std::uint64_t bytes) {
+        if (length > ~offset) { // beyond the last offset that there is: a damaged file, taken at its word
+            return bytes;
+        }
         std::map<std::uint64_t, Extent>& extents = extentsOf_[object];
-        Extent united{.end = offset + std::min(length, ~offset)}; // offsets of devices can be the highest
+        Extent united{.end = offset + length};
         std::uint64_t start = offset;
         auto next = extents.upper_bound(offset);
         if (next != extents.begin() && std::prev(next)->second.end > offset) {

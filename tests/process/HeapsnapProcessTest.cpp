@@ -136,14 +136,15 @@ TEST_F(Heapsnap, AnObjectIsChargedForItsPagesOnce) {
                                     .dirty_size = dirty * page,
                                     .object_id = object});
     };
-    add(8, 3, 2);           // pages 8 to 15
-    add(8, 2, 3);           // the same pages: room for 3
-    add(0, 5, 0);           // below them
-    add(4, 7, 0);           // across both, of which 3 are left
-    add(4, 7, 0, TLNotSet); // of an object that nobody else can have
-    add(1 << 20, 7, 0);     // far away
-    const std::uint64_t dirty[] = {3, 2, 5, 3, 7, 7};
-    const std::uint64_t swapped[] = {2, 1, 0, 0, 0, 0};
+    add(8, 3, 2);                            // pages 8 to 15
+    add(8, 2, 3);                            // the same pages: room for 3
+    add(0, 5, 0);                            // below them
+    add(4, 7, 0);                            // across both, of which 3 are left
+    add(4, 7, 0, TLNotSet);                  // of an object that nobody else can have
+    add(1 << 20, 7, 0);                      // far away
+    add((std::uint64_t{1} << 52) - 4, 7, 0); // to beyond the last offset
+    const std::uint64_t dirty[] = {3, 2, 5, 3, 7, 7, 7};
+    const std::uint64_t swapped[] = {2, 1, 0, 0, 0, 0, 0};
     for (const bool asCharged : {true, false}) {
         snapshot.showsPhysTally = asCharged;
         linesOf(snapshot);
