@@ -1,5 +1,6 @@
 #include "cli/GuardedMain.h"
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
@@ -32,12 +33,23 @@ void explain() {
     std::abort();
 }
 
+/// Whether what stands in buffers could be written, or nobody reads it any more; a message has gone to
+/// standard error otherwise.
+bool finishOutput() {
+    if (std::fflush(stdout) == 0 || errno == EPIPE) {
+        return true;
+    }
+    std::perror("Unable to write to standard output");
+    return false;
+}
+
 } // namespace
 
 int guardedMain(int (*program)(int argc, char** argv), int argc, char** argv) {
     std::set_terminate(endAtOnce);
     try {
-        return program(argc, argv);
+        const int status = program(argc, argv);
+        return finishOutput() ? status : 1;
     } catch (const std::exception&) {
         explain();
         return 1;

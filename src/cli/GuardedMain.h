@@ -5,7 +5,8 @@
 namespace tally {
 
 /// Runs `program`. What it, or a thread of it, throws is a message on standard error and the exit status 1:
-/// lack of memory or of threads, in the first place.
+/// lack of memory or of threads, in the first place. So is what it leaves for standard output and that does
+/// not take.
 /// @return the exit status.
 int guardedMain(int (*program)(int argc, char** argv), int argc, char** argv);
 

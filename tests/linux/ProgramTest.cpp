@@ -115,6 +115,7 @@ TEST(Program, SaysWhatItCouldNotWrite) {
     const std::string text = "Unable to write all of the report to standard output: ";
     const std::pair<std::string, std::string> cases[] = {
         {command + " >/dev/full", text + "No space left on device\n"},
+        {TALLY_PROGRAM " -h >/dev/full", "Unable to write to standard output: No space left on device\n"},
         {"ulimit -f 1; " + command + " >out", text + "File too large\n"},
         {"ulimit -f 1; " + command + " -j x.json >/dev/null",
          "Unable to write all of x.json, which is incomplete: File too large\n"},
