@@ -70,7 +70,8 @@ class Sampler {
     /// Throws std::system_error when the system refuses a thread or a timer.
     Sampler(TLTallyArgs& args, OutputFiles& outputs);
 
-    void run();
+    /// @return false when files are asked for and there is no sample to write to them.
+    bool run();
 
   private:
     void takeSample(std::uint64_t ticks);
@@ -116,7 +117,7 @@ Sampler::Sampler(TLTallyArgs& args, OutputFiles& outputs) : args_(args), outputs
     }
 }
 
-void Sampler::run() {
+bool Sampler::run() {
     for (const auto& formatter : outputs_.formatters()) {
         if (formatter->supportsMultipleOutputs()) {
             formatter->configureForMultipleOutputs();
@@ -139,6 +140,11 @@ void Sampler::run() {
     }
     restoreDefaultInterruptAction();
     analysisQueue_.sync([] {});
+    const bool hasResult = hasReported_ || !hasFiles_;
+    if (!hasResult) {
+        std::fputs("No sample was completed, and no file is written\n", stderr);
+    }
+    return hasResult;
 }
 
 void Sampler::stop() {
@@ -219,8 +225,7 @@ bool runSampling(TLTallyArgs& args, OutputFiles& outputs) {
         printLineToStandardError("Unable to start sampling: " + refusal.code().message());
         return false;
     }
-    sampler->run();
-    return true;
+    return sampler->run();
 }
 
 } // namespace tally
