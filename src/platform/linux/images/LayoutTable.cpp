@@ -3,6 +3,7 @@
 #include "base/Format.h"
 #include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/io/Notes.h"
+#include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/objects/MapFiles.h"
 
 #include <sys/stat.h>
@@ -29,17 +30,18 @@ struct FileVersion {
     bool operator==(const FileVersion&) const = default;
 };
 
-FileVersion versionOf(const Descriptor& file) {
+/// Absent on failure, with errno.
+std::optional<FileVersion> versionOf(const Descriptor& file) {
     struct stat status {};
     if (fstat(file.number(), &status) != 0) {
-        return {};
+        return std::nullopt;
     }
-    return {status.st_size, status.st_mtim.tv_sec, status.st_mtim.tv_nsec};
+    return FileVersion{status.st_size, status.st_mtim.tv_sec, status.st_mtim.tv_nsec};
 }
 
-FileVersion versionOf(const FileAnswer& file) {
-    return {static_cast<std::int64_t>(file.status.stx_size), file.status.stx_mtime.tv_sec,
-            file.status.stx_mtime.tv_nsec};
+std::optional<FileVersion> versionOf(const FileAnswer& file) {
+    return FileVersion{static_cast<std::int64_t>(file.status.stx_size), file.status.stx_mtime.tv_sec,
+                       file.status.stx_mtime.tv_nsec};
 }
 
 /// Reads from the head of a file, which linkers put the headers into.
@@ -53,6 +55,16 @@ FileReader readerOf(const FileAnswer& file) {
     };
 }
 
+/// Reads from the file; `error` gets the errno of a read that fails.
+FileReader readerOf(const Descriptor& file, int& error) {
+    return [&](std::uint64_t offset, std::span<std::byte> part) {
+        errno = 0;
+        const bool isThere = readExactly(file, offset, part);
+        error = isThere ? error : errno; // none where the file is shorter
+        return isThere;
+    };
+}
+
 /// Says why a file was not looked at.
 void noteUnread(const Mapping& mapping, int error) {
     constexpr const char* consequence = "their segments are not told apart";
@@ -60,7 +72,7 @@ void noteUnread(const Mapping& mapping, int error) {
         note(formatted("Files of device %u:%u were not looked at, it does not answer: %s",
                        mapping.deviceMajor, mapping.deviceMinor, consequence));
     } else {
-        noteRefusal("Mapped files could not be opened", error, consequence);
+        noteRefusal("Mapped files could not be read", error, consequence);
     }
 }
 
@@ -113,17 +125,25 @@ std::shared_ptr<const ElfLayout> layoutOfFile(const BackingObject& object, const
     const Descriptor file = openMappedFile(folder, mapping);
     const std::optional<FileAnswer> answer =
         file.isOpen() || errno != EAGAIN ? std::nullopt : inquireMappedFile(folder, mapping);
-    if (!file.isOpen() && !answer) {
+    const bool isFound = answer || file.isOpen();
+    const std::optional<FileVersion> version = !isFound ? std::nullopt
+                                               : answer ? versionOf(*answer)
+                                                        : versionOf(file);
+    if (!version) {
         noteUnread(mapping, errno);
         return nullptr; // another process may show it
     }
-    entry->gather = gather;
-    if (const FileVersion version = answer ? versionOf(*answer) : versionOf(file);
-        version != entry->version) {
-        std::optional<ElfLayout> layout = answer ? readElfLayout(readerOf(*answer)) : readElfLayout(file);
+    if (*version != entry->version) {
+        int error = 0;
+        std::optional<ElfLayout> layout = readElfLayout(answer ? readerOf(*answer) : readerOf(file, error));
+        if (error != 0) {
+            noteUnread(mapping, error);
+            return nullptr;
+        }
         entry->layout = layout ? std::make_shared<const ElfLayout>(*std::move(layout)) : nullptr;
-        entry->version = version;
+        entry->version = *version;
     }
+    entry->gather = gather;
     return entry->layout;
 }
 

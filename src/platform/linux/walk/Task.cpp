@@ -114,20 +114,21 @@ std::vector<std::string> Task::takeNotices() {
 }
 
 const Walk* Task::walk(kern_return_t* status) {
-    *status = KERN_SUCCESS;
     if (corpse_) {
+        *status = KERN_SUCCESS;
         return corpse_->walk();
     }
-    if (!walk_) {
+    if (!walk_ && walkStatus_ == KERN_SUCCESS) {
         if (isSecondTenant() && compareAddressSpaces(owner_.pid, identity_.pid) != 0) {
             owner_ = identity_; // it has loaded another program since
         }
         Walk::Result result =
             Walk::read(identity_, key_, owner_, !accountingSwitchIsOn(), std::exchange(status_, {}));
-        *status = result.status;
+        walkStatus_ = result.status;
         walk_ = std::move(result.walk);
         addNotices(std::move(result.notices));
     }
+    *status = walkStatus_;
     return walk_.get();
 }
 

@@ -40,9 +40,12 @@ class Task {
     const Corpse* corpse() const { return corpse_.get(); }
 
     /// The walk that is under way; starts one when there is none.
-    /// @return null with `*status` when the address space cannot be read.
+    /// @return null with `*status` when the address space cannot be read, until the walk is ended.
     const Walk* walk(kern_return_t* status);
-    void endWalk() { walk_.reset(); }
+    void endWalk() {
+        walk_.reset();
+        walkStatus_ = KERN_SUCCESS;
+    }
     /// Keeps what was just read of the process's status, for the walk that follows.
     void noteStatus(const ProcessStatus& status) { status_ = status; }
     std::vector<std::string> takeNotices();
@@ -56,6 +59,7 @@ class Task {
     std::shared_ptr<Corpse> corpse_;
     std::optional<ProcessStatus> status_;
     std::unique_ptr<const Walk> walk_;
+    kern_return_t walkStatus_ = KERN_SUCCESS;
     std::vector<std::string> notices_;
     std::vector<std::string> given_; // notices that were given once already
 };

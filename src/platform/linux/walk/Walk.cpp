@@ -47,6 +47,10 @@ AddressSpace readAlone(MemberIdentity task) {
     return space;
 }
 
+bool hasNothing(const AddressSpace& space) {
+    return space.status != KERN_SUCCESS && space.states.mappings.empty();
+}
+
 /// Whether the kernel has merged pages of the process with others of the same content.
 bool hasMergedPages(const std::string& folder) {
     const std::string text = readSystemRecord(folder + "/ksm_merging_pages").value_or("");
@@ -73,14 +77,16 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
     Result result;
     const NoteTaker taker(result.notices);
     std::optional<AddressSpace> withRelatives = takeFamilySpace(key, owner);
-    if (withRelatives && withRelatives->status == KERN_FAILURE) {
-        withRelatives.reset();
-        result.notices.emplace_back(unreadRelativesNotice);
-    }
     AddressSpace space = withRelatives ? std::move(*withRelatives) : readAlone(task);
-    if (space.status != KERN_SUCCESS && space.states.mappings.empty()) {
-        result.status = space.status;
-        return result;
+    if (hasNothing(space) || (withRelatives && space.status == KERN_FAILURE)) {
+        space = readAlone(task); // it may have been loading a program
+        if (hasNothing(space)) {
+            result.status = space.status;
+            return result;
+        }
+        if (withRelatives) {
+            result.notices.emplace_back(unreadRelativesNotice);
+        }
     }
     auto walk = std::make_unique<Walk>();
     if (space.status != KERN_SUCCESS) {
