@@ -49,11 +49,12 @@ struct Identification {
     std::uint32_t flags = 0;
 };
 
-Identification identify(std::int32_t pid) {
+/// Absent on failure, with errno.
+std::optional<Identification> identify(std::int32_t pid) {
     Identification identification;
     proc_bsdinfo info;
     if (proc_pidinfo(pid, &info) != sizeof info) {
-        return identification;
+        return std::nullopt;
     }
     identification.flags = (info.pbi_flags & PROC_FLAG_LP64) != 0 ? flag64bit : 0;
     identification.path = executableLink(pid).value_or(
@@ -74,15 +75,16 @@ std::vector<std::byte> crashInformationOf(std::int32_t pid, const Identification
     return writer.finish();
 }
 
-/// Whether another process descends from the same exec. Who will be asked for later is not known yet.
-bool hasLiveRelatives(std::int32_t pid, const FamilyKey& key) {
+/// Whether another process can descend from the same exec. Who will be asked for later is not known yet.
+bool canHaveLiveRelatives(std::int32_t pid, const FamilyKey& key) {
     std::vector<std::int32_t> pids(static_cast<std::size_t>(std::max(proc_listallpids({}), 0)));
-    pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
-    return key.isKnown() && std::ranges::any_of(pids, [&](std::int32_t other) {
-               return other != pid &&
-                      familyKeyOf(other, readSystemRecord(processFolder(other) + "/stat").value_or("")) ==
-                          key;
-           });
+    const int count = proc_listallpids(pids);
+    pids.resize(std::min(pids.size(), static_cast<std::size_t>(std::max(count, 0))));
+    return key.isKnown() && (pids.empty() || std::ranges::any_of(pids, [&](std::int32_t other) {
+                                 const auto stat = readSystemRecord(processFolder(other) + "/stat");
+                                 return other != pid &&
+                                        (stat ? familyKeyOf(other, *stat) == key : isRefusal(errno));
+                             }));
 }
 
 /// Asks of a running process's files what is needed of them, so that none is asked while the process holds
@@ -105,13 +107,19 @@ void nameImages(CorpseSpace& space) {
     space.images = symbolOwnersOf(space.walk->mappings(), space.walk->folder());
 }
 
+/// Why a file of a process's folder cannot be read; errno says it.
+kern_return_t statusOfUnread() { return isRefusal(errno) ? KERN_FAILURE : KERN_TERMINATED; }
+
 /// What is found out while the process holds still.
 struct Capture {
     FilesAhead files;
     bool hasRelatives = false; // by which it is known what else to read
-    Identification identification;
+    std::optional<Identification> identification;
     Charges charges;
 };
+
+constexpr const char* unheldNotice = "What corpses of forked relatives share counts for each of them: its "
+                                     "pages could not be read side by side";
 
 /// Enters of what exec the process is. @return false when it is another process.
 bool identifyProgram(MemberIdentity task, CorpseSpace& space, Capture& capture) {
@@ -141,6 +149,9 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
     }
     space.owner = task;
     capture.identification = identify(task.pid);
+    if (!capture.identification) {
+        return statusOfUnread();
+    }
     Walk::Result result = Walk::read(task, FamilyKey(), task, !accountingSwitchIsOn());
     capture.charges = readCharges(task.pid, false).value_or(Charges());
     const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
@@ -153,7 +164,13 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
     space.walk = std::move(result.walk);
     space.notices = std::move(result.notices);
     if (capture.hasRelatives) {
-        space.held = readHeldPages(task, space.walk->mappings());
+        const kern_return_t held = readHeldPages(task, space.walk->mappings(), &space.held);
+        if (held == KERN_INVALID_ARGUMENT) {
+            return KERN_TERMINATED;
+        }
+        if (held != KERN_SUCCESS) {
+            space.notices.emplace_back(unheldNotice);
+        }
     }
     return KERN_SUCCESS;
 }
@@ -203,9 +220,13 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
     const FamilyKey key =
         familyKeyOf(task.pid, readSystemRecord(processFolder(task.pid) + "/stat").value_or(""));
     if (auto space = corpseSpaceOfTwin(key, task)) {
-        const Charges charges = readCharges(task.pid, true).value_or(Charges());
+        const std::optional<Charges> charges = readCharges(task.pid, true);
+        const std::optional<Identification> identification = charges ? identify(task.pid) : std::nullopt;
+        if (!identification) {
+            return statusOfUnread();
+        }
         *corpse =
-            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, identify(task.pid), charges));
+            std::make_shared<Corpse>(task, space, crashInformationOf(task.pid, *identification, *charges));
         return KERN_SUCCESS;
     }
     const auto space = std::make_shared<CorpseSpace>();
@@ -214,7 +235,7 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
         space->execRandom = readExecRandom(task.pid);
     }
     Capture capture;
-    capture.hasRelatives = hasLiveRelatives(task.pid, key);
+    capture.hasRelatives = canHaveLiveRelatives(task.pid, key);
     capture.files = askAhead(task);
     SeizedThreads seized;
     const kern_return_t status =
@@ -223,7 +244,7 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
         nameImages(*space);
         enterCorpse(space);
         *corpse = std::make_shared<Corpse>(
-            task, space, crashInformationOf(task.pid, capture.identification, capture.charges));
+            task, space, crashInformationOf(task.pid, *capture.identification, capture.charges));
     }
     return status;
 }

@@ -6,6 +6,7 @@
 #include "platform/linux/walk/SmapsOfProcess.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <utility>
 
 namespace tally::platform {
@@ -71,27 +72,31 @@ bool HeldPages::areFramesHidden() const {
     });
 }
 
-HeldPages readHeldPages(MemberIdentity identity, std::span<const Mapping> mappings) {
-    HeldPages held;
+kern_return_t readHeldPages(MemberIdentity identity, std::span<const Mapping> mappings, HeldPages* held) {
     ProcessMemoryFiles files;
     std::vector<Mapping> listed;
-    if (files.open(identity.pid, identity.startTicks, &listed) != KERN_SUCCESS) {
-        return held;
+    kern_return_t status = files.open(identity.pid, identity.startTicks, &listed);
+    if (status != KERN_SUCCESS) {
+        return status;
     }
     SmapsOfProcess smaps(files.folder);
     PageSource source(files, mappings, smaps, PageDetail::positions);
     std::vector<std::uint64_t> entries;
     const PageRunSink sink = [&](const FoundRun& run) {
         if (run.kind != PageKind::object && mappings[run.mapping].isPrivate()) {
-            entries.resize((run.end - run.start) / basePage);
+            const std::size_t wanted = (run.end - run.start) / basePage;
+            entries.resize(wanted);
             entries.resize(readPagemapEntries(files.pagemap, run.start, entries));
-            held.append(run.start, entries);
+            status = entries.size() == wanted ? status : KERN_FAILURE;
+            held->append(run.start, entries);
         }
     };
     std::size_t reached = 0;
-    source.read(0, mappings.size(), {0, ~std::uint64_t{0}}, sink, &reached);
-    held.distrustHugePages();
-    return held;
+    if (const int error = source.read(0, mappings.size(), {0, ~std::uint64_t{0}}, sink, &reached)) {
+        status = error == ESRCH ? KERN_INVALID_ARGUMENT : KERN_FAILURE;
+    }
+    held->distrustHugePages();
+    return status;
 }
 
 } // namespace tally::platform

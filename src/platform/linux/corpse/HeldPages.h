@@ -6,6 +6,7 @@
 
 #pragma once
 
+#include "platform/kern_return.h"
 #include "platform/linux/families/SharedParts.h"
 #include "platform/linux/families/SharingSets.h"
 #include "platform/linux/walk/Mapping.h"
@@ -48,7 +49,8 @@ class HeldPages {
     std::vector<std::uint64_t> entries_;
 };
 
-/// Reads the pages of the private mappings of process `pid`, which holds still.
-HeldPages readHeldPages(MemberIdentity identity, std::span<const Mapping> mappings);
+/// Reads the pages of the private mappings of a process that holds still into `held`. @return
+/// KERN_INVALID_ARGUMENT when it has ended, another error when not all of them could be read.
+kern_return_t readHeldPages(MemberIdentity identity, std::span<const Mapping> mappings, HeldPages* held);
 
 } // namespace tally::platform
