@@ -62,6 +62,7 @@ class TargetBuilder {
     std::shared_ptr<TLProcess> liveTarget(std::int32_t pid, const TLTargetName& name,
                                           const TLOpenedProcess& opened) const;
 
+    bool failWithoutList() { return fail(TLErrorBadPid, "Unable to obtain system process list"); }
     bool fail(int code, std::string message) {
         error_ = TLError{TLTallyErrorDomain, code, std::move(message)};
         return false;
@@ -203,7 +204,7 @@ TLPidSet TargetBuilder::exclusionSet() const {
 bool TargetBuilder::targetEveryProcess(const TLPidSet& excluded) {
     auto processes = allReadableProcesses(excluded);
     if (!processes) {
-        return false;
+        return failWithoutList();
     }
     table_ = *std::move(processes);
     return true;
@@ -279,7 +280,7 @@ bool TargetBuilder::addChildren() {
     }
     const auto family = childPidsForPids(targets);
     if (!family) {
-        return false;
+        return failWithoutList();
     }
     for (const std::int32_t pid : *family) {
         args_.targetPids[pid] = std::nullopt;
@@ -295,7 +296,7 @@ bool TargetBuilder::searchAllProcessesBut(TLPidSet excluded) {
     excluded.insert(0);
     auto processes = allReadableProcesses(excluded);
     if (!processes) {
-        return false;
+        return failWithoutList();
     }
     for (const auto& [pid, process] : *processes) {
         process->setHiddenFromDisplay(true);

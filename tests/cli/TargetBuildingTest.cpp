@@ -119,9 +119,9 @@ TEST_F(TargetBuilding, FailsWithoutTargetsOrAList) {
     const struct {
         std::string words, targets, error;
     } cases[] = {
-        {"-a", "none", ""},
-        {"--unmapped --pid 100", "none", ""},
-        {"-t --pid 100", "none", ""},
+        {"-a", "none", "Unable to obtain system process list"},
+        {"--unmapped --pid 100", "none", "Unable to obtain system process list"},
+        {"-t --pid 100", "none", "Unable to obtain system process list"},
         {"--pid 100 -x worker", "100", ""},
         {"--pid 100 worker", "100", "Unable to obtain system process list"},
     };

@@ -30,6 +30,7 @@ std::optional<std::vector<std::int32_t>> listPids() {
         return std::nullopt;
     }
     std::vector<std::int32_t> pids{kernelPid};
+    errno = 0; // by which a failure differs from the end
     while (const dirent* entry = readdir(folder.get())) {
         const char* name = entry->d_name;
         const char* end = name + std::strlen(name);
@@ -38,6 +39,9 @@ std::optional<std::vector<std::int32_t>> listPids() {
         if (result.ec == std::errc() && result.ptr == end && pid > 0) {
             pids.push_back(pid);
         }
+    }
+    if (errno != 0) {
+        return std::nullopt;
     }
     std::sort(pids.begin(), pids.end());
     return pids;
