@@ -98,7 +98,9 @@ std::uint64_t examineCorpse(const PortRight& task, kern_return_t* status) {
         held += region.dirtySize + region.swappedSize;
     }
     EXPECT_EQ(held, corpse->phys_tally()) << "regions and ledger of one instant";
-    EXPECT_TRUE(corpse->warnings().empty());
+    if (isRoot()) { // others are refused files of a process that ends
+        EXPECT_EQ(corpse->warnings(), std::vector<std::string>());
+    }
     return held;
 }
 
@@ -264,7 +266,7 @@ TEST_F(Corpse, ReportsWhatStillProcessesReport) {
                                                {"family", "2", "2048", "huge"},
                                                {"family", "2", "600", "grow"}};
     for (const std::vector<std::string>& shape : shapes) {
-        if (&shape != shapes && geteuid() != 0) {
+        if (&shape != shapes && !isRoot()) {
             GTEST_SKIP() << "relatives of corpses are told by frame numbers, which are for root";
         }
         const Puppet puppet(shape);
@@ -296,7 +298,7 @@ std::pair<std::uint32_t, std::uint32_t> ownAndShared(const PortRight& corpse, st
 }
 
 TEST_F(Corpse, SharesNothingWithARelativeThatWasForkedLater) {
-    if (geteuid() != 0) {
+    if (!isRoot()) {
         GTEST_SKIP() << "frame numbers are for root";
     }
     constexpr std::size_t size = 64 * 4096;
@@ -369,6 +371,7 @@ TEST_F(Corpse, ThatCannotBeHadIsSaidAndTheRunGoesOn) {
     expectRefused("terminated", {}, 1);
     const pid_t waiting = fork();
     if (waiting == 0) { // in the kernel, for what a child of it does
+        setpgid(0, 0);
         if (vfork() == 0) {
             alarm(60);
             pause();
@@ -378,7 +381,7 @@ TEST_F(Corpse, ThatCannotBeHadIsSaidAndTheRunGoesOn) {
     std::this_thread::sleep_for(100ms);
     mach_port_t corpse = MACH_PORT_NULL;
     EXPECT_EQ(task_generate_corpse(portOf(waiting).name(), &corpse), KERN_OPERATION_TIMED_OUT);
-    kill(waiting, SIGKILL);
+    kill(-waiting, SIGKILL); // the child as well, which has what reads the test's output wait for it
     waitpid(waiting, nullptr, 0);
 }
 

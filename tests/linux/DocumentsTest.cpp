@@ -285,9 +285,10 @@ TEST(Documents, AreCompletedWhenNobodyReadsTheText) {
     const Puppet many({"maps", "3000"}); // more text than a pipe holds
     for (const char* signal : {"INT", "TERM", "HUP"}) {
         run({"/bin/sh", "-c",
-             "rm -f status x.json; { " TALLY_PROGRAM
+             "rm -f status x.json pid; { " TALLY_PROGRAM
              " -v -j x.json --pid $0 & echo $! >pid; wait $!; echo $? >status; } | "
-             "{ read line; kill -$1 $(cat pid); until [ -s status ]; do sleep 0.1; done; }",
+             "{ read line; until [ -s pid ]; do sleep 0.1; done; kill -$1 $(cat pid); until [ -s status ]; "
+             "do sleep 0.1; done; }",
              pidOf(many), signal},
             folder.path());
         EXPECT_EQ(contentsOf(folder.path() + "/status"), "0\n") << signal;

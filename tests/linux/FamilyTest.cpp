@@ -225,7 +225,7 @@ struct PuppetFamily {
 class Family : public testing::Test {
   protected:
     void SetUp() override {
-        if (geteuid() != 0) {
+        if (!test::isRoot()) {
             GTEST_SKIP() << "frame numbers are shown to root only";
         }
     }

@@ -60,7 +60,7 @@ TEST(Program, AProcessIsChargedWhatTheKernelSays) {
 }
 
 TEST(Program, AnotherUsersProcessIsRefusedOneByOne) {
-    if (geteuid() != 0) {
+    if (!isRoot()) {
         GTEST_SKIP() << "only root can become another user";
     }
     const Puppet puppet({"idle"});

@@ -2,9 +2,12 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/capability.h>
 #include <sys/file.h>
 #include <sys/prctl.h>
+#include <sys/stat.h>
 #include <sys/swap.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -202,6 +205,15 @@ TemporaryFolder::TemporaryFolder() {
 TemporaryFolder::~TemporaryFolder() {
     std::error_code ignored;
     std::filesystem::remove_all(path_, ignored);
+}
+
+bool isRoot() {
+    constexpr ino_t firstUserNamespace = 0xEFFFFFFD; // of every kernel
+    struct stat space {};
+    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct rights[_LINUX_CAPABILITY_U32S_3]{};
+    return geteuid() == 0 && stat("/proc/self/ns/user", &space) == 0 && space.st_ino == firstUserNamespace &&
+           syscall(SYS_capget, &header, rights) == 0 && (rights[0].effective & 1U << CAP_SYS_ADMIN) != 0;
 }
 
 int lockOfMachine(const std::string& setting) {

@@ -81,6 +81,9 @@ class TemporaryFolder {
     std::string path_;
 };
 
+/// Whether this is root of the machine: neither of a user namespace only, nor bereft of its rights.
+bool isRoot();
+
 /// Waits until no other test changes this setting of the machine. @return a descriptor; until it is closed no
 /// other can.
 int lockOfMachine(const std::string& setting);

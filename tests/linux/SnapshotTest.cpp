@@ -64,7 +64,7 @@ TEST_F(Snapshot, ReportsWhatTheProcessReports) {
     const Puppet big({"big", "64"});
     const Puppet* const puppets[] = {&zoo, &big};
     for (const std::string view : {"--swapped", "--vmObjectDirty"}) { // the first changes nothing here
-        if (view == "--vmObjectDirty" && geteuid() != 0) {
+        if (view == "--vmObjectDirty" && !isRoot()) {
             GTEST_SKIP() << "the page cache is asked for root only";
         }
         for (const Puppet* puppet : puppets) {

@@ -174,7 +174,7 @@ TEST(Walk, ShowsEveryKindOfMemoryAsSmapsAndTheProcessItselfDo) {
 }
 
 TEST(Walk, TheObjectViewCountsWhatTheObjectHoldsAndTheChargedViewWhatWasTouched) {
-    if (geteuid() != 0) {
+    if (!test::isRoot()) {
         GTEST_SKIP() << "the page cache is asked for root only";
     }
     const test::TemporaryFolder folder;
