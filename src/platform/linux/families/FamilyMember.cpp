@@ -273,7 +273,7 @@ bool FamilyMember::readAtOnce(std::span<const MemberMapping> neighbours, Address
     return framesTold;
 }
 
-bool FamilyMember::readFrames(std::uint64_t start, const MemberStretch& stretch, WindowRow& row) const {
+bool FamilyMember::readFrames(std::uint64_t start, MemberStretch& stretch, WindowRow& row) const {
     const std::uint64_t end = start + windowBytes;
     bool framesTold = true;
     std::array<std::uint64_t, windowPages> entries;
@@ -286,8 +286,13 @@ bool FamilyMember::readFrames(std::uint64_t start, const MemberStretch& stretch,
         }
         const std::uint64_t from = std::max(start, asked[at].start);
         const std::uint64_t to = asked[at].isHuge ? from + basePage : std::min(end, asked[stop - 1].end);
+        errno = 0;
         const std::size_t count =
             readPagemapEntries(files_.pagemap, from, std::span(entries).first((to - from) / basePage));
+        if (count == 0 && errno != 0) {
+            stretch.breakOff(errno, asked[at].mapping);
+            return framesTold;
+        }
         if (count != 0 && asked[at].isHuge) {
             row.keys[0] = keyOf(entries[0], number_, &framesTold);
             row.holds = WindowRow::Holds::hugePage;

@@ -94,7 +94,7 @@ class FamilyMember {
     /// member has of its own there. Windows rise. @return false when frames are hidden.
     bool readWindow(std::uint64_t start, MemberStretch& stretch, WindowRow& row) const;
     /// Reads the frames of what was asked for first, into the same row. @return false when they are hidden.
-    bool readFrames(std::uint64_t start, const MemberStretch& stretch, WindowRow& row) const;
+    bool readFrames(std::uint64_t start, MemberStretch& stretch, WindowRow& row) const;
 
     /// Takes what the last window below `end` held, which a relative has pages in too, as a sign of what
     /// follows; null where none has.

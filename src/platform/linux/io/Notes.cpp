@@ -3,7 +3,6 @@
 #include "base/Format.h"
 
 #include <algorithm>
-#include <cerrno>
 #include <system_error>
 #include <utility>
 
@@ -23,8 +22,6 @@ void note(std::string text) {
         taken->push_back(std::move(text));
     }
 }
-
-bool isRefusal(int error) { return error != 0 && error != ENOENT && error != ESRCH; }
 
 void noteRefusal(const char* what, int error, const char* consequence) {
     if (isRefusal(error)) {

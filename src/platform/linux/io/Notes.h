@@ -4,6 +4,7 @@
 
 #pragma once
 
+#include <cerrno>
 #include <string>
 #include <vector>
 
@@ -26,7 +27,7 @@ void note(std::string text);
 
 /// Whether a call that failed with `error` was refused or broken; else there was nothing to be had, or no
 /// longer.
-bool isRefusal(int error);
+inline bool isRefusal(int error) { return error != 0 && error != ENOENT && error != ESRCH; }
 
 /// Notes "<what> (<the error's text>): <consequence>", if the error is a refusal.
 void noteRefusal(const char* what, int error, const char* consequence);

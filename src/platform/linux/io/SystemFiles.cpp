@@ -1,5 +1,7 @@
 #include "platform/linux/io/SystemFiles.h"
 
+#include "platform/linux/io/Notes.h"
+
 #include <fcntl.h>
 #include <sys/resource.h>
 
@@ -86,7 +88,9 @@ std::optional<std::string> readSystemFile(const std::string& path) {
     return text;
 }
 
-std::optional<std::string> readSystemRecord(const std::string& path) {
+namespace {
+
+std::optional<std::string> readRecordOnce(const std::string& path) {
     const Descriptor file = openForReading(path);
     std::array<char, 16384> buffer;
     ssize_t count = -1;
@@ -102,6 +106,14 @@ std::optional<std::string> readSystemRecord(const std::string& path) {
         text += rest;
     }
     return text;
+}
+
+} // namespace
+
+std::optional<std::string> readSystemRecord(const std::string& path) {
+    std::optional<std::string> text = readRecordOnce(path);
+    // What there is none of stays so; other threads can hold all descriptors, or the memory, for a moment.
+    return text || !isRefusal(errno) ? text : readRecordOnce(path);
 }
 
 void allowDescriptors(std::size_t count) {
