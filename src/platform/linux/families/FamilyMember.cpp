@@ -69,8 +69,10 @@ void MemberStretch::breakOff(int error, std::size_t mapping) {
 }
 
 void WindowRow::writeOut() {
+    // Only frames differ from page to page: where they are hidden, a key tells no more than who has the page.
+    const PageKey step = framesAreTold() && keys[0] != 0 ? 1 : 0;
     for (std::size_t i = 1; i < keys.size(); ++i) {
-        keys[i] = keys[0] + i;
+        keys[i] = keys[0] + i * step;
     }
     holds = Holds::pages;
 }
