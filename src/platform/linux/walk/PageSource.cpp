@@ -80,7 +80,7 @@ std::uint64_t pagesOf(const Mapping& mapping, const SmapsEntry& entry) {
     return (entry.resident + entry.hugetlb + (mapping.shared ? 0 : entry.swapped)) / basePage;
 }
 
-/// Where, from `address` on, `bytes` of the addresses of `mappings` are passed.
+/// Where, from `address` on, `bytes` of the addresses of `mappings` are passed, or their end.
 std::uint64_t endOfStep(std::span<const Mapping> mappings, std::uint64_t address, std::uint64_t bytes) {
     for (const Mapping& mapping : mappings) {
         const std::uint64_t from = std::max(address, mapping.start);
@@ -89,7 +89,7 @@ std::uint64_t endOfStep(std::span<const Mapping> mappings, std::uint64_t address
         }
         bytes -= mapping.end > from ? mapping.end - from : 0;
     }
-    return ~std::uint64_t{0};
+    return mappings.back().end;
 }
 
 } // namespace
