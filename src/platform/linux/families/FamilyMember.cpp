@@ -32,35 +32,6 @@ bool areClose(const AddressRange& lower, const AddressRange& upper) {
     return upper.start - lower.end <= 64 * basePage;
 }
 
-/// Hands runs of pages of one state in one mapping on as a whole.
-class RunJoiner {
-  public:
-    RunJoiner(PageRecorder& recorder, std::size_t firstMapping)
-        : recorder_(recorder), firstMapping_(firstMapping) {}
-    RunJoiner(const RunJoiner&) = delete;
-    RunJoiner& operator=(const RunJoiner&) = delete;
-    ~RunJoiner() { finish(); }
-
-    void add(std::size_t mapping, std::uint64_t address, PageKind kind) {
-        if (run_.mapping != mapping || run_.end != address || run_.kind != kind) {
-            finish();
-            run_ = {mapping, address, address, kind};
-        }
-        run_.end += basePage;
-    }
-
-  private:
-    void finish() {
-        if (run_.end != run_.start) {
-            recorder_.record(run_.mapping - firstMapping_, run_.start, run_.end, run_.kind);
-        }
-    }
-
-    PageRecorder& recorder_;
-    std::size_t firstMapping_;
-    FoundRun run_;
-};
-
 } // namespace
 
 void MemberStretch::breakOff(int error, std::size_t mapping) {
@@ -250,7 +221,10 @@ bool FamilyMember::readAtOnce(std::span<const MemberMapping> neighbours, Address
         return true;
     }
     PageRecorder recorder(std::span(space_.mappings).subspan(stretch.firstMapping), &stretch.states);
-    RunJoiner runs(recorder, stretch.firstMapping);
+    const PageRunSink record = [&](const FoundRun& run) {
+        recorder.record(run.mapping - stretch.firstMapping, run.start, run.end, run.kind);
+    };
+    RunJoiner runs(record);
     const std::uint64_t zero = zeroFrame();
     bool framesTold = true;
     PageKey anyKey = 0;

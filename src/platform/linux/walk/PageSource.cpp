@@ -222,6 +222,9 @@ bool PageSource::readPagemap(std::size_t index, AddressRange window, std::uint64
     const Descriptor object = mapping.isSharedMemory() && mapping.pages() > entries.size()
                                   ? openForReading(mapFilePath(files_.folder, mapping))
                                   : Descriptor();
+    const bool isAnonymous = mapping.isPrivateAnonymous();
+    const std::uint64_t zero = zeroFrame();
+    RunJoiner runs(sink);
     for (std::uint64_t address = std::max(mapping.start, window.start); address < end && expected != 0;) {
         if (object.isOpen()) {
             const std::uint64_t offset = address - mapping.start + mapping.fileOffset;
@@ -237,13 +240,13 @@ bool PageSource::readPagemap(std::size_t index, AddressRange window, std::uint64
         if (count == 0) {
             return false;
         }
-        for (std::size_t i = 0; i < count; ++i, address += basePage) {
-            const std::optional<PageKind> kind =
-                memoryOf(kindOfPagemapEntry(entries[i], mapping.isPrivateAnonymous(), zeroFrame()));
+        for (const std::uint64_t entry : std::span(entries).first(count)) {
+            const std::optional<PageKind> kind = memoryOf(kindOfPagemapEntry(entry, isAnonymous, zero));
             if (kind) {
-                sink({index, address, address + basePage, *kind});
+                runs.add(index, address, *kind);
                 expected -= expected != 0 ? 1 : 0;
             }
+            address += basePage;
         }
     }
     return true;

@@ -34,6 +34,33 @@ struct FoundRun {
 
 using PageRunSink = std::function<void(const FoundRun&)>;
 
+/// Hands neighbouring pages of one state in one mapping on as a whole. `sink` must outlive it.
+class RunJoiner {
+  public:
+    explicit RunJoiner(const PageRunSink& sink) : sink_(sink) {}
+    RunJoiner(const RunJoiner&) = delete;
+    RunJoiner& operator=(const RunJoiner&) = delete;
+    ~RunJoiner() { finish(); }
+
+    void add(std::size_t mapping, std::uint64_t address, PageKind kind) {
+        if (run_.mapping != mapping || run_.end != address || run_.kind != kind) {
+            finish();
+            run_ = {mapping, address, address, kind};
+        }
+        run_.end += basePage;
+    }
+
+  private:
+    void finish() {
+        if (run_.end != run_.start) {
+            sink_(run_);
+        }
+    }
+
+    const PageRunSink& sink_;
+    FoundRun run_;
+};
+
 /// How far mappings were read.
 struct ScanCursor {
     std::uint64_t address = 0;
