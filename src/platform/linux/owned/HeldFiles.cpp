@@ -34,12 +34,14 @@ constexpr const char* descriptorsUnread = "Descriptors could not be looked at";
 constexpr const char* memoryLeftOut = "memory that only they keep is left out";
 
 /// What is known of the file will do: asking a server could take long.
-bool readStatus(const std::string& descriptor, struct statx& status) {
+/// @param link where the descriptor leads, as the kernel shows it.
+bool readStatus(const std::string& descriptor, std::string_view link, struct statx& status) {
     if (statx(AT_FDCWD, descriptor.c_str(), AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &status) == 0) {
         return true;
     }
-    struct stat older {}; // filters that do not know the newer call refuse it
-    if (errno == ENOENT || errno == ESRCH || stat(descriptor.c_str(), &older) != 0) {
+    struct stat older {}; // filters that do not know the newer call refuse it; a memfd has no server
+    if (errno == ENOENT || errno == ESRCH || !link.starts_with("/memfd:") ||
+        stat(descriptor.c_str(), &older) != 0) {
         return false;
     }
     status.stx_mode = static_cast<std::uint16_t>(older.st_mode);
@@ -56,7 +58,7 @@ bool readStatus(const std::string& descriptor, struct statx& status) {
 std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::string& descriptor,
                                       std::string_view link) {
     struct statx status {};
-    if (!readStatus(descriptor, status)) {
+    if (!readStatus(descriptor, link, status)) {
         noteRefusal(descriptorsUnread, errno, memoryLeftOut);
         return std::nullopt;
     }
