@@ -8,6 +8,7 @@
 #include <sys/socket.h>
 #include <sys/statfs.h>
 #include <sys/syscall.h>
+#include <sys/sysmacros.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -31,8 +32,9 @@ void answer(const char* path, FileAnswer& reply) {
     struct statfs system {};
     reply.error = 0;
     reply.headLength = 0;
-    if (statx(AT_FDCWD, path, AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &reply.status) != 0 ||
-        statfs(path, &system) != 0) {
+    const bool isKnown = statx(AT_FDCWD, path, AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &reply.status) == 0 ||
+                         (errno != ENOENT && errno != ESRCH && statusByOlderCall(path, reply.status));
+    if (!isKnown || statfs(path, &system) != 0) {
         reply.error = errno;
         return;
     }
@@ -162,6 +164,21 @@ Askers& askers() {
 }
 
 } // namespace
+
+bool statusByOlderCall(const char* path, struct statx& status) {
+    struct stat older {};
+    if (stat(path, &older) != 0) {
+        return false;
+    }
+    status.stx_mode = static_cast<std::uint16_t>(older.st_mode);
+    status.stx_nlink = static_cast<std::uint32_t>(older.st_nlink);
+    status.stx_dev_major = major(older.st_dev);
+    status.stx_dev_minor = minor(older.st_dev);
+    status.stx_ino = older.st_ino;
+    status.stx_size = static_cast<std::uint64_t>(older.st_size);
+    status.stx_blocks = static_cast<std::uint64_t>(older.st_blocks);
+    return true;
+}
 
 std::optional<FileAnswer> inquire(std::uint64_t device, const std::string& path) {
     Asker* asker = nullptr;

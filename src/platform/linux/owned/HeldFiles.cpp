@@ -1,6 +1,7 @@
 #include "platform/linux/owned/HeldFiles.h"
 
 #include "platform/linux/gather/MachineState.h"
+#include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/objects/Backing.h"
@@ -11,7 +12,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -39,19 +39,19 @@ bool readStatus(const std::string& descriptor, std::string_view link, struct sta
     if (statx(AT_FDCWD, descriptor.c_str(), AT_STATX_DONT_SYNC, STATX_BASIC_STATS, &status) == 0) {
         return true;
     }
-    struct stat older {}; // filters that do not know the newer call refuse it; a memfd has no server
-    if (errno == ENOENT || errno == ESRCH || !link.starts_with("/memfd:") ||
-        stat(descriptor.c_str(), &older) != 0) {
+    if (errno == ENOENT || errno == ESRCH) {
         return false;
     }
-    status.stx_mode = static_cast<std::uint16_t>(older.st_mode);
-    status.stx_nlink = static_cast<std::uint32_t>(older.st_nlink);
-    status.stx_dev_major = major(older.st_dev);
-    status.stx_dev_minor = minor(older.st_dev);
-    status.stx_ino = older.st_ino;
-    status.stx_size = static_cast<std::uint64_t>(older.st_size);
-    status.stx_blocks = static_cast<std::uint64_t>(older.st_blocks);
-    return true;
+    // Filters that do not know the newer call refuse it. Nobody stands behind a memfd; others are asked with
+    // a bound.
+    if (link.starts_with("/memfd:")) {
+        return statusByOlderCall(descriptor.c_str(), status);
+    }
+    const std::optional<FileAnswer> answer = inquire(unknownDevice, descriptor);
+    if (answer) {
+        status = answer->status;
+    }
+    return answer.has_value();
 }
 
 /// A file without a name that only its descriptors, or mappings, keep: absent when it is none in memory.
