@@ -36,12 +36,13 @@ class AllocatorRules {
     AllocatorRules(const std::string& folder, std::span<const Mapping> mappings)
         : mappings_(mappings), memory_(folder) {}
 
-    bool isArena(const Mapping& mapping) {
+    /// @param isPresent whether every page of the mapping is known to be present; so below.
+    bool isArena(const Mapping& mapping, bool isPresent) {
         // Heaps that are used to their end have no inaccessible rest, and the kernel merges neighbours.
         for (std::uint64_t heap = mapping.start; heap % heapSize == 0 && heap < mapping.end;
              heap += heapSize) {
             std::array<std::uint64_t, 4> words{};
-            if (!memory_.read(heap, words)) {
+            if (!memory_.read(heap, words, isPresent)) {
                 return false;
             }
             const HeapHeader header{words[0], words[1], words[2], words[3]};
@@ -56,14 +57,14 @@ class AllocatorRules {
     }
 
     /// Whether mapped chunks cover all of the mapping, or all but a smaller rest of what it merged with.
-    bool isMappedChunks(const Mapping& mapping) {
+    bool isMappedChunks(const Mapping& mapping, bool isPresent) {
         std::uint64_t chunk = mapping.start;
         for (int count = 0; chunk < mapping.end; ++count) {
             if (count == mostChunks) {
                 return true;
             }
             std::array<std::uint64_t, 2> words{};
-            if (!memory_.read(chunk, words) || words[0] != 0) {
+            if (!memory_.read(chunk, words, isPresent) || words[0] != 0) {
                 break;
             }
             const std::uint64_t size = words[1] - chunkIsMapped;
@@ -104,9 +105,10 @@ void tagAllocatorMemory(const std::string& folder, std::span<const Mapping> mapp
         const bool canBeArena = mapping.start % heapSize == 0;
         const bool canBeChunks = mapping.size() >= smallestMappedChunk;
         candidates += canBeArena || canBeChunks ? 1 : 0;
-        if (canBeArena && rules.isArena(mapping)) {
+        const bool isPresent = states.mappings[i].anonymous == mapping.pages();
+        if (canBeArena && rules.isArena(mapping, isPresent)) {
             tags[i] = tags::mallocArena;
-        } else if (canBeChunks && rules.isMappedChunks(mapping)) {
+        } else if (canBeChunks && rules.isMappedChunks(mapping, isPresent)) {
             tags[i] = tags::mallocLarge;
         }
     }

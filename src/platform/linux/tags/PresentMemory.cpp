@@ -31,18 +31,18 @@ bool PresentMemory::open() {
     return memory_.isOpen() && pagemap_.isOpen();
 }
 
-bool PresentMemory::read(std::uint64_t address, std::span<std::uint64_t> words) {
+bool PresentMemory::read(std::uint64_t address, std::span<std::uint64_t> words, bool isPresent) {
     if (!open()) {
         return false;
     }
-    std::uint64_t entry = 0;
+    std::uint64_t entry = pagemapPresent;
     errno = 0;
-    const bool isRead = readExactly(pagemap_, address / basePage * sizeof entry,
-                                    std::as_writable_bytes(std::span(&entry, 1)));
-    if (isRead && (entry & pagemapPresent) == 0) {
+    const bool isKnown = isPresent || readExactly(pagemap_, address / basePage * sizeof entry,
+                                                  std::as_writable_bytes(std::span(&entry, 1)));
+    if (isKnown && (entry & pagemapPresent) == 0) {
         return false;
     }
-    if (isRead && readExactly(memory_, address, std::as_writable_bytes(words))) {
+    if (isKnown && readExactly(memory_, address, std::as_writable_bytes(words))) {
         return true;
     }
     if (errno != EIO) { // so the kernel tells of what was unmapped meanwhile

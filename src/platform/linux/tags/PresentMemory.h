@@ -18,9 +18,10 @@ class PresentMemory {
     /// @param folder the process folder; its files are opened by the first read.
     explicit PresentMemory(const std::string& folder) : folder_(&folder) {}
 
-    /// Reads `words` from `address` on; they lie in one page.
+    /// Reads `words` from `address` on; they lie in one page. @param isPresent whether the page is known to
+    /// be.
     /// @return false when the page is not present or may not be read.
-    bool read(std::uint64_t address, std::span<std::uint64_t> words);
+    bool read(std::uint64_t address, std::span<std::uint64_t> words, bool isPresent);
 
   private:
     bool open();
