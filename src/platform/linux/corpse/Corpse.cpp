@@ -81,9 +81,8 @@ bool canHaveLiveRelatives(std::int32_t pid, const FamilyKey& key) {
     const int count = proc_listallpids(pids);
     pids.resize(std::min(pids.size(), static_cast<std::size_t>(std::max(count, 0))));
     return key.isKnown() && (pids.empty() || std::ranges::any_of(pids, [&](std::int32_t other) {
-                                 const auto stat = readSystemRecord(processFolder(other) + "/stat");
-                                 return other != pid &&
-                                        (stat ? familyKeyOf(other, *stat) == key : isRefusal(errno));
+                                 const auto stat = readProcessStat(other);
+                                 return other != pid && (stat ? familyKeyOf(*stat) == key : isRefusal(errno));
                              }));
 }
 
@@ -123,13 +122,11 @@ constexpr const char* unheldNotice = "What corpses of forked relatives share cou
 
 /// Enters of what exec the process is. @return false when it is another process.
 bool identifyProgram(MemberIdentity task, CorpseSpace& space, Capture& capture) {
-    const std::optional<std::string> text = readSystemRecord(processFolder(task.pid) + "/stat");
-    const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
+    const std::optional<ProcessStat> stat = readProcessStat(task.pid);
     if (!stat || stat->startTicks != task.startTicks) {
         return false;
     }
-    if (const FamilyKey key = familyKeyOf(task.pid, *text);
-        key != space.key) { // it has loaded a program since
+    if (const FamilyKey key = familyKeyOf(*stat); key != space.key) { // it has loaded a program since
         space.key = key;
         space.execRandom = isLayoutFixed(task.pid) ? readExecRandom(task.pid) : decltype(space.execRandom){};
         capture.hasRelatives = true; // for all that is known
@@ -217,8 +214,8 @@ std::vector<std::string> Corpse::takeNotices() { return takeCorpseNotices(*space
 bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpses(space_->key) > 1; }
 
 kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
-    const FamilyKey key =
-        familyKeyOf(task.pid, readSystemRecord(processFolder(task.pid) + "/stat").value_or(""));
+    const std::optional<ProcessStat> stat = readProcessStat(task.pid);
+    const FamilyKey key = stat ? familyKeyOf(*stat) : FamilyKey();
     if (auto space = corpseSpaceOfTwin(key, task)) {
         const std::optional<Charges> charges = readCharges(task.pid, true);
         const std::optional<Identification> identification = charges ? identify(task.pid) : std::nullopt;

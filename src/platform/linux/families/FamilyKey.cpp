@@ -2,7 +2,6 @@
 
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
-#include "platform/linux/processes/ProcessStat.h"
 
 #include <elf.h>
 #include <linux/kcmp.h>
@@ -16,33 +15,12 @@
 
 namespace tally::platform {
 
-FamilyKey decodeFamilyKey(std::string_view stat) {
-    constexpr std::array<int, 6> fields{26, 27, 28, 45, 46, 47};
-    FamilyKey key;
-    const std::size_t close = stat.rfind(')');
-    if (close == std::string_view::npos) {
-        return key;
-    }
-    stat.remove_prefix(close + 1);
-    std::size_t next = 0;
-    for (int field = 3; next < fields.size(); ++field) {
-        std::string_view word = takeWord(stat);
-        if (word.empty()) {
-            return FamilyKey();
-        }
-        if (field == fields[next]) {
-            takeNumber(word, &key.layout[next++]);
-        }
-    }
-    return key;
-}
-
-FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat) {
-    FamilyKey key = decodeFamilyKey(stat);
-    const std::optional<ProcessStat> decoded = decodeStat(stat);
-    if (!key.isKnown() && decoded && decoded->threads > 1) {
-        for (const std::string& thread : threadFolders(pid)) {
-            key = decodeFamilyKey(readSystemRecord(thread + "/stat").value_or(""));
+FamilyKey familyKeyOf(const ProcessStat& stat) {
+    FamilyKey key{stat.layout};
+    if (!key.isKnown() && stat.threads > 1) {
+        for (const std::string& thread : threadFolders(stat.pid)) {
+            const auto other = decodeStat(readSystemRecord(thread + "/stat").value_or(""));
+            key = other ? FamilyKey{other->layout} : FamilyKey();
             if (key.isKnown()) {
                 break;
             }

@@ -6,28 +6,24 @@
 
 #pragma once
 
+#include "platform/linux/processes/ProcessStat.h"
+
 #include <array>
 #include <compare>
 #include <cstdint>
-#include <string>
-#include <string_view>
 
 namespace tally::platform {
 
 struct FamilyKey {
-    // Start and end of code, stack, start and end of data, break: addresses.
-    std::array<std::uint64_t, 6> layout{};
+    std::array<std::uint64_t, 6> layout{}; // as in ProcessStat
 
     /// Whether the kernel told the addresses at all: it does not where tracing is not permitted.
     bool isKnown() const { return layout[0] > 1; }
     friend auto operator<=>(const FamilyKey&, const FamilyKey&) = default;
 };
 
-/// Takes the key from the text of /proc/PID/stat; unknown when it holds none.
-FamilyKey decodeFamilyKey(std::string_view stat);
-
-/// The key of process `pid`, whose stat file holds `stat`: of another thread where the first has ended.
-FamilyKey familyKeyOf(std::int32_t pid, const std::string& stat);
+/// The key of the process that `stat` is of: of another thread where the first has ended.
+FamilyKey familyKeyOf(const ProcessStat& stat);
 
 /// The random bytes that process `pid` got at its exec; zeros when they cannot be read.
 std::array<std::uint64_t, 2> readExecRandom(std::int32_t pid);

@@ -58,8 +58,8 @@ void prepare(Search& search) {
         if (!pids.insert(task->pid()).second) {
             continue;
         }
-        const std::optional<ProcessStatus> status = readProcessStatus(task->pid());
-        search.candidates.push_back({task->pid(), status ? status->residentAnonymous : 0, task->familyKey()});
+        search.candidates.push_back(
+            {task->pid(), readResidentAnonymous(task->pid()).value_or(0), task->familyKey()});
     }
     std::sort(search.candidates.begin(), search.candidates.end(),
               [](const auto& a, const auto& b) { return a.residentAnonymous < b.residentAnonymous; });

@@ -6,6 +6,7 @@
 #include <elf.h>
 
 #include <cstring>
+#include <limits>
 #include <string_view>
 
 namespace tally::platform {
@@ -39,9 +40,10 @@ std::string executablePath(std::int32_t pid, std::string link) {
     if (!link.ends_with(deleted)) {
         return link;
     }
-    const auto running = inquire(executables, processFolder(pid) + "/exe");
-    const auto named = running ? inquire(executables, processFolder(pid) + "/root" + link) : std::nullopt;
-    const bool isOne = named && named->status.stx_ino == running->status.stx_ino &&
+    const bool hasName = !link.starts_with("/memfd:"); // which never have one
+    const auto named = hasName ? inquire(executables, processFolder(pid) + "/root" + link) : std::nullopt;
+    const auto running = named ? inquire(executables, processFolder(pid) + "/exe") : std::nullopt;
+    const bool isOne = running && named->status.stx_ino == running->status.stx_ino &&
                        named->status.stx_dev_major == running->status.stx_dev_major &&
                        named->status.stx_dev_minor == running->status.stx_dev_minor;
     if (!isOne) {
@@ -60,9 +62,13 @@ std::optional<bool> decodeIs64bit(const std::string& auxiliary) {
     return std::nullopt;
 }
 
-bool is64bitProgram(std::int32_t pid) {
+bool is64bitProgram(const ProcessStat& process) {
+    const std::uint64_t stack = process.layout[2];
+    if (stack > std::numeric_limits<std::uint32_t>::max()) {
+        return true;
+    }
     // Not the file: it could be on a file system that does not answer.
-    const auto auxiliary = readSystemRecord(processFolder(pid) + "/auxv");
+    const auto auxiliary = readSystemRecord(processFolder(process.pid) + "/auxv");
     return decodeIs64bit(auxiliary.value_or("")).value_or(sizeof(void*) == 8);
 }
 

@@ -2,6 +2,8 @@
 
 #pragma once
 
+#include "platform/linux/processes/ProcessStat.h"
+
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -16,8 +18,8 @@ std::optional<std::string> executableLink(std::int32_t pid);
 /// called so.
 std::string executablePath(std::int32_t pid, std::string link);
 
-/// Whether `pid` runs a 64-bit program; one that cannot be looked at is taken to be like the tool.
-bool is64bitProgram(std::int32_t pid);
+/// Whether the process runs a 64-bit program; one that cannot be looked at is taken to be like the tool.
+bool is64bitProgram(const ProcessStat& process);
 
 /// Whether the program of an auxiliary vector is a 64-bit one; absent where it does not say.
 std::optional<bool> decodeIs64bit(const std::string& auxiliary);

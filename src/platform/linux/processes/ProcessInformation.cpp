@@ -100,12 +100,13 @@ int proc_pidinfo(std::int32_t pid, proc_bsdinfo* info) {
         return 0;
     }
     *info = proc_bsdinfo();
-    info->pbi_flags = is64bitProgram(pid) ? PROC_FLAG_LP64 : 0;
+    info->pbi_flags = is64bitProgram(*stat) ? PROC_FLAG_LP64 : 0;
     info->pbi_status = stat->isZombie() ? SZOMB : SRUN;
     info->pbi_pid = static_cast<std::uint32_t>(pid);
     info->pbi_ppid = static_cast<std::uint32_t>(stat->parent);
     copyName(info->pbi_comm, stat->comm);
-    copyName(info->pbi_name, nameFromArguments(pid, stat->comm));
+    // Readers ask for the argument area first: only where that is refused is the name needed.
+    copyName(info->pbi_name, stat->showsMemory() ? stat->comm : nameFromArguments(pid, stat->comm));
     return sizeof(proc_bsdinfo);
 }
 

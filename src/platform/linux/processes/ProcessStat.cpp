@@ -2,7 +2,9 @@
 
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
+#include "platform/linux/walk/Mapping.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <filesystem>
@@ -32,7 +34,9 @@ std::optional<ProcessStat> decodeStat(std::string_view text) {
     }
     stat.state = state[0];
     constexpr int lastNeeded = 22;
-    for (int field = 5; field <= 38; ++field) {
+    constexpr std::array<int, 6> addresses{26, 27, 28, 45, 46, 47};
+    std::size_t known = 0;
+    for (int field = 5; field <= addresses.back(); ++field) {
         bool valid = true;
         if (field == 9) {
             valid = takeNumber(rest, &stat.flags);
@@ -42,6 +46,8 @@ std::optional<ProcessStat> decodeStat(std::string_view text) {
             valid = takeNumber(rest, &stat.startTicks);
         } else if (field == 38) {
             valid = takeNumber(rest, &stat.exitSignal);
+        } else if (field == addresses[known]) {
+            valid = takeNumber(rest, &stat.layout[known++]);
         } else {
             valid = !takeWord(rest).empty();
         }
@@ -116,6 +122,18 @@ std::optional<ProcessStatus> readProcessStatus(std::int32_t pid) {
         }
     }
     return status;
+}
+
+std::optional<std::uint64_t> readResidentAnonymous(std::int32_t pid) {
+    const std::optional<std::string> text = readProcessFile(pid, "/statm");
+    std::string_view rest = text ? std::string_view(*text) : std::string_view();
+    std::array<std::uint64_t, 3> pages{}; // the address space, resident, and files and shared memory of these
+    for (std::uint64_t& count : pages) {
+        if (!takeNumber(rest, &count)) {
+            return std::nullopt;
+        }
+    }
+    return (pages[1] - std::min(pages[1], pages[2])) * basePage;
 }
 
 std::vector<std::string> threadFolders(std::int32_t pid) {

@@ -2,6 +2,7 @@
 
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -19,11 +20,16 @@ struct ProcessStat {
     std::int64_t threads = 0;
     std::uint64_t startTicks = 0; // clock ticks since boot
     std::int32_t exitSignal = 0;  // that its parent gets
+    // Addresses: start and end of code, stack, start and end of data, break. 0 without an address space, and
+    // 1 for the first where tracing is not permitted.
+    std::array<std::uint64_t, 6> layout{};
 
     static constexpr std::uint32_t KernelThread = 0x00200000;
     bool isKernelThread() const { return (flags & KernelThread) != 0; }
     /// No process of its own: the id of a thread opens a folder too, and only a process signals its end.
     bool isThread() const { return exitSignal < 0; }
+    /// Whether the kernel shows who asks what is in the process's memory.
+    bool showsMemory() const { return layout[0] != 1; }
     /// Ended, with no thread left that lives on without its leader.
     bool isZombie() const { return (state == 'Z' || state == 'X') && threads <= 1; }
 };
@@ -50,6 +56,10 @@ ProcessStatus decodeStatus(std::string_view text);
 
 /// Reads /proc/PID/status, of another thread where the first has ended; absent when that fails, with errno.
 std::optional<ProcessStatus> readProcessStatus(std::int32_t pid);
+
+/// Bytes of anonymous memory that process `pid` has in memory, by the counters that smaller files tell too;
+/// absent with errno.
+std::optional<std::uint64_t> readResidentAnonymous(std::int32_t pid);
 
 /// The folders of the threads of process `pid` but the first: a leader that ended before its threads shows no
 /// memory and no addresses, while they do.

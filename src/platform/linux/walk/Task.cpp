@@ -4,10 +4,8 @@
 #include "platform/gather.h"
 #include "platform/linux/corpse/Corpse.h"
 #include "platform/linux/families/Families.h"
-#include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/AccountingSwitch.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
 #include "platform/mach_task.h"
 
 #include <algorithm>
@@ -151,18 +149,14 @@ std::shared_ptr<Task> taskOfProcess(std::int32_t pid) { return portTable().findP
 
 kern_return_t task_read_for_pid(std::int32_t pid, mach_port_t* task) {
     *task = MACH_PORT_NULL;
-    const std::optional<std::string> text = readSystemRecord(processFolder(pid) + "/stat");
-    const std::optional<ProcessStat> stat = text ? decodeStat(*text) : std::nullopt;
+    const std::optional<ProcessStat> stat = readProcessStat(pid);
     if (!stat || stat->isKernelThread()) {
         return KERN_FAILURE;
     }
-    // The right to read the mappings is what opening them tells. One that has ended has none to show: its
-    // walk says so.
-    const Descriptor maps = openForReading(processFolder(pid) + "/maps");
-    if (!maps.isOpen() && statusForErrno(errno) == KERN_NO_ACCESS) {
+    if (!stat->showsMemory()) {
         return KERN_NO_ACCESS;
     }
-    *task = makePort(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks}, familyKeyOf(pid, *text)));
+    *task = makePort(std::make_shared<Task>(MemberIdentity{pid, stat->startTicks}, familyKeyOf(*stat)));
     return KERN_SUCCESS;
 }
 
