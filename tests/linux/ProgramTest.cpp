@@ -153,6 +153,10 @@ TEST(Program, OnlyTheMarkOfADeletedExecutableIsTakenOffItsName) {
             const Outcome outcome = run({TALLY_PROGRAM, way, "-p", name});
             EXPECT_TRUE(holds(outcome.output, "\n" + name + " [" + pidOf(puppet) + "]")) << outcome.errors;
         }
+        // The process that asks files is a descendant of the tool, and no target.
+        const std::string own =
+            run({TALLY_PROGRAM, "-t", "-p", name, "--pid", std::to_string(getpid())}).output;
+        EXPECT_EQ(own.find("\ntally ["), own.rfind("\ntally [")) << own;
     }
 }
 

@@ -17,6 +17,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
 
 namespace tally::platform {
 
@@ -76,6 +77,17 @@ void answer(const char* path, FileAnswer& reply) {
 
 // --- the tool's side of it
 
+/// The processes that ask and that were not seen to end: one that is late may never end.
+struct Children {
+    std::mutex mutex;
+    std::set<pid_t> pids;
+};
+
+Children& children() {
+    static Children all;
+    return all;
+}
+
 class Asker {
   public:
     Asker() = default;
@@ -105,7 +117,10 @@ class Asker {
     void end() {
         socket_ = Descriptor(); // which ends it
         if (child_ > 0) {
-            waitpid(child_, nullptr, isLate_ ? WNOHANG : 0);
+            if (waitpid(child_, nullptr, isLate_ ? WNOHANG : 0) == child_) {
+                const std::scoped_lock lock(children().mutex);
+                children().pids.erase(child_);
+            }
             child_ = 0;
         }
     }
@@ -123,9 +138,13 @@ class Asker {
         }
         socket_ = Descriptor(ends[0]);
         const Descriptor other(ends[1]);
+        const std::scoped_lock lock(children().mutex);
         child_ = fork();
         if (child_ == 0) {
             serve(other.number());
+        }
+        if (child_ > 0) {
+            children().pids.insert(child_);
         }
         return child_ > 0;
     }
@@ -159,6 +178,7 @@ struct Askers {
 };
 
 Askers& askers() {
+    children(); // which must outlive them
     static Askers all;
     return all;
 }
@@ -191,6 +211,11 @@ std::optional<FileAnswer> inquire(std::uint64_t device, const std::string& path)
         asker = entry.get();
     }
     return asker->ask(path);
+}
+
+bool isInquirer(std::int32_t pid) {
+    const std::scoped_lock lock(children().mutex);
+    return children().pids.contains(pid);
 }
 
 void endInquiries() {

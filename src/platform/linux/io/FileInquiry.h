@@ -38,6 +38,9 @@ bool statusByOlderCall(const char* path, struct statx& status);
 /// system says.
 std::optional<FileAnswer> inquire(std::uint64_t device, const std::string& path);
 
+/// Whether `pid` is one of the processes that ask, which are no targets.
+bool isInquirer(std::int32_t pid);
+
 /// Ends the processes that ask; the next question begins new ones.
 void endInquiries();
 

@@ -3,6 +3,7 @@
 // The kernel is process 0. Its threads are left out everywhere: their memory is the kernel's.
 
 #include "platform/bsd_process.h"
+#include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/processes/Executable.h"
 #include "platform/linux/processes/ProcessStat.h"
@@ -36,7 +37,7 @@ std::optional<std::vector<std::int32_t>> listPids() {
         const char* end = name + std::strlen(name);
         std::int32_t pid = 0;
         const auto result = std::from_chars(name, end, pid);
-        if (result.ec == std::errc() && result.ptr == end && pid > 0) {
+        if (result.ec == std::errc() && result.ptr == end && pid > 0 && !isInquirer(pid)) {
             pids.push_back(pid);
         }
     }
