@@ -83,8 +83,7 @@ bool TargetBuilder::build() {
         !args_.targetAll) {
         return fail(TLErrorNoTargets, "Must specify at least one process or heapsnap");
     }
-    if (!canMeasure()) {
-        table_.clear();
+    if (!canMeasure()) { // snapshots are reported all the same
         return true;
     }
     const TLPidSet excluded = exclusionSet();
