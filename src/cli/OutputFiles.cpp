@@ -128,6 +128,12 @@ bool OutputFiles::close() const {
     return isComplete;
 }
 
+void OutputFiles::spareEarlier() const {
+    for (const auto& formatter : formatters_) {
+        formatter->spareEarlier();
+    }
+}
+
 void OutputFiles::discard() const {
     for (const auto& formatter : formatters_) {
         formatter->discard();

@@ -47,6 +47,8 @@ class OutputFiles {
     /// Tells every formatter that no report follows. @return whether all they were told, and all of the text,
     /// is where it belongs; a message per output has gone to standard error otherwise.
     bool close() const;
+    /// Leaves files alone that held something before and were not written to yet.
+    void spareEarlier() const;
     /// Deletes the files that this run has made.
     void discard() const;
 

@@ -71,7 +71,7 @@ class Sampler {
     Sampler(TLTallyArgs& args, OutputFiles& outputs);
 
     /// @return false when files are asked for and there is no sample to write to them.
-    bool run();
+    void run();
 
   private:
     void takeSample(std::uint64_t ticks);
@@ -117,7 +117,7 @@ Sampler::Sampler(TLTallyArgs& args, OutputFiles& outputs) : args_(args), outputs
     }
 }
 
-bool Sampler::run() {
+void Sampler::run() {
     for (const auto& formatter : outputs_.formatters()) {
         if (formatter->supportsMultipleOutputs()) {
             formatter->configureForMultipleOutputs();
@@ -140,11 +140,10 @@ bool Sampler::run() {
     }
     restoreDefaultInterruptAction();
     analysisQueue_.sync([] {});
-    const bool hasResult = hasReported_ || !hasFiles_;
-    if (!hasResult) {
-        std::fputs("No sample was completed, and no file is written\n", stderr);
+    if (!hasReported_ && hasFiles_) {
+        std::fputs("No sample was completed: files that held something stay as they are\n", stderr);
+        outputs_.spareEarlier();
     }
-    return hasResult;
 }
 
 void Sampler::stop() {
@@ -225,7 +224,8 @@ bool runSampling(TLTallyArgs& args, OutputFiles& outputs) {
         printLineToStandardError("Unable to start sampling: " + refusal.code().message());
         return false;
     }
-    return sampler->run();
+    sampler->run();
+    return true;
 }
 
 } // namespace tally

@@ -12,8 +12,8 @@ namespace tally {
 
 /// Measures every `args.sampleInterval` seconds into `outputs`, and returns after an interrupt, once
 /// everything gathered before it is reported. Each building of targets changes `args`.
-/// @return false, with a message, when the system refuses what sampling needs, or when files are asked for
-/// and no sample was completed to be written to them.
+/// Without a sample that was completed, files that held something before stay as they are, with a message.
+/// @return false, with a message, when the system refuses what sampling needs.
 bool runSampling(TLTallyArgs& args, OutputFiles& outputs);
 
 } // namespace tally

@@ -45,6 +45,7 @@ class TLOutputFormatterBenchlog final : public TLOutputFormatter {
     void startAtTime(const std::optional<TLTime>& time) override { startTime_ = time; }
     bool supportsMultipleOutputs() const override { return true; }
     int close() override { return platform::blwriter_close(std::move(writer_)); }
+    void spareEarlier() override { platform::blwriter_spare_earlier(*writer_); }
     void discard() override { platform::blwriter_discard(std::move(writer_)); }
 
   private:

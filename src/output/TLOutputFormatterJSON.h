@@ -46,6 +46,7 @@ class TLOutputFormatterJSON final : public TLOutputFormatter {
     bool supportsMultipleOutputs() const override { return true; }
     void configureForMultipleOutputs() override;
     int close() override;
+    void spareEarlier() override { file_->spareEarlier(); }
     void discard() override { file_->discard(); }
     bool supportsRegionlistLikeOutput() const override { return true; }
     void printRegionlistLikeOutputForProcess(const TLProcess& process,

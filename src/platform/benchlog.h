@@ -52,6 +52,8 @@ void blwriter_record_tag(BenchlogWriter& writer, BenchlogTag tag);
 
 /// Finishes the file. @return 0, or the errno of the first lines that could not be written.
 int blwriter_close(BenchlogHandle writer);
+/// Leaves an earlier file alone, as OutputFile::spareEarlier does.
+void blwriter_spare_earlier(BenchlogWriter& writer);
 /// Gives the file up, as OutputFile::discard does.
 void blwriter_discard(BenchlogHandle writer);
 

@@ -29,6 +29,9 @@ class OutputFile {
     virtual void write(std::string_view bytes) = 0;
     /// Ends the document; nothing may follow. @return 0, or the errno of the first bytes that were lost.
     virtual int close() = 0;
+    /// From now on, a document that open() has found and that was not emptied yet stays as it is: what is
+    /// written instead is dropped.
+    virtual void spareEarlier() {}
     /// Gives the document up: deletes the file, if open() made it and it still stands in its place.
     virtual void discard() = 0;
 };

@@ -84,7 +84,7 @@ class ThreadSampling : public testing::Test {
                        script();
                        kernel.interrupt();
                    });
-                   EXPECT_EQ(runSampling(args, outputs), !recorder->samples.empty() || !outputs.hasFiles());
+                   EXPECT_TRUE(runSampling(args, outputs));
                    director.join();
                })
             .second;
@@ -285,7 +285,7 @@ TEST_F(ThreadSampling, EndsOnTerminationToo) {
     expectSamples({{7}});
     recorder->samples.clear();
     outputs.add(recorder, "a file");
-    EXPECT_TRUE(holds(sampleWhile([] {}), "No sample was completed")); // before the first tick
+    EXPECT_TRUE(holds(sampleWhile([] {}), "No sample was completed: files")); // before the first tick
     expectSamples({});
 }
 

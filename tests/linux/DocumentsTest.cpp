@@ -209,6 +209,7 @@ void interruptRuns(int runs) {
     std::uniform_real_distribution<double> part(0, 1);
     std::vector<std::string> valid;
     std::map<std::string, int> endings;
+    std::string earlier = contentsOf(folder.path() + "/x.json");
     for (int i = 0; i < runs; ++i) {
         const bool isSampled = i % 2 == 0;
         const int signal = i % 3 == 0 ? SIGTERM : SIGINT;
@@ -223,13 +224,16 @@ void interruptRuns(int runs) {
         const bool hasListened = holds(errors, isSampled ? "Sampling at" : "Exiting early");
         ++endings[std::string(isSampled ? "sampling " : "once ") + (hasListened ? "heard " : "") +
                   std::to_string(status)];
-        if (status == 0) {
+        const std::string document = contentsOf(folder.path() + "/x.json");
+        if (status == 0 && holds(errors, "No sample was completed")) {
+            EXPECT_EQ(document, earlier);
+        } else if (status == 0) {
             expectAgreementIn(folder.path());
             valid.push_back(folder.path() + "/" + std::to_string(i) + ".json");
-            std::filesystem::rename(folder.path() + "/x.json", valid.back());
-        } else if (hasListened) {
-            EXPECT_TRUE(isSampled && holds(errors, "No sample was completed")) << errors;
+            std::filesystem::copy(folder.path() + "/x.json", valid.back());
+            earlier = document;
         } else {
+            EXPECT_FALSE(hasListened) << errors;
             EXPECT_EQ(status, 128 + signal) << errors;
         }
     }

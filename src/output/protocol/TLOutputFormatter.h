@@ -68,6 +68,8 @@ class TLOutputFormatter {
     virtual void configureForMultipleOutputs() {}
     /// No report follows: finishes the output. @return 0, or the errno for which something is missing in it.
     virtual int close() { return 0; }
+    /// There is no report: an earlier output that this formatter would replace by an empty one is left alone.
+    virtual void spareEarlier() {}
     /// The run has failed before its first report: removes an output that this formatter created.
     virtual void discard() {}
     virtual bool supportsRegionlistLikeOutput() const { return false; }

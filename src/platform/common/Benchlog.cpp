@@ -196,6 +196,8 @@ int blwriter_close(BenchlogHandle writer) {
     return writer->file->close();
 }
 
+void blwriter_spare_earlier(BenchlogWriter& writer) { writer.file->spareEarlier(); }
+
 void blwriter_discard(BenchlogHandle writer) { writer->file->discard(); }
 
 } // namespace tally::platform

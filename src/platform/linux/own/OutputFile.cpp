@@ -68,6 +68,9 @@ class NamedFile final : public DescriptorFile {
     }
 
     void write(std::string_view bytes) override {
+        if (isSpared_) {
+            return;
+        }
         if (!std::exchange(isEmptied_, true) && S_ISREG(status_.st_mode) &&
             ftruncate(descriptor_.number(), 0) != 0) {
             error_ = errno;
@@ -81,6 +84,10 @@ class NamedFile final : public DescriptorFile {
         return error_ != 0 ? error_ : failed;
     }
 
+    void spareEarlier() override {
+        isSpared_ = madeAt_.empty() && !isEmptied_ && S_ISREG(status_.st_mode) && status_.st_size != 0;
+    }
+
     void discard() override {
         struct stat found {};
         if (!madeAt_.empty() && lstat(madeAt_.c_str(), &found) == 0 && isSameFile(status_, found)) {
@@ -92,6 +99,7 @@ class NamedFile final : public DescriptorFile {
     std::string madeAt_;
     struct stat status_ {};
     bool isEmptied_ = false;
+    bool isSpared_ = false;
 };
 
 /// Keeps the document in a file without a name until the standard output is complete.
