@@ -27,9 +27,6 @@ bool TLUserProcess::initWithBsdInfo(const proc_bsdinfo& info) {
         setSharedCache(TLSharedCache::sharedCacheForTask(task()));
     }
     _gatherPhysTally();
-    if (breakDownPhysTally() && _isAlive()) {
-        gatherPageTableSize();
-    }
     _gatherIdleExitStatus();
     return true;
 }
@@ -45,7 +42,12 @@ bool TLUserProcess::_populateTask() {
     return true;
 }
 
+/// Page tables belong to the first of several processes that share their address space: known only when all
+/// are opened, which several threads do at once.
 void TLUserProcess::gatherPageTableSize() {
+    if (!breakDownPhysTally() || !_isAlive()) {
+        return;
+    }
     const LedgerLayout& layout = ledgerLayout();
     if (!layout.entryCount || !layout.pageTable) {
         return;
@@ -116,6 +118,7 @@ void TLUserProcess::gatherData() {
     if (!hiddenFromDisplay()) {
         _gatherImageData();
         _gatherPhysTally();
+        gatherPageTableSize();
         walk.ownedVmObjects = _gatherOwnedVmObjects();
     }
     RegionRecorder recorder(*this);

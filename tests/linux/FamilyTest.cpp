@@ -299,12 +299,14 @@ TEST(Relatives, TwoProcessesInOneAddressSpaceCountOnce) {
     const Puppet puppet({"twins"});
     const Puppet::Entry& memory = puppet.ledger()[0];
     const std::vector<int> pids{puppet.pid(), static_cast<int>(puppet.ledger()[1].size)};
-    const Gathered gathered = gather(pids, memory.address, memory.address + memory.size);
-    ASSERT_EQ(gathered.objects.size(), 1U);
-    EXPECT_EQ(gathered.sets().at({pids.begin(), pids.end()}), 64U);
-
+    const std::vector<int> falling(pids.rbegin(), pids.rend()); // rights can be made in any order
+    for (const std::vector<int>& order : {pids, falling}) {
+        const Gathered gathered = gather(order, memory.address, memory.address + memory.size);
+        ASSERT_EQ(gathered.objects.size(), 1U);
+        EXPECT_EQ(gathered.sets().at({pids.begin(), pids.end()}), 64U);
+    }
     std::vector<PortRight> rights;
-    for (const int pid : pids) {
+    for (const int pid : falling) {
         mach_port_t task = MACH_PORT_NULL;
         task_read_for_pid(pid, &task);
         rights.emplace_back(task);

@@ -16,6 +16,7 @@ namespace {
 /// One address space and the tasks that have it, rising by pid.
 struct Tenants {
     std::vector<MemberIdentity> tasks;
+    std::shared_ptr<MemberIdentity> owner;
 };
 
 /// The address spaces of processes with one key, in the order in which the kernel compares them.
@@ -79,9 +80,9 @@ void prepare(FamilyTable& table) {
 
 } // namespace
 
-MemberIdentity enterAddressSpace(const FamilyKey& key, MemberIdentity task) {
+AddressSpaceOwner enterAddressSpace(const FamilyKey& key, MemberIdentity task) {
     if (!key.isKnown()) {
-        return task;
+        return std::make_shared<MemberIdentity>(task);
     }
     FamilyTable& table = familyTable();
     const std::scoped_lock lock(table.mutex);
@@ -92,17 +93,24 @@ MemberIdentity enterAddressSpace(const FamilyKey& key, MemberIdentity task) {
         const std::size_t middle = (low + high) / 2;
         const int order = compareAddressSpaces(relatives[middle].tasks.front().pid, task.pid);
         if (order == 0) {
-            std::vector<MemberIdentity>& tasks = relatives[middle].tasks;
+            auto& [tasks, owner] = relatives[middle];
             tasks.insert(std::upper_bound(tasks.begin(), tasks.end(), task, isBefore), task);
-            return tasks.front();
+            *owner = isBefore(task, *owner) ? task : *owner;
+            return owner;
         }
         if (order == incomparableAddressSpaces) {
             break; // one of the two has ended, or may not be compared
         }
         (order < 0 ? low : high) = order < 0 ? middle + 1 : middle;
     }
-    relatives.insert(relatives.begin() + static_cast<std::ptrdiff_t>(low), Tenants{{task}});
-    return task;
+    auto owner = std::make_shared<MemberIdentity>(task);
+    relatives.insert(relatives.begin() + static_cast<std::ptrdiff_t>(low), Tenants{{task}, owner});
+    return owner;
+}
+
+MemberIdentity identityOf(const AddressSpaceOwner& owner) {
+    const std::scoped_lock lock(familyTable().mutex);
+    return *owner;
 }
 
 void leaveAddressSpace(const FamilyKey& key, MemberIdentity task) {

@@ -9,13 +9,19 @@
 #include "platform/linux/families/FamilyKey.h"
 #include "platform/linux/families/FamilyScan.h"
 
+#include <memory>
 #include <optional>
 
 namespace tally::platform {
 
-/// Enters a task to which a right was made. @return who stands for its address space: itself, or a relative
-/// with a lower pid that shares it whole.
-MemberIdentity enterAddressSpace(const FamilyKey& key, MemberIdentity task);
+/// Who stands for an address space: of the tasks that have entered it, the one with the lowest pid. Rights
+/// are made by several threads at once, so that it can change until all are made.
+using AddressSpaceOwner = std::shared_ptr<const MemberIdentity>;
+
+/// Enters a task to which a right was made, and with it every relative that shares its address space whole.
+AddressSpaceOwner enterAddressSpace(const FamilyKey& key, MemberIdentity task);
+
+MemberIdentity identityOf(const AddressSpaceOwner& owner);
 
 /// Takes back what enterAddressSpace entered.
 void leaveAddressSpace(const FamilyKey& key, MemberIdentity task);

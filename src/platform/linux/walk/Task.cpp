@@ -95,7 +95,8 @@ Task::Task(MemberIdentity identity, const FamilyKey& key)
     : identity_(identity), key_(key), owner_(enterAddressSpace(key, identity)) {}
 
 Task::Task(std::shared_ptr<Corpse> corpse)
-    : identity_(corpse->identity()), owner_(corpse->owner()), corpse_(std::move(corpse)) {}
+    : identity_(corpse->identity()), owner_(std::make_shared<MemberIdentity>(corpse->owner())),
+      corpse_(std::move(corpse)) {}
 
 Task::~Task() {
     if (!corpse_) {
@@ -117,11 +118,11 @@ const Walk* Task::walk(kern_return_t* status) {
         return corpse_->walk();
     }
     if (!walk_ && walkStatus_ == KERN_SUCCESS) {
-        if (isSecondTenant() && compareAddressSpaces(owner_.pid, identity_.pid) != 0) {
-            owner_ = identity_; // it has loaded another program since
+        if (isSecondTenant() && compareAddressSpaces(identityOf(owner_).pid, identity_.pid) != 0) {
+            owner_ = std::make_shared<MemberIdentity>(identity_); // it has loaded another program since
         }
-        Walk::Result result =
-            Walk::read(identity_, key_, owner_, !accountingSwitchIsOn(), std::exchange(status_, {}));
+        Walk::Result result = Walk::read(identity_, key_, identityOf(owner_), !accountingSwitchIsOn(),
+                                         std::exchange(status_, {}));
         walkStatus_ = result.status;
         walk_ = std::move(result.walk);
         addNotices(std::move(result.notices));

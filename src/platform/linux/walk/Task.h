@@ -30,7 +30,7 @@ class Task {
 
     std::int32_t pid() const { return identity_.pid; }
     /// Whether a task with a lower pid has the very same address space, and so its page tables too.
-    bool isSecondTenant() const { return owner_.pid != identity_.pid; }
+    bool isSecondTenant() const { return identityOf(owner_).pid != identity_.pid; }
     /// Whether there is a right to another process that descends from the same exec, as far as can be told.
     bool hasRelatives() const;
     std::uint64_t startTicks() const { return identity_.startTicks; }
@@ -55,7 +55,7 @@ class Task {
   private:
     MemberIdentity identity_;
     FamilyKey key_;
-    MemberIdentity owner_; // of the address space
+    AddressSpaceOwner owner_;
     std::shared_ptr<Corpse> corpse_;
     std::optional<ProcessStatus> status_;
     std::unique_ptr<const Walk> walk_;
