@@ -5,6 +5,7 @@
 
 #include <sys/ioctl.h>
 
+#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cerrno>
@@ -99,9 +100,7 @@ QueryResult queryMappings(const Descriptor& maps, std::vector<Mapping>* mappings
     return QueryResult::tooMany;
 }
 
-} // namespace
-
-bool listMappings(const Descriptor& maps, std::vector<Mapping>* mappings) {
+bool listAll(const Descriptor& maps, std::vector<Mapping>* mappings) {
     static std::atomic<bool> queriesAnswered = true; // false once this kernel has refused one
     mappings->clear();
     if (queriesAnswered) {
@@ -115,6 +114,28 @@ bool listMappings(const Descriptor& maps, std::vector<Mapping>* mappings) {
     }
     mappings->clear();
     return readLines(maps, [&](std::string_view lines) { decodeMaps(lines, mappings); });
+}
+
+/// Cuts off what an earlier mapping covers: one that grew downwards, or merged, while the list was made.
+void putInOrder(std::vector<Mapping>& mappings) {
+    std::uint64_t reached = 0;
+    for (Mapping& mapping : mappings) {
+        if (mapping.start < reached) {
+            const std::uint64_t start = std::min(reached, mapping.end);
+            mapping.fileOffset += mapping.isFileBacked() ? start - mapping.start : 0;
+            mapping.start = start;
+        }
+        reached = std::max(reached, mapping.end);
+    }
+    std::erase_if(mappings, [](const Mapping& mapping) { return mapping.start == mapping.end; });
+}
+
+} // namespace
+
+bool listMappings(const Descriptor& maps, std::vector<Mapping>* mappings) {
+    const bool isListed = listAll(maps, mappings);
+    putInOrder(*mappings);
+    return isListed;
 }
 
 } // namespace tally::platform
