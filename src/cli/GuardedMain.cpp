@@ -45,7 +45,7 @@ bool finishOutput() {
 
 } // namespace
 
-int guardedMain(int (*program)(int argc, char** argv), int argc, char** argv) {
+int guardedMain(const std::function<int(int argc, char** argv)>& program, int argc, char** argv) {
     std::set_terminate(endAtOnce);
     try {
         const int status = program(argc, argv);

@@ -1,6 +1,5 @@
 #include "cli/RunDriver.h"
 
-#include "analysis/TLTally.h"
 #include "cli/OutputFiles.h"
 #include "cli/ParseArguments.h"
 #include "cli/Sampling.h"
@@ -96,8 +95,7 @@ class Interrupts {
 };
 
 /// @return whether all of the report is where it belongs.
-bool measureOnce(const TLTallyArgs& args, TLTally::ProcessList targets, OutputFiles& outputs) {
-    TLTally tally(std::move(targets));
+bool measureOnce(const TLTallyArgs& args, TLTally& tally, OutputFiles& outputs) {
     Interrupts interrupts(tally, outputs);
     tally.gatherAllProcesses();
     tally.analyzeMemoryObjects();
@@ -111,14 +109,15 @@ bool measureOnce(const TLTallyArgs& args, TLTally::ProcessList targets, OutputFi
 }
 
 /// Measures what `args` ask for, into `outputs`. @return whether all of it could be told.
-bool measure(TLTallyArgs& args, OutputFiles& outputs) {
+bool measure(TLTallyArgs& args, OutputFiles& outputs, std::unique_ptr<TLTally>& gathered) {
     TLTally::ProcessList targets = buildTargets(args);
     if (targets.empty()) {
         outputs.discard();
         return false;
     }
     if (args.sampleInterval == 0) {
-        return measureOnce(args, std::move(targets), outputs);
+        gathered = std::make_unique<TLTally>(std::move(targets));
+        return measureOnce(args, *gathered, outputs);
     }
     targets.clear(); // every sample has its own
     if (!runSampling(args, outputs)) {
@@ -130,7 +129,7 @@ bool measure(TLTallyArgs& args, OutputFiles& outputs) {
 
 } // namespace
 
-int runTally(int argc, char** argv) {
+int runTally(int argc, char** argv, std::unique_ptr<TLTally>& gathered) {
     platform::prepareOwnProcess();
     auto parsed = parseArguments(argc, argv);
     if (const auto* error = std::get_if<TLError>(&parsed)) {
@@ -152,11 +151,16 @@ int runTally(int argc, char** argv) {
         return 1;
     }
     try {
-        return measure(args, outputs) ? 0 : 1;
+        return measure(args, outputs, gathered) ? 0 : 1;
     } catch (const std::bad_alloc&) {
         outputs.discard(); // half a document is of no use
         throw;
     }
+}
+
+int runTally(int argc, char** argv) {
+    std::unique_ptr<TLTally> gathered;
+    return runTally(argc, argv, gathered);
 }
 
 } // namespace tally

@@ -2,9 +2,18 @@
 
 #pragma once
 
+#include "analysis/TLTally.h"
+
+#include <memory>
+
 namespace tally {
 
-/// Runs the tool. @return the exit status: 0 after a report or help, 1 after an error of the whole run.
+/// Runs the tool. @param gathered out: what a report was made of, which is much and in small pieces: a
+/// program that ends need not free it.
+/// @return the exit status: 0 after a report or help, 1 after an error of the whole run.
+int runTally(int argc, char** argv, std::unique_ptr<TLTally>& gathered);
+
+/// The same, and frees what it has gathered.
 int runTally(int argc, char** argv);
 
 } // namespace tally
