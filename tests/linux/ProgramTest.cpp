@@ -160,6 +160,25 @@ TEST(Program, OnlyTheMarkOfADeletedExecutableIsTakenOffItsName) {
     }
 }
 
+TEST(Program, AProgramInAnotherRootIsKnownToAnOrdinaryUser) {
+    const TemporaryFolder folder;
+    std::filesystem::copy_file(TALLY_PROGRAM, folder.path() + "/tally");
+    chmod(folder.path().c_str(), 0755);
+    const Outcome outcome =
+        run({"/bin/sh", "-c",
+             "cd $0 && for file in /bin/sleep $(ldd /bin/sleep | grep -o '/[^ ]*'); do "
+             "mkdir -p root${file%/*} && cp $file root$file || exit 77; done; "
+             "chroot --userspec=65534:65534 root /bin/sleep 60 & pid=$!; trap 'kill $pid' EXIT; "
+             "for i in 1 2 3 4 5 6 7 8 9; do readlink /proc/$pid/exe | grep -q root/bin && break; sleep 0.1; "
+             "done; "
+             "setpriv --reuid=65534 --regid=65534 --clear-groups ./tally --pid $pid",
+             folder.path()});
+    if (!isRoot() || outcome.status == 77) {
+        GTEST_SKIP() << "needs root, and a program to copy";
+    }
+    EXPECT_TRUE(holds(outcome.output, "__LINKEDIT\n")) << outcome.output << outcome.errors;
+}
+
 /// A program that is mapped from a mount of which nobody answers.
 TEST(Program, AFileSystemThatDoesNotAnswerHoldsUpNothing) {
     const std::string server = "/usr/bin/bindfs";

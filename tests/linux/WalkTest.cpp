@@ -14,6 +14,8 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/mman.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -217,6 +219,35 @@ TEST(Walk, TheObjectViewCountsWhatTheObjectHoldsAndTheChargedViewWhatWasTouched)
     ASSERT_EQ(ids.size(), 3U);
     EXPECT_EQ(ids[0], ids[1]);
     EXPECT_EQ(ids[0], ids[2]); // the other process maps the same object
+}
+
+/// Whose pages are another file system's, and whose nobody writes back.
+TEST(Walk, WhatIsWrittenIsDirtyOnEveryFileSystem) {
+    const test::TemporaryFolder folder;
+    for (const char* name : {"/lower", "/upper", "/work", "/mount"}) {
+        ASSERT_EQ(mkdir((folder.path() + name).c_str(), 0700), 0);
+    }
+    const std::string layers = "lowerdir=" + folder.path() + "/lower,upperdir=" + folder.path() +
+                               "/upper,workdir=" + folder.path() + "/work";
+    const std::string mountPoint = folder.path() + "/mount";
+    for (const auto& [type, options] : {std::pair("overlay", layers), std::pair("ramfs", std::string())}) {
+        if (mount(type, mountPoint.c_str(), type, 0, options.c_str()) != 0) {
+            GTEST_SKIP() << "nothing can be mounted here";
+        }
+        std::ofstream(mountPoint + "/file").close();
+        EXPECT_EQ(truncate((mountPoint + "/file").c_str(), 32 * 4096), 0);
+        for (const int view : {1, 0}) {
+            SCOPED_TRACE(std::string(type) + (view == 1 ? ", charged" : ", object"));
+            const AccountingSwitch value(view);
+            const Puppet filler({"fill", mountPoint + "/file", "4"});
+            const Puppet::Entry& entry = filler.ledger().front();
+            const PortRight task = taskOf(filler);
+            const WholeWalk whole = walk(task.name(), filler.pid());
+            EXPECT_EQ(sumsOf(whole, entry.address, entry.address + entry.size).dirty,
+                      4 * vm_kernel_page_size());
+        }
+        EXPECT_EQ(umount2(mountPoint.c_str(), MNT_DETACH), 0);
+    }
 }
 
 TEST(Walk, OneThatBeganGoesOnWhenItsProcessHasEnded) {

@@ -14,6 +14,7 @@
 #include <mutex>
 #include <optional>
 #include <string_view>
+#include <utility>
 
 namespace tally::platform {
 
@@ -30,11 +31,17 @@ FileSystem fileSystemOfType(std::string_view type) {
         "ext4",  "xfs",     "btrfs",    "overlay",  "tmpfs",  "devtmpfs", "ramfs", "rootfs", "hugetlbfs",
         "ext3",  "ext2",    "f2fs",     "bcachefs", "zfs",    "jfs",      "vfat",  "exfat",  "ntfs3",
         "erofs", "iso9660", "squashfs", "udf",      "cramfs", "reiserfs", "nilfs2"};
-    const FileSystemKind kind = type == "tmpfs" || type == "devtmpfs" ? FileSystemKind::sharedMemory
-                                : type == "hugetlbfs"                 ? FileSystemKind::hugetlb
-                                : type == "btrfs"                     ? FileSystemKind::subvolumes
-                                                                      : FileSystemKind::ordinary;
-    return {kind, std::ranges::find(local, type) != local.end()};
+    constexpr std::array<std::pair<std::string_view, FileSystemKind>, 7> special{
+        {{"tmpfs", FileSystemKind::sharedMemory},
+         {"devtmpfs", FileSystemKind::sharedMemory},
+         {"ramfs", FileSystemKind::sharedMemory},
+         {"rootfs", FileSystemKind::sharedMemory},
+         {"hugetlbfs", FileSystemKind::hugetlb},
+         {"btrfs", FileSystemKind::subvolumes},
+         {"overlay", FileSystemKind::stacked}}};
+    const auto* const found = std::ranges::find(special, type, &decltype(special)::value_type::first);
+    return {found == special.end() ? FileSystemKind::ordinary : found->second,
+            std::ranges::find(local, type) != local.end()};
 }
 
 /// Looks the device up in a list of mounts.

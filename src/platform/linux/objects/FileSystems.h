@@ -10,7 +10,13 @@
 
 namespace tally::platform {
 
-enum class FileSystemKind : std::uint8_t { ordinary, sharedMemory, hugetlb, subvolumes };
+enum class FileSystemKind : std::uint8_t {
+    ordinary,
+    sharedMemory, // whatever is in memory only
+    hugetlb,
+    subvolumes, // files of several have one device number in lists of mappings
+    stacked,    // the pages are those of a file of another file system
+};
 
 inline constexpr std::uint32_t internalMount =
     1; // 00:01, the kernel's own tmpfs: memfds, SysV segments, shared memory

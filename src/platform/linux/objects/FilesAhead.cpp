@@ -38,7 +38,7 @@ void FilesAhead::ask(const std::string& folder, std::span<const Mapping> mapping
             (backing == Backing::sharedMemory && (objectView || swapInUse)) ||
             (backing == Backing::file && (objectView || (mapping.shared && mapping.writable)));
         if (isAsked && !known.file.isOpen() && opened < mostOpened) {
-            known.file = openMappedFile(folder, mapping);
+            known.file = openForPageStates(folder, mapping);
             ++opened;
         }
     }

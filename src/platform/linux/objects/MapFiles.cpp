@@ -13,6 +13,7 @@
 #include <sys/sysmacros.h>
 #include <unistd.h>
 
+#include <array>
 #include <cerrno>
 
 namespace tally::platform {
@@ -34,16 +35,16 @@ struct cachestat_counts {
 constexpr long cachestatCall = 451;
 
 /// Where no disk is behind a mount, the list of mappings can name another device than the file itself does,
-/// as with subvolumes.
+/// as with subvolumes and, before 6.6, overlays.
 bool isFileOf(std::uint32_t deviceMajor, std::uint32_t deviceMinor, std::uint64_t inode,
               const Mapping& mapping) {
-    return inode == mapping.inode && deviceMajor == mapping.deviceMajor &&
-           (deviceMinor == mapping.deviceMinor || mapping.deviceMajor == 0);
+    return inode == mapping.inode &&
+           (deviceMajor == 0 || (deviceMajor == mapping.deviceMajor && deviceMinor == mapping.deviceMinor));
 }
 
-std::string pathByName(const std::string& folder, const Mapping& mapping) {
-    return folder + "/root" + mapping.name;
-}
+/// The folders from which the name of a mapping can lead to its file: the process's root, for who lives in
+/// other mounts than the tool; the tool's own, for who has only changed its root.
+std::array<std::string, 2> rootsOf(const std::string& folder) { return {folder + "/root", systemPath("/")}; }
 
 Descriptor openForStates(const std::string& path) {
     return Descriptor(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
@@ -73,25 +74,24 @@ Descriptor findByName(const std::string& folder, const Mapping& mapping) {
         errno = ENOENT;
         return Descriptor();
     }
-    const Descriptor root(open((folder + "/root").c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!root.isOpen()) {
-        return Descriptor();
+    int refusal = ENOENT;
+    for (const std::string& path : rootsOf(folder)) {
+        const Descriptor root(open(path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+        // A file that is mapped is in the kernel's cache of names, and so is the way to it.
+        open_how how{.flags = O_PATH | O_CLOEXEC | O_NOFOLLOW, .mode = 0, .resolve = RESOLVE_CACHED};
+        Descriptor file(static_cast<int>(
+            root.isOpen() ? syscall(SYS_openat2, root.number(), mapping.name.c_str() + 1, &how, sizeof how)
+                          : -1));
+        struct stat status {};
+        if (!file.isOpen()) {
+            refusal = errno == ENOENT ? refusal : errno == EACCES ? EACCES : EAGAIN;
+        } else if (fstat(file.number(), &status) == 0 &&
+                   isFileOf(major(status.st_dev), minor(status.st_dev), status.st_ino, mapping)) {
+            return file;
+        }
     }
-    // A file that is mapped is in the kernel's cache of names, and so is the way to it.
-    open_how how{.flags = O_PATH | O_CLOEXEC | O_NOFOLLOW, .mode = 0, .resolve = RESOLVE_CACHED};
-    Descriptor file(
-        static_cast<int>(syscall(SYS_openat2, root.number(), mapping.name.c_str() + 1, &how, sizeof how)));
-    if (!file.isOpen()) {
-        errno = errno == ENOENT || errno == EACCES ? errno : EAGAIN;
-        return Descriptor();
-    }
-    struct stat status {};
-    if (fstat(file.number(), &status) != 0 ||
-        !isFileOf(major(status.st_dev), minor(status.st_dev), status.st_ino, mapping)) {
-        errno = ENOENT;
-        return Descriptor();
-    }
-    return file;
+    errno = refusal;
+    return Descriptor();
 }
 
 Descriptor openMappedFile(const std::string& folder, const Mapping& mapping) {
@@ -124,15 +124,26 @@ std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Map
     if (file || errno == ETIMEDOUT || !mapping.name.starts_with('/')) {
         return file;
     }
-    const int refusal = errno;
-    file = inquire(device, pathByName(folder, mapping));
-    if (file &&
-        !isFileOf(file->status.stx_dev_major, file->status.stx_dev_minor, file->status.stx_ino, mapping)) {
-        file.reset();
-        errno = ENOENT;
+    int refusal = errno;
+    for (const std::string& root : rootsOf(folder)) {
+        file = inquire(device, root + mapping.name);
+        if (file &&
+            isFileOf(file->status.stx_dev_major, file->status.stx_dev_minor, file->status.stx_ino, mapping)) {
+            return file;
+        }
+        refusal = !file && isRefusal(errno) ? errno : refusal;
     }
-    errno = isRefusal(errno) ? errno : refusal;
-    return file;
+    errno = refusal;
+    return std::nullopt;
+}
+
+Descriptor openForPageStates(const std::string& folder, const Mapping& mapping) {
+    if (FilesAhead::ofThisThread() == nullptr &&
+        kindOfFileSystem(mapping, folder) == FileSystemKind::stacked) {
+        errno = EOPNOTSUPP;
+        return Descriptor();
+    }
+    return openMappedFile(folder, mapping);
 }
 
 std::optional<CachedPages> cachedPages(const Descriptor& file, std::uint64_t offset, std::uint64_t length) {

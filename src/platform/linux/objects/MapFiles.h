@@ -30,6 +30,9 @@ Descriptor findByName(const std::string& folder, const Mapping& mapping);
 /// is on a file system that could keep us waiting (EAGAIN).
 Descriptor openMappedFile(const std::string& folder, const Mapping& mapping);
 
+/// The same, to ask for the states of its pages: not open where these are another file's, as on an overlay.
+Descriptor openForPageStates(const std::string& folder, const Mapping& mapping);
+
 /// What is known of the file behind `mapping` by a question that is given up when it takes too long; absent
 /// with errno.
 std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Mapping& mapping);

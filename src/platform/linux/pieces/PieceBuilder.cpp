@@ -126,7 +126,7 @@ PieceBuilder::ObjectPages PieceBuilder::chargedObjectPages(std::size_t index) {
     if (isOnlyCopy(backing)) {
         pages.dirty = pages.resident;
         if (facts_.swapInUse && backing.backing == Backing::sharedMemory) {
-            markSwapped(index, openMappedFile(folder_, mapping), pages);
+            markSwapped(index, openForPageStates(folder_, mapping), pages);
         }
     } else if (backing.backing == Backing::file && mapping.shared && mapping.writable &&
                pages.resident != 0) {
@@ -172,7 +172,7 @@ void PieceBuilder::markSwapped(std::size_t index, const Descriptor& file, Object
 void PieceBuilder::markDirty(std::size_t index, ObjectPages& pages) {
     const Mapping& mapping = mappings_[index];
     const std::uint64_t base = filePage(mapping);
-    const Descriptor file = openMappedFile(folder_, mapping);
+    const Descriptor file = openForPageStates(folder_, mapping);
     PageFinder finder(file, &CachedPages::dirty);
     std::vector<PageRange> resident;
     std::vector<PageRange> dirty;
@@ -183,7 +183,9 @@ void PieceBuilder::markDirty(std::size_t index, ObjectPages& pages) {
     }
     if (!asked) {
         const SmapsEntry* entry = smaps_.entryFor(mapping);
-        dirty = firstPages(resident, entry == nullptr ? 0 : entry->dirty / basePage);
+        const std::uint64_t count = entry == nullptr ? 0 : entry->dirty / basePage;
+        dirty = firstPages(resident, count);
+        usedEstimates_ |= count != 0 && count < pages.resident; // how many, but not which
     }
     std::vector<PageWords> words;
     std::size_t at = 0;
@@ -208,7 +210,7 @@ PieceBuilder::ObjectPages PieceBuilder::seenObjectPages(std::size_t index) {
     const Mapping& mapping = mappings_[index];
     const BackingObject& backing = backings_[index];
     if (backing.backing == Backing::sharedMemory || backing.backing == Backing::file) {
-        const Descriptor file = openMappedFile(folder_, mapping);
+        const Descriptor file = openForPageStates(folder_, mapping);
         const std::optional<CachedPages> inside = cachedPages(file, mapping.fileOffset, mapping.size());
         const std::optional<CachedPages> below = cachedPages(file, 0, mapping.fileOffset);
         if (inside && below) {
