@@ -35,7 +35,7 @@ struct cachestat_counts {
 constexpr long cachestatCall = 451;
 
 /// Where no disk is behind a mount, the list of mappings can name another device than the file itself does,
-/// as with subvolumes and, before 6.6, overlays.
+/// as with subvolumes and, on older kernels, overlays.
 bool isFileOf(std::uint32_t deviceMajor, std::uint32_t deviceMinor, std::uint64_t inode,
               const Mapping& mapping) {
     return inode == mapping.inode &&
