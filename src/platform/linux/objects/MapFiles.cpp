@@ -7,8 +7,10 @@
 #include "platform/linux/objects/FilesAhead.h"
 
 #include <fcntl.h>
+#include <linux/magic.h>
 #include <linux/openat2.h>
 #include <sys/stat.h>
+#include <sys/statfs.h>
 #include <sys/syscall.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
@@ -34,12 +36,14 @@ struct cachestat_counts {
 };
 constexpr long cachestatCall = 451;
 
-/// Where no disk is behind a mount, the list of mappings can name another device than the file itself does,
-/// as with subvolumes and, on older kernels, overlays.
-bool isFileOf(std::uint32_t deviceMajor, std::uint32_t deviceMinor, std::uint64_t inode,
-              const Mapping& mapping) {
+/// @param fileSystem of the file, as statfs gives it. Where no disk is behind a mount, the list of mappings
+/// can name another device than the file itself does, as with subvolumes and, on older kernels, overlays.
+bool isFileOf(const Mapping& mapping, std::uint32_t deviceMajor, std::uint32_t deviceMinor,
+              std::uint64_t inode, std::uint64_t fileSystem) {
+    const bool canDiffer =
+        deviceMajor == 0 && (mapping.deviceMajor == 0 || fileSystem == OVERLAYFS_SUPER_MAGIC);
     return inode == mapping.inode &&
-           (deviceMajor == 0 || (deviceMajor == mapping.deviceMajor && deviceMinor == mapping.deviceMinor));
+           (canDiffer || (deviceMajor == mapping.deviceMajor && deviceMinor == mapping.deviceMinor));
 }
 
 /// The folders from which the name of a mapping can lead to its file: the process's root, for who lives in
@@ -83,10 +87,12 @@ Descriptor findByName(const std::string& folder, const Mapping& mapping) {
             root.isOpen() ? syscall(SYS_openat2, root.number(), mapping.name.c_str() + 1, &how, sizeof how)
                           : -1));
         struct stat status {};
+        struct statfs system {};
         if (!file.isOpen()) {
             refusal = errno == ENOENT ? refusal : errno == EACCES ? EACCES : EAGAIN;
-        } else if (fstat(file.number(), &status) == 0 &&
-                   isFileOf(major(status.st_dev), minor(status.st_dev), status.st_ino, mapping)) {
+        } else if (fstat(file.number(), &status) == 0 && fstatfs(file.number(), &system) == 0 &&
+                   isFileOf(mapping, major(status.st_dev), minor(status.st_dev), status.st_ino,
+                            static_cast<std::uint64_t>(system.f_type))) {
             return file;
         }
     }
@@ -127,8 +133,8 @@ std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Map
     int refusal = errno;
     for (const std::string& root : rootsOf(folder)) {
         file = inquire(device, root + mapping.name);
-        if (file &&
-            isFileOf(file->status.stx_dev_major, file->status.stx_dev_minor, file->status.stx_ino, mapping)) {
+        if (file && isFileOf(mapping, file->status.stx_dev_major, file->status.stx_dev_minor,
+                             file->status.stx_ino, file->fileSystemType)) {
             return file;
         }
         refusal = !file && isRefusal(errno) ? errno : refusal;
