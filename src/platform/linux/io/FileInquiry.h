@@ -30,7 +30,8 @@ struct FileAnswer {
 /// The key of files whose device is not known.
 inline constexpr std::uint64_t unknownDevice = ~std::uint64_t{0};
 
-/// What stat tells, for where statx is refused. Waits for who stands behind the file. @return false with errno.
+/// What stat tells, for where statx is refused. Waits for who stands behind the file. @return false with
+/// errno.
 bool statusByOlderCall(const char* path, struct statx& status);
 
 /// Asks what is at `path`. @param device that is believed to be behind it.
