@@ -221,15 +221,21 @@ TEST(Program, AFileSystemThatDoesNotAnswerHoldsUpNothing) {
 }
 
 TEST(Program, ProcessesThatComeAndGoDisturbNothing) {
+    Puppet ended({"idle"});
+    ended.end(true); // its parent has not taken leave of it yet
+    const Puppet live({"idle"});
+    const Outcome both = run({TALLY_PROGRAM, "--pid", pidOf(ended), "--pid", pidOf(live)});
+    EXPECT_EQ(both.status, 0) << both.errors;
+
     // A shell that starts and ends children all the time while everything is measured.
     const Puppet churn({"churn"});
     const TemporaryFolder folder;
-    const Outcome storm =
-        run({"/bin/sh", "-c",
-             "(i=0; while [ $i -lt 400 ]; do /bin/true; i=$((i+1)); done) & "
-             "for n in 1 2 3 4 5; do " TALLY_PROGRAM " -a -f bytes >out 2>>err || exit 9; done; wait; "
-             "grep -c TOTAL out"},
-            folder.path());
+    const Outcome storm = run({"/bin/sh", "-c",
+                               "(i=0; while [ $i -lt 400 ]; do /bin/true; i=$((i+1)); done) & "
+                               "for n in 1 2 3 4 5; do " TALLY_PROGRAM
+                               " -a -f bytes >out 2>err || { cat err >&2; exit 9; }; done; "
+                               "wait; grep -c TOTAL out"},
+                              folder.path());
     if (geteuid() != 0) {
         GTEST_SKIP() << "all processes are measured by root only";
     }

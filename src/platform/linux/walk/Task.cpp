@@ -84,8 +84,10 @@ class PortTable {
     std::unordered_map<std::int32_t, mach_port_t> byPid_; // the latest right to each process
 };
 
+/// Never destroyed: rights that are left at the end of the process are the kernel's to release, and other
+/// tables, which a task would take leave of, may be gone before.
 PortTable& portTable() {
-    static PortTable table;
+    static PortTable& table = *new PortTable;
     return table;
 }
 
