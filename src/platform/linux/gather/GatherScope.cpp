@@ -7,6 +7,7 @@
 #include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/objects/FileSystems.h"
 #include "platform/linux/owned/OwnedGather.h"
+#include "platform/linux/pieces/MarkedPages.h"
 
 namespace tally::platform {
 
@@ -16,11 +17,13 @@ GatherScope::GatherScope() {
     beginOwned();
     beginMachineState();
     beginFamilies();
+    beginMarks();
     restartLazyFreeSearch(true);
 }
 
 GatherScope::~GatherScope() {
     restartLazyFreeSearch(false);
+    endMarks();
     endFamilies();
     endOwned();
     endMachineState();

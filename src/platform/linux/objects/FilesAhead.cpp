@@ -34,9 +34,8 @@ void FilesAhead::ask(const std::string& folder, std::span<const Mapping> mapping
             known.object = backingOf(mapping, folder);
         }
         const Backing backing = known.object.backing;
-        const bool isAsked =
-            (backing == Backing::sharedMemory && (objectView || swapInUse)) ||
-            (backing == Backing::file && (objectView || (mapping.shared && mapping.writable)));
+        const bool isAsked = (backing == Backing::sharedMemory && (objectView || swapInUse)) ||
+                             (backing == Backing::file && (objectView || mapping.shared));
         if (isAsked && !known.file.isOpen() && opened < mostOpened) {
             known.file = openForPageStates(folder, mapping);
             ++opened;

@@ -42,12 +42,15 @@ constexpr std::uint64_t ofTask = 2;
 constexpr std::uint64_t ofSharedSet = 3;
 constexpr std::uint64_t ofFoldedSets = 4;
 constexpr std::uint64_t ofKernelBuffer = 5;
+constexpr std::uint64_t ofMarkedPages = 6;
 
 } // namespace
 
 std::uint64_t objectIdOfFile(const BackingObject& object) {
     return identityOf({ofFile, object.isSysV ? 1U : 0U, object.device, object.inode});
 }
+
+std::uint64_t objectIdOfMarkedPages(std::uint64_t objectId) { return identityOf({ofMarkedPages, objectId}); }
 
 std::uint64_t objectIdOfTaskMemory(std::int32_t pid, std::uint64_t startTicks, std::uint64_t start) {
     return identityOf({ofTask, static_cast<std::uint64_t>(pid), startTicks, start});

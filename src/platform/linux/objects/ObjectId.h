@@ -12,6 +12,9 @@ namespace tally::platform {
 
 /// A file, shared memory or a device.
 std::uint64_t objectIdOfFile(const BackingObject& object);
+/// Of the pages of that object that are filed apart: a file's that are not on disk yet, shared memory's that
+/// are swapped out.
+std::uint64_t objectIdOfMarkedPages(std::uint64_t objectId);
 
 /// Memory that only the task (pid, start time) has, behind the mapping that starts at `start`.
 std::uint64_t objectIdOfTaskMemory(std::int32_t pid, std::uint64_t startTicks, std::uint64_t start);

@@ -69,6 +69,24 @@ void listSegments(const Task& task, const MappedObjects& mapped, Records* record
     }
 }
 
+/// What is swapped out is an object of its own, as it is where somebody maps it.
+void divideSwapped(Records* records) {
+    Records swapped;
+    for (auto& [id, record] : *records) {
+        if (record.compressedSize != 0) {
+            OwnedRecord part = record;
+            part.objectId = objectIdOfMarkedPages(id);
+            part.virtualSize = part.compressedSize;
+            part.residentSize = 0;
+            swapped.emplace(part.objectId, part);
+            record.virtualSize -= std::min(record.virtualSize, record.compressedSize);
+            record.compressedSize = 0;
+        }
+    }
+    std::erase_if(*records, [](const auto& each) { return !each.second.holdsMemory(); });
+    records->merge(swapped);
+}
+
 /// @return absent with errno when the list cannot be made.
 std::optional<Records> ownedBy(Task& task) {
     kern_return_t status = KERN_SUCCESS;
@@ -92,6 +110,7 @@ std::optional<Records> ownedBy(Task& task) {
     task.addNotices(std::move(notes));
     listSegments(task, mapped, &records);
     std::erase_if(records, [&](const auto& record) { return !claimOwnedObject(record.first, task.pid()); });
+    divideSwapped(&records);
     return records;
 }
 

@@ -13,19 +13,24 @@ bool PageFinder::find(PageRange range, std::vector<PageRange>* found) {
     if (!counts) {
         return false;
     }
+    const std::size_t before = found->size();
     halve(range, std::min((*counts).*figure_, range.pages()), found);
-    return true;
+    if (wasRefused_) {
+        found->resize(before);
+    }
+    return !wasRefused_;
 }
 
 std::uint64_t PageFinder::countIn(PageRange range) {
     --questionsLeft_;
     const std::optional<CachedPages> counts =
         cachedPages(*file_, range.first * basePage, range.pages() * basePage);
+    wasRefused_ |= !counts;
     return counts ? (*counts).*figure_ : 0;
 }
 
 void PageFinder::halve(PageRange range, std::uint64_t count, std::vector<PageRange>* found) {
-    if (count == 0) {
+    if (count == 0 || wasRefused_) {
         return;
     }
     if (count >= range.pages() || questionsLeft_ == 0) {

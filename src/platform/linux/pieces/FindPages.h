@@ -12,7 +12,7 @@
 namespace tally::platform {
 
 /// Finds which pages of a file are dirty, or swapped out, by halving ranges and asking for each half.
-/// Cost: two questions per page found and level at most, and never more than a few thousand: past that the
+/// Cost: two questions per page found and level at most, and never more than some ten thousand: past that the
 /// first pages of what is left stand for the ones that are meant.
 class PageFinder {
   public:
@@ -29,7 +29,8 @@ class PageFinder {
 
     const Descriptor* file_;
     std::uint64_t CachedPages::*figure_;
-    std::size_t questionsLeft_ = 8192;
+    std::size_t questionsLeft_ = 65536;
+    bool wasRefused_ = false;
 };
 
 } // namespace tally::platform

@@ -1,70 +1,22 @@
 #include "platform/linux/pieces/PieceBuilder.h"
 
 #include "platform/linux/objects/ObjectId.h"
-#include "platform/linux/pieces/FindPages.h"
 #include "platform/linux/pieces/SharedPieces.h"
 #include "platform/linux/tags/Tags.h"
 
 #include <algorithm>
-#include <optional>
 
 namespace tally::platform {
 
 namespace {
 
-constexpr std::int32_t cleanFilePage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL;
-constexpr std::int32_t dirtyFilePage = cleanFilePage | VM_PAGE_QUERY_PAGE_DIRTY;
-constexpr std::int32_t sharedMemoryPage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
-
-/// Whether its pages are the only copy, so that the kernel can drop none of them.
-bool isOnlyCopy(const BackingObject& object) {
-    return object.backing == Backing::sharedMemory || object.backing == Backing::hugetlb ||
-           object.backing == Backing::device;
-}
-
-std::uint64_t filePage(const Mapping& mapping) { return mapping.fileOffset / basePage; }
-
-PageWords wordsOf(PageRange range, std::uint64_t base, std::int32_t word) {
-    return {range.first - base, static_cast<std::uint32_t>(range.pages()), word};
-}
-
-/// The pages of `range` that no run covers.
-void appendGaps(std::span<const PageRun> runs, PageRange range, std::vector<PageRange>* gaps) {
-    for (const PageRun& run : runs) {
-        if (range.first < run.firstPage) {
-            gaps->push_back({range.first, run.firstPage});
-        }
-        range.first = run.endPage();
+std::vector<BackingObject> backingsOf(const AddressSpace& space) {
+    std::vector<BackingObject> backings;
+    backings.reserve(space.mappings.size());
+    for (const Mapping& mapping : space.mappings) {
+        backings.push_back(backingOf(mapping, space.folder));
     }
-    if (range.first < range.end) {
-        gaps->push_back(range);
-    }
-}
-
-/// Takes the first `count` pages of `ranges`: where only a number is known.
-std::vector<PageRange> firstPages(std::span<const PageRange> ranges, std::uint64_t count) {
-    std::vector<PageRange> taken;
-    for (const PageRange& range : ranges) {
-        const std::uint64_t pages = std::min(count, range.pages());
-        if (pages == 0) {
-            break;
-        }
-        taken.push_back({range.first, range.first + pages});
-        count -= pages;
-    }
-    return taken;
-}
-
-/// Moves the words of an object's pages to where they stand once the task's own pages are taken out.
-void closeGaps(std::span<const PageRun> runs, std::vector<PageWords>& words) {
-    std::uint64_t ownBelow = 0;
-    std::size_t at = 0;
-    for (PageWords& word : words) {
-        for (; at < runs.size() && runs[at].firstPage < word.firstPage; ++at) {
-            ownBelow += runs[at].kind == PageKind::object ? 0 : runs[at].pages;
-        }
-        word.firstPage -= ownBelow;
-    }
+    return backings;
 }
 
 /// Moves the words together, one behind the other.
@@ -78,160 +30,11 @@ void pack(std::vector<PageWords>& words) {
 
 } // namespace
 
-struct PieceBuilder::ObjectPages {
-    std::uint64_t offset = 0; // bytes in the object
-    std::uint64_t resident = 0;
-    std::uint64_t dirty = 0;
-    std::uint64_t swapped = 0;
-    std::vector<PageWords> words; // by page of the mapping; empty when the counts say enough
-    bool restIsApart = false;     // what is not there is a piece of its own
-
-    std::uint64_t held() const { return resident + swapped; }
-};
-
 PieceBuilder::PieceBuilder(const WalkFacts& facts, const AddressSpace& space, SmapsOfProcess& smaps)
-    : facts_(facts), mappings_(space.mappings), states_(space.states), parts_(space.parts),
-      folder_(space.folder), smaps_(smaps) {
-    backings_.reserve(mappings_.size());
+    : facts_(facts), mappings_(space.mappings), states_(space.states), parts_(space.parts), smaps_(smaps),
+      backings_(backingsOf(space)), tags_(tagsOf(space.folder, mappings_, backings_, states_)),
+      objects_(space, backings_, facts.swapInUse, smaps) {
     pieces_.reserve(mappings_.size());
-    for (const Mapping& mapping : mappings_) {
-        backings_.push_back(backingOf(mapping, folder_));
-        if (mapping.isFileBacked() && !facts.objectView) {
-            const std::uint64_t first = filePage(mapping);
-            counted_.expect(objectIdOfFile(backings_.back()), {first, first + mapping.pages()});
-        }
-    }
-    counted_.prepare();
-    tags_ = tagsOf(folder_, mappings_, backings_, states_);
-}
-
-PieceBuilder::ObjectPages PieceBuilder::chargedObjectPages(std::size_t index) {
-    const Mapping& mapping = mappings_[index];
-    const BackingObject& backing = backings_[index];
-    const std::uint64_t id = objectIdOfFile(backing);
-    const std::uint64_t base = filePage(mapping);
-    ObjectPages pages;
-    pages.offset = mapping.fileOffset;
-    std::vector<PageRange> fresh;
-    for (const PageRun& run : states_.runsOf(states_.mappings[index])) {
-        if (run.kind == PageKind::object) {
-            counted_.take(id, {base + run.firstPage, base + run.endPage()}, &fresh);
-        }
-    }
-    const std::int32_t word = isOnlyCopy(backing) ? sharedMemoryPage : cleanFilePage;
-    for (const PageRange& range : fresh) {
-        pages.resident += range.pages();
-        pages.words.push_back(wordsOf(range, base, word));
-    }
-    if (isOnlyCopy(backing)) {
-        pages.dirty = pages.resident;
-        if (facts_.swapInUse && backing.backing == Backing::sharedMemory) {
-            markSwapped(index, openForPageStates(folder_, mapping), pages);
-        }
-    } else if (backing.backing == Backing::file && mapping.shared && mapping.writable &&
-               pages.resident != 0) {
-        markDirty(index, pages);
-    }
-    return pages;
-}
-
-/// Adds the pages of shared memory that are swapped out: no page table shows them.
-void PieceBuilder::markSwapped(std::size_t index, const Descriptor& file, ObjectPages& pages) {
-    const Mapping& mapping = mappings_[index];
-    const MappingPages& states = states_.mappings[index];
-    const std::uint64_t base = filePage(mapping);
-    std::vector<PageRange> gaps;
-    appendGaps(states_.runsOf(states), {0, mapping.pages()}, &gaps);
-    PageFinder finder(file, &CachedPages::evicted);
-    std::vector<PageRange> swapped;
-    bool asked = file.isOpen();
-    for (const PageRange& gap : gaps) {
-        asked = asked && finder.find({base + gap.first, base + gap.end}, &swapped);
-    }
-    if (!asked) {
-        const SmapsEntry* entry = smaps_.entryFor(mapping);
-        const std::uint64_t count = entry == nullptr ? 0 : entry->swapped / basePage;
-        swapped = firstPages(gaps, count - std::min(count, states.swapped));
-        for (PageRange& range : swapped) {
-            range = {base + range.first, base + range.end};
-        }
-    }
-    std::vector<PageRange> fresh;
-    for (const PageRange& range : swapped) {
-        counted_.take(objectIdOfFile(backings_[index]), range, &fresh);
-    }
-    for (const PageRange& range : fresh) {
-        pages.swapped += range.pages();
-        pages.words.push_back(wordsOf(range, base, VM_PAGE_QUERY_PAGE_PAGED_OUT));
-    }
-    std::sort(pages.words.begin(), pages.words.end(),
-              [](const PageWords& a, const PageWords& b) { return a.firstPage < b.firstPage; });
-}
-
-/// Tells the dirty pages of a file that the task can write from the clean ones.
-void PieceBuilder::markDirty(std::size_t index, ObjectPages& pages) {
-    const Mapping& mapping = mappings_[index];
-    const std::uint64_t base = filePage(mapping);
-    const Descriptor file = openForPageStates(folder_, mapping);
-    PageFinder finder(file, &CachedPages::dirty);
-    std::vector<PageRange> resident;
-    std::vector<PageRange> dirty;
-    bool asked = file.isOpen();
-    for (const PageWords& word : pages.words) {
-        resident.push_back({base + word.firstPage, base + word.firstPage + word.pages});
-        asked = asked && finder.find(resident.back(), &dirty);
-    }
-    if (!asked) {
-        const SmapsEntry* entry = smaps_.entryFor(mapping);
-        const std::uint64_t count = entry == nullptr ? 0 : entry->dirty / basePage;
-        dirty = firstPages(resident, count);
-        usedEstimates_ |= count != 0 && count < pages.resident; // how many, but not which
-    }
-    std::vector<PageWords> words;
-    std::size_t at = 0;
-    for (PageRange range : resident) {
-        for (; at < dirty.size() && dirty[at].first < range.end; ++at) {
-            if (range.first < dirty[at].first) {
-                words.push_back(wordsOf({range.first, dirty[at].first}, base, cleanFilePage));
-            }
-            words.push_back(wordsOf(dirty[at], base, dirtyFilePage));
-            pages.dirty += dirty[at].pages();
-            range.first = dirty[at].end;
-        }
-        if (range.first < range.end) {
-            words.push_back(wordsOf(range, base, cleanFilePage));
-        }
-    }
-    pages.words = std::move(words);
-}
-
-/// The pages of the object in the mapped range, whoever brought them there.
-PieceBuilder::ObjectPages PieceBuilder::seenObjectPages(std::size_t index) {
-    const Mapping& mapping = mappings_[index];
-    const BackingObject& backing = backings_[index];
-    if (backing.backing == Backing::sharedMemory || backing.backing == Backing::file) {
-        const Descriptor file = openForPageStates(folder_, mapping);
-        const std::optional<CachedPages> inside = cachedPages(file, mapping.fileOffset, mapping.size());
-        const std::optional<CachedPages> below = cachedPages(file, 0, mapping.fileOffset);
-        if (inside && below) {
-            ObjectPages pages;
-            pages.resident = inside->cached;
-            if (backing.backing == Backing::file) {
-                pages.offset = mapping.fileOffset;
-                pages.dirty = inside->dirty;
-            } else {
-                // Whoever maps the range finds the same pages: numbered through the object, they merge
-                // exactly.
-                pages.offset = (below->cached + (facts_.swapInUse ? below->evicted : 0)) * basePage;
-                pages.dirty = inside->cached;
-                pages.swapped = facts_.swapInUse ? inside->evicted : 0;
-                pages.restIsApart = true;
-            }
-            return pages;
-        }
-        usedEstimates_ = true;
-    }
-    return chargedObjectPages(index);
 }
 
 Piece& PieceBuilder::addPiece(std::size_t index, std::uint64_t length) {
@@ -254,7 +57,7 @@ void PieceBuilder::addRest(std::size_t index, std::uint64_t length) {
     }
 }
 
-void PieceBuilder::addObjectPiece(std::size_t index, ObjectPages pages, std::uint64_t length) {
+void PieceBuilder::addObjectPiece(std::size_t index, const ObjectPages& pages, std::uint64_t length) {
     if (length == 0) {
         return;
     }
@@ -267,7 +70,7 @@ void PieceBuilder::addObjectPiece(std::size_t index, ObjectPages pages, std::uin
     if (piece.resident + piece.swapped == 0) {
         return;
     }
-    piece.objectId = objectIdOfFile(backings_[index]);
+    piece.objectId = pages.id;
     piece.shareMode = mappings_[index].shared ? SM_SHARED : SM_COW;
     const bool uniform = pages.words.size() == 1 && pages.words[0].pages == length;
     if (!uniform) {
@@ -330,20 +133,21 @@ void PieceBuilder::build(std::size_t index) {
     } else if (backing.backing == Backing::anonymous) {
         addOwnPiece(index, states, restIsApart ? states.own() : mapping.pages());
     } else {
-        ObjectPages object = facts_.objectView ? seenObjectPages(index) : chargedObjectPages(index);
-        const std::uint64_t room = mapping.pages() - states.own();
-        const bool packed = restIsApart || object.restIsApart;
-        // The object's piece takes what is untouched, and without one the task's own.
-        const std::uint64_t objectLength = packed ? std::min(object.held(), room)
-                                           : states.own() != 0 && object.held() == 0 ? 0
-                                                                                     : room;
-        if (packed && restIsApart) {
-            pack(object.words);
-        } else if (states.own() != 0) {
-            closeGaps(states_.runsOf(states), object.words);
+        DividedObject object = facts_.objectView ? objects_.seen(index) : objects_.charged(index);
+        if (restIsApart || states.own() != 0) { // the task's own pages stand between them
+            pack(object.others.words);
+            pack(object.marked.words);
         }
-        addObjectPiece(index, std::move(object), objectLength);
-        addOwnPiece(index, states, packed || objectLength != 0 ? states.own() : mapping.pages());
+        const std::uint64_t room = mapping.pages() - states.own();
+        const std::uint64_t heldOfOthers = std::min(object.others.held(), room);
+        const std::uint64_t marked =
+            object.marked.held() == 0 ? 0 : std::min(object.markedRoom, room - heldOfOthers);
+        // The object's piece takes what is untouched, and without one the task's own.
+        const bool packed = restIsApart || object.restIsApart;
+        const std::uint64_t others = packed || heldOfOthers == 0 ? heldOfOthers : room - marked;
+        addObjectPiece(index, object.others, others);
+        addObjectPiece(index, object.marked, marked);
+        addOwnPiece(index, states, packed || others != 0 ? states.own() : mapping.pages() - marked);
     }
     if (facts_.asksLazyFree && states.anonymous != 0) {
         markLazilyFreed(index, pieces_.back());

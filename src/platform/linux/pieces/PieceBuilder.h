@@ -8,8 +8,7 @@
 
 #include "platform/linux/families/FamilyScan.h"
 #include "platform/linux/objects/Backing.h"
-#include "platform/linux/objects/MapFiles.h"
-#include "platform/linux/pieces/CountedPages.h"
+#include "platform/linux/pieces/ObjectCounter.h"
 #include "platform/linux/pieces/Piece.h"
 #include "platform/linux/walk/PageStates.h"
 #include "platform/linux/walk/SmapsOfProcess.h"
@@ -40,18 +39,11 @@ class PieceBuilder {
 
     std::vector<Piece> takePieces() { return std::move(pieces_); }
     std::vector<PageWords> takeWords() { return std::move(words_); }
-    /// Whether a figure had to be taken from a poorer source because rights or the kernel did not allow
-    /// better.
-    bool usedEstimates() const { return usedEstimates_; }
+    /// As ObjectCounter says.
+    bool usedEstimates() const { return objects_.usedEstimates(); }
 
   private:
-    struct ObjectPages; // the pages of the mapped object that a mapping counts
-
-    ObjectPages chargedObjectPages(std::size_t index);
-    ObjectPages seenObjectPages(std::size_t index);
-    void markSwapped(std::size_t index, const Descriptor& file, ObjectPages& pages);
-    void markDirty(std::size_t index, ObjectPages& pages);
-    void addObjectPiece(std::size_t index, ObjectPages pages, std::uint64_t length);
+    void addObjectPiece(std::size_t index, const ObjectPages& pages, std::uint64_t length);
     void addOwnPiece(std::size_t index, const MappingPages& own, std::uint64_t length);
     void markLazilyFreed(std::size_t index, Piece& own);
     std::span<const SharedPart> partsOf(std::size_t index);
@@ -62,15 +54,13 @@ class PieceBuilder {
     std::span<const Mapping> mappings_;
     const PageStates& states_;
     std::span<const SharedPart> parts_; // not built yet
-    const std::string& folder_;
     SmapsOfProcess& smaps_;
     std::vector<BackingObject> backings_;
     std::vector<std::uint32_t> tags_; // by mapping
-    CountedPages counted_;
+    ObjectCounter objects_;
     std::vector<Piece> pieces_;
     std::vector<PageWords> words_;
     std::uint64_t nextStart_ = 0; // of the next piece in the mapping that is being built
-    bool usedEstimates_ = false;
 };
 
 } // namespace tally::platform
