@@ -122,7 +122,8 @@ TEST(DecodeStatus, SumsWhatIsThereAndKnowsAProcessThatHasEnded) {
 
 TEST(MachineState, TellsLazilyFreedMemoryFromTheListsAndSwapFromTheTotals) {
     const std::string head = "nr_inactive_anon 7\nnr_inactive_file 1000000\nnr_active_file 500\n";
-    EXPECT_EQ(decodeLazyFree(head + "nr_file_pages 700\nnr_shmem 150\nnr_swapcached 50\n"), 1000000U * 4096);
+    EXPECT_EQ(decodeLazyFree(head + "nr_file_pages 700\nnr_shmem 150\nnr_swapcached 50\n"),
+              1000000U * basePage);
     EXPECT_EQ(decodeLazyFree(head + "nr_file_pages 2000000\nnr_shmem 150\nnr_swapcached 50\n"), 0U);
     EXPECT_EQ(decodeLazyFree(""), 0U);
     EXPECT_TRUE(decodeSwapInUse("MemTotal: 9 kB\nSwapTotal:  100 kB\nSwapFree:  96 kB\n"));

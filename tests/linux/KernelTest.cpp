@@ -5,6 +5,7 @@
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/kernel/KernelTexts.h"
 #include "platform/mach_kernel_memory.h"
+#include "platform/mach_vm.h"
 
 #include <gtest/gtest.h>
 
@@ -25,33 +26,37 @@ TEST(KernelTexts, TakeWhatTheyKnowAndPassOverTheRest) {
     EXPECT_EQ(meminfo["HugePages_Free"], 3U) << "a count";
     EXPECT_EQ(meminfo["Bad"] + meminfo["Absent"], 0U);
 
+    constexpr std::uint64_t page = 16384; // of another machine
     const auto caches = decodeSlabinfo("slabinfo - version: 2.1\n"
                                        "# name <active_objs> : tunables <limit> : slabdata <active_slabs>\n"
                                        "dentry 7 21 192 21 1 : tunables 0 0 0 : slabdata 1 2 0\n"
                                        "two words 7 21 192 21 1 : tunables 0 0 0 : slabdata 1 2 0\n"
                                        "short 7 21 : tunables 0 0 0 : slabdata 1 2 0\n"
-                                       "cut 7 21 192 21 1 : tunables 0 0 0 : slabdata 1");
+                                       "cut 7 21 192 21 1 : tunables 0 0 0 : slabdata 1",
+                                       page);
     ASSERT_EQ(caches.size(), 1U);
     EXPECT_EQ(caches[0].name, "dentry");
     EXPECT_EQ(caches[0].elementsInUse * caches[0].elementSize, 7U * 192);
-    EXPECT_EQ(caches[0].size, 2 * 4096U);
+    EXPECT_EQ(caches[0].size, 2 * page);
 
-    const Sizes callers{{"kernel_clone", 6 * 4096}, {"f [mod]", 4096}, {"unknown caller", 8192}};
+    const Sizes callers{{"kernel_clone", 6 * page}, {"f [mod]", page}, {"unknown caller", 2 * page}};
     EXPECT_EQ(decodeVmallocinfo("0x1-0x2   20480 kernel_clone+0x94/0x3e0 pages=4 vmalloc N0=4\n"
                                 "0x2-0x3   12288 kernel_clone+0x10/0x3e0 pages=2 vmalloc\n"
                                 "0x3-0x4    8192 f+0x1/0x2 [mod] pages=1 vmalloc N0=1\n"
                                 "0x4-0x5   12288 pages=2 vmalloc\n"
                                 "0x5-0x6    8192 unpurged vm_area\n"
                                 "0x6-0x7    8192 ioremap_it+0x1/0x2 phys=0x1000 ioremap\n"
-                                "0x7-0x8"),
+                                "0x7-0x8",
+                                page),
               callers);
 
     const ZoneSums zones =
         decodeZoneinfo("Node 0, zone  Normal\n  pages free  9\n        present  5\n"
                        "      nr_zspages   2\n  pagesets\n    cpu: 0\n              count:    3\n"
-                       "              high:  9\n    cpu: 1\n              count:    4\n");
-    EXPECT_TRUE(zones.present == 5 * 4096 && zones.onProcessorLists == 7 * 4096 &&
-                zones.compressed == 2 * 4096);
+                       "              high:  9\n    cpu: 1\n              count:    4\n",
+                       page);
+    EXPECT_TRUE(zones.present == 5 * page && zones.onProcessorLists == 7 * page &&
+                zones.compressed == 2 * page);
 
     const auto modules =
         decodeModules("ext4 8192 2 jbd2, Live 0x0000000000000000\nbroken\n\nnet 4096 0 - Live 0x0\n");
@@ -193,7 +198,7 @@ TEST(Kernel, OfThisMachineCloses) {
         other += site.name == "other kernel memory" ? site.size : 0;
     }
     const auto read = [](const char* path) { return readSystemFile(path).value_or(""); };
-    const ZoneSums zones = decodeZoneinfo(read("/proc/zoneinfo"));
+    const ZoneSums zones = decodeZoneinfo(read("/proc/zoneinfo"), vm_kernel_page_size());
     const Meminfo now(read("/proc/meminfo"));
     const double total = static_cast<double>(now["MemTotal"]);
     const std::uint64_t users = now["AnonPages"] + now["Cached"] + now["Buffers"] + now["SwapCached"] +

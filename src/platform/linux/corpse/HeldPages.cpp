@@ -23,8 +23,8 @@ void HeldPages::append(std::uint64_t address, std::span<const std::uint64_t> ent
 }
 
 void HeldPages::distrustHugePages() {
-    constexpr std::uint64_t parts = 512;
-    constexpr std::uint64_t hugePage = parts * basePage;
+    const std::uint64_t parts = basePage / sizeof(std::uint64_t); // as many as a page of entries maps
+    const std::uint64_t hugePage = parts * basePage;
     for (const Run& run : runs_) {
         for (std::uint64_t at = (run.start + hugePage - 1) / hugePage * hugePage; at + hugePage <= run.end;
              at += hugePage) {

@@ -7,7 +7,7 @@ namespace tally::platform {
 namespace {
 
 constexpr std::uint64_t nowhere = ~std::uint64_t{0};
-constexpr std::uint64_t pagesAhead = (16 << 20) / basePage;
+const std::uint64_t pagesAhead = (16 << 20) / basePage;
 
 } // namespace
 

@@ -40,8 +40,8 @@ struct AddressSpace {
     bool isEstimated = false;      // sharing was told by addresses only, without frame numbers
 };
 
-inline constexpr std::uint64_t windowBytes = 2 << 20; // as large as a huge page, and aligned like one
-inline constexpr std::size_t windowPages = windowBytes / basePage;
+inline constexpr std::size_t windowPages = 512; // a huge page or a part of one, and aligned like that
+inline const std::uint64_t windowBytes = windowPages * basePage;
 
 /// The pages that one member has of its own in one window.
 struct WindowRow {

@@ -9,7 +9,7 @@ namespace tally::platform {
 namespace {
 
 constexpr std::uint64_t nowhere = ~std::uint64_t{0};
-constexpr std::uint64_t stretchBytes = 8 * windowBytes;
+const std::uint64_t stretchBytes = 8 * windowBytes;
 
 } // namespace
 

@@ -12,7 +12,7 @@ namespace tally::platform {
 namespace {
 
 constexpr std::size_t mostKeptSets = 16;
-constexpr std::uint64_t worthKeeping = (64 << 10) / basePage; // pages
+const std::uint64_t worthKeeping = (64 << 10) / basePage; // pages
 constexpr std::size_t mostSetsOfImage = 64;
 
 /// The clusters of which every set is kept: images whose copies make no more sets than a reader can make use

@@ -24,7 +24,7 @@ std::uint64_t pageAbove(std::uint64_t address) { return pageBelow(address + base
 /// Whether a segment can be mapped at all: no end beyond the last page, and address and offset alike within
 /// a page.
 bool isMappable(const LoadSegment& load) {
-    constexpr std::uint64_t most = std::numeric_limits<std::uint64_t>::max() - 2 * basePage;
+    const std::uint64_t most = std::numeric_limits<std::uint64_t>::max() - 2 * basePage;
     return load.memorySize <= most && load.address <= most - load.memorySize &&
            load.fileOffset <= most - load.fileSize && load.fileSize <= load.memorySize &&
            (load.fileSize == 0 || (load.address - load.fileOffset) % basePage == 0);

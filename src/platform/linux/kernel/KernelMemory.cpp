@@ -8,6 +8,7 @@
 
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/kernel/KernelTexts.h"
+#include "platform/linux/walk/Mapping.h"
 #include "platform/linux/walk/ProcessMemoryFiles.h"
 #include "platform/mach_kernel_memory.h"
 
@@ -117,7 +118,7 @@ class KernelRecord {
     }
 
     const Meminfo& meminfo_;
-    ZoneSums zones_ = decodeZoneinfo(readSystemFile(systemPath("/proc/zoneinfo")).value_or(""));
+    ZoneSums zones_ = decodeZoneinfo(readSystemFile(systemPath("/proc/zoneinfo")).value_or(""), basePage);
     mach_memory_record record_;
     std::uint64_t accounted_ = 0; // bytes of zones and wired sites
     std::uint64_t held_ = 0;      // bytes that the kernel holds
@@ -156,7 +157,7 @@ std::optional<std::string> KernelRecord::read(const std::string& path) {
 
 void KernelRecord::addZones() {
     std::uint64_t inCaches = 0;
-    for (SlabCache& cache : decodeSlabinfo(read("/proc/slabinfo").value_or(""))) {
+    for (SlabCache& cache : decodeSlabinfo(read("/proc/slabinfo").value_or(""), basePage)) {
         if (cache.size == 0) {
             continue; // most are never used
         }
@@ -176,8 +177,8 @@ void KernelRecord::addZones() {
 
 void KernelRecord::addVirtualMemory() {
     const std::optional<std::string> text = read("/proc/vmallocinfo");
-    VmallocRows rows =
-        text ? decodeVmallocinfo(*text) : VmallocRows{{std::string(allOfVmalloc), meminfo_["VmallocUsed"]}};
+    VmallocRows rows = text ? decodeVmallocinfo(*text, basePage)
+                            : VmallocRows{{std::string(allOfVmalloc), meminfo_["VmallocUsed"]}};
     // Stacks are virtual memory too; where none of it is theirs they are apart.
     const std::uint64_t stacks = takeOff(rows, allocatesStacks, meminfo_["KernelStack"]);
     addWired(isTag, stackTag, stacks != 0 ? stacks : meminfo_["KernelStack"]);

@@ -1,7 +1,6 @@
 #include "platform/linux/kernel/KernelTexts.h"
 
 #include "platform/linux/io/TextScan.h"
-#include "platform/linux/walk/Mapping.h"
 
 #include <array>
 #include <optional>
@@ -50,7 +49,7 @@ std::uint64_t Meminfo::operator[](std::string_view key) const {
     return row == rows_.end() ? 0 : row->second;
 }
 
-std::vector<SlabCache> decodeSlabinfo(std::string_view text) {
+std::vector<SlabCache> decodeSlabinfo(std::string_view text, std::uint64_t pageSize) {
     std::vector<SlabCache> caches;
     while (!text.empty()) {
         // name, elements in use and in all, size of one, elements and pages per slab : ... : slabdata, slabs
@@ -71,13 +70,13 @@ std::vector<SlabCache> decodeSlabinfo(std::string_view text) {
         }
         cache.elementsInUse = numbers[0];
         cache.elementSize = numbers[2];
-        cache.size = numbers[4] * slabs * basePage;
+        cache.size = numbers[4] * slabs * pageSize;
         caches.push_back(std::move(cache));
     }
     return caches;
 }
 
-VmallocRows decodeVmallocinfo(std::string_view text) {
+VmallocRows decodeVmallocinfo(std::string_view text, std::uint64_t pageSize) {
     constexpr std::string_view pagesKey = " pages=";
     VmallocRows rows;
     while (!text.empty()) {
@@ -93,19 +92,19 @@ VmallocRows decodeVmallocinfo(std::string_view text) {
         const std::string_view caller = takeWord(line);
         if (takeNumber(count, &pages) && !caller.empty()) {
             const bool isTold = !caller.starts_with("pages=");
-            rows[isTold ? symbolOf(caller, line) : "unknown caller"] += pages * basePage;
+            rows[isTold ? symbolOf(caller, line) : "unknown caller"] += pages * pageSize;
         }
     }
     return rows;
 }
 
-ZoneSums decodeZoneinfo(std::string_view text) {
+ZoneSums decodeZoneinfo(std::string_view text, std::uint64_t pageSize) {
     ZoneSums sums;
     while (!text.empty()) {
         const std::string_view line = takeLine(text);
-        sums.onProcessorLists += numberAfter(line, "count:").value_or(0) * basePage;
-        sums.present += numberAfter(line, "present ").value_or(0) * basePage;
-        sums.compressed += numberAfter(line, "nr_zspages ").value_or(0) * basePage;
+        sums.onProcessorLists += numberAfter(line, "count:").value_or(0) * pageSize;
+        sums.present += numberAfter(line, "present ").value_or(0) * pageSize;
+        sums.compressed += numberAfter(line, "nr_zspages ").value_or(0) * pageSize;
     }
     return sums;
 }

@@ -25,6 +25,8 @@ class Meminfo {
     std::map<std::string, std::uint64_t, std::less<>> rows_;
 };
 
+// Texts that count in pages are told the machine's page size, bytes.
+
 /// One cache of /proc/slabinfo.
 struct SlabCache {
     std::string name;
@@ -32,12 +34,12 @@ struct SlabCache {
     std::uint64_t elementSize = 0;
     std::uint64_t size = 0; // of all its slabs
 };
-std::vector<SlabCache> decodeSlabinfo(std::string_view text);
+std::vector<SlabCache> decodeSlabinfo(std::string_view text, std::uint64_t pageSize);
 
 /// What /proc/vmallocinfo says that each caller holds, by its symbol, "name" or "name [module]". Areas that
 /// map what is not theirs (devices, pages that others count) own nothing.
 using VmallocRows = std::map<std::string, std::uint64_t, std::less<>>;
-VmallocRows decodeVmallocinfo(std::string_view text);
+VmallocRows decodeVmallocinfo(std::string_view text, std::uint64_t pageSize);
 
 /// Sums over the zones of /proc/zoneinfo.
 struct ZoneSums {
@@ -45,7 +47,7 @@ struct ZoneSums {
     std::uint64_t present = 0;          // physical memory, with what was reserved at boot
     std::uint64_t compressed = 0;       // what compressed pages take up
 };
-ZoneSums decodeZoneinfo(std::string_view text);
+ZoneSums decodeZoneinfo(std::string_view text, std::uint64_t pageSize);
 
 struct LoadedModule {
     std::string name;

@@ -2,12 +2,15 @@
 
 #pragma once
 
+#include <unistd.h>
+
 #include <cstdint>
 #include <string>
 
 namespace tally::platform {
 
-inline constexpr std::uint64_t basePage = 4096; // bytes; page states and counts are in these
+/// The machine's page, bytes: page states and counts are in these.
+inline const std::uint64_t basePage = static_cast<std::uint64_t>(sysconf(_SC_PAGESIZE));
 
 /// [start, end) of addresses.
 struct AddressRange {

@@ -22,7 +22,7 @@ inline constexpr std::uint64_t PageIsFile = 4;
 inline constexpr std::uint64_t PageIsPresent = 8;
 inline constexpr std::uint64_t PageIsSwapped = 16;
 inline constexpr std::uint64_t PageIsZero = 32; // the kernel's zero page: no memory of its own
-inline constexpr std::uint64_t PageIsHuge = 64; // mapped as one page of 2 MiB
+inline constexpr std::uint64_t PageIsHuge = 64; // mapped as one page, by an entry one level up
 inline constexpr std::uint64_t PageIsGuard = 256;
 
 /// Which runs one call gave, and how far it came.
@@ -36,7 +36,7 @@ struct PageScanStep {
 using PageScanRoom = std::array<PageRegion, 512>;
 
 /// Pages that one call looks at most: the target's own calls that change its address space wait for it.
-inline constexpr std::uint64_t mostPagesOfCall = (64 << 20) / basePage;
+inline const std::uint64_t mostPagesOfCall = (64 << 20) / basePage;
 
 /// Scans `range` for present and swapped pages, at most `mostPages` of them. Lets others in that wait for the
 /// address space after as many as a call may look at. What is absent costs next to nothing, but for page

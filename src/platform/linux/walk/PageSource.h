@@ -29,7 +29,7 @@ struct FoundRun {
     std::uint64_t start = 0; // addresses
     std::uint64_t end = 0;
     PageKind kind = PageKind::object;
-    bool isHuge = false; // mapped as whole pages of 2 MiB
+    bool isHuge = false; // mapped as whole huge pages
 };
 
 using PageRunSink = std::function<void(const FoundRun&)>;
