@@ -123,7 +123,8 @@ TEST(Machine, WhatSeveralTouchOfAnObjectCountsOnce) {
     const SwapFile swap(64); // without it the same is seen of what is in memory
     const TemporaryFolder folder;
     for (const char* seed : {"1", "2"}) {
-        const Outcome outcome = run({"/usr/bin/python3", UNIONS, TALLY_PROGRAM, folder.path(), seed});
+        const Outcome outcome =
+            run({"/usr/bin/python3", UNIONS, TALLY_PROGRAM, PUPPET_PROGRAM, folder.path(), seed});
         EXPECT_EQ(outcome.status, 0) << outcome.errors;
         EXPECT_NE(outcome.output.find("memory:"), std::string::npos) << outcome.output;
     }

@@ -1,7 +1,7 @@
 #!/usr/bin/env python3
 """What several processes map and touch at random, against the union of their pages.
 
-  unions.py TALLY FOLDER SEED
+  unions.py TALLY PUPPET FOLDER SEED
 
 Each kind of object is mapped in windows that overlap, some twice, some for reading only; pages are read, written and, with
 swap in use, swapped out. The summary must hold every page that somebody's page tables show once, in the state that it is in,
@@ -67,7 +67,7 @@ class Member:
 
 
 def summary_of(tally, members, output, kind, *options):
-    subprocess.run([tally, "-j", output, *options] + [word for member in members for word in ("--pid", str(member.pid))], check=True,
+    subprocess.run([*tally, "-j", output, *options] + [word for member in members for word in ("--pid", str(member.pid))], check=True,
                    stdout=subprocess.DEVNULL)
     with open(output) as document:
         sizes = json.load(document)["summary"].get(CATEGORIES[kind], {})
@@ -83,8 +83,8 @@ def cachestat(file, first, pages):
     return counts[0], min(counts[1] + counts[2], counts[0]), counts[3]
 
 
-def compare(tally, folder, choice, kind):
-    """@return for both views what is expected, and what the summary says more with the object mapped than without; nothing when
+def compare(tally, folder, choice, kind, old):
+    """@param old the command on a kernel that cannot be asked for the page cache. @return for both views what is expected, and what the summary says more with the object mapped than without; nothing when
     the file was written back meanwhile, or its file system does not tell."""
     name = os.path.join(folder, "object")
     file = os.memfd_create("object") if kind == "memory" else os.open(name, os.O_RDWR | os.O_CREAT | os.O_TRUNC, 0o600)
@@ -125,7 +125,12 @@ def compare(tally, folder, choice, kind):
         if kind == "file" and cachestat(file, 0, PAGES)[1] != len(written):
             return []
         told = [[now - then for now, then in zip(*pair)] for pair in zip(after, before)]
-        return list(zip(expected, told))
+        outcomes = list(zip(expected, told))
+        if kind == "memory":
+            sums = [sum(summary_of(old, members, name + ".json", kind, *view)) for view in views]
+            told = [([sum(each)], [total]) for each, total in zip(expected, sums)]
+            outcomes += told[1:] if expected[0][1] else told  # which pages of a mapping are swapped out is not known then
+        return outcomes
     finally:
         for member in members:
             member.end()
@@ -133,10 +138,11 @@ def compare(tally, folder, choice, kind):
 
 
 def main():
-    tally, folder, seed = sys.argv[1:]
+    tally, puppet, folder, seed = sys.argv[1:]
+    old = [puppet, "refuse", "451", tally]
     choice, compared = random.Random(int(seed)), []
     for kind in ("file", "memory") * 3:
-        for expected, told in compare(tally, folder, choice, kind):
+        for expected, told in compare([tally], folder, choice, kind, old):
             if list(expected) != told:
                 sys.exit(f"{kind}, seed {seed}: resident dirty, swapped and clean pages are {expected}, the summary says {told}")
             compared.append(f"{kind}: {told}")

@@ -22,20 +22,6 @@ namespace tally::platform {
 
 namespace {
 
-// As the kernel lays them out (include/uapi/linux/mman.h of 6.5); the installed headers are older.
-struct cachestat_range {
-    std::uint64_t off;
-    std::uint64_t len;
-};
-struct cachestat_counts {
-    std::uint64_t nr_cache;
-    std::uint64_t nr_dirty;
-    std::uint64_t nr_writeback;
-    std::uint64_t nr_evicted;
-    std::uint64_t nr_recently_evicted;
-};
-constexpr long cachestatCall = 451;
-
 /// @param fileSystem of the file, as statfs gives it. Where no disk is behind a mount, the list of mappings
 /// can name another device than the file itself does, as with subvolumes and, on older kernels, overlays.
 bool isFileOf(const Mapping& mapping, std::uint32_t deviceMajor, std::uint32_t deviceMinor,
@@ -150,18 +136,6 @@ Descriptor openForPageStates(const std::string& folder, const Mapping& mapping) 
         return Descriptor();
     }
     return openMappedFile(folder, mapping);
-}
-
-std::optional<CachedPages> cachedPages(const Descriptor& file, std::uint64_t offset, std::uint64_t length) {
-    if (length == 0) {
-        return CachedPages(); // to the kernel a length of 0 is everything to the end
-    }
-    cachestat_range range{offset, length};
-    cachestat_counts counts{};
-    if (!file.isOpen() || syscall(cachestatCall, file.number(), &range, &counts, 0) != 0) {
-        return std::nullopt;
-    }
-    return CachedPages{counts.nr_cache, counts.nr_dirty + counts.nr_writeback, counts.nr_evicted};
 }
 
 } // namespace tally::platform

@@ -1,4 +1,4 @@
-// The files behind mappings, opened, and what the page cache holds of them.
+// The files behind mappings, opened.
 //
 // A target's file is only ever asked for the state of its pages: its bytes are not read, it is not mapped,
 // and nothing but regular files is opened.
@@ -36,16 +36,5 @@ Descriptor openForPageStates(const std::string& folder, const Mapping& mapping);
 /// What is known of the file behind `mapping` by a question that is given up when it takes too long; absent
 /// with errno.
 std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Mapping& mapping);
-
-/// Pages of a byte range of a file in the page cache.
-struct CachedPages {
-    std::uint64_t cached = 0;
-    std::uint64_t dirty = 0;   // or being written back
-    std::uint64_t evicted = 0; // for shared memory: swapped out
-};
-
-/// Asks for [offset, offset + length); a length of 0 is 0 pages. Absent on failure: before 6.5 the kernel has
-/// no such call, and it refuses hugetlb files.
-std::optional<CachedPages> cachedPages(const Descriptor& file, std::uint64_t offset, std::uint64_t length);
 
 } // namespace tally::platform

@@ -7,6 +7,7 @@
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/objects/MapFiles.h"
 #include "platform/linux/objects/ObjectId.h"
+#include "platform/linux/objects/PageCache.h"
 #include "platform/linux/owned/DescriptorInfo.h"
 
 #include <dirent.h>
@@ -82,7 +83,11 @@ std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::stri
     if (isHuge) {
         record.wiredSize = record.residentSize;
     } else if (record.residentSize != 0 && machineState().swapInUse) {
-        const auto pages = cachedPages(openRegularFile(descriptor), 0, record.virtualSize);
+        const auto pages = cachedOrHeldPages(openRegularFile(descriptor), 0, record.virtualSize);
+        if (!pages) {
+            noteRefusal("Files in memory that it holds could not be asked", errno,
+                        "what of them is swapped out counts as in memory");
+        }
         record.compressedSize = std::min(pages ? pages->evicted * basePage : 0, record.residentSize);
         record.residentSize -= record.compressedSize;
     }

@@ -2,7 +2,7 @@
 
 #pragma once
 
-#include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/objects/PageCache.h"
 #include "platform/linux/pieces/CountedPages.h"
 
 #include <cstddef>

@@ -152,7 +152,9 @@ MarkedPages ObjectCounter::estimatedMarks(std::size_t index, std::span<const Pag
     if (isOnlyCopy(backings_[index])) {
         const std::uint64_t swapped = entry->swapped / basePage;
         const std::uint64_t own = std::min(swapped, states_.mappings[index].swapped);
-        return MarkedPages(firstPages(absentPages(index), swapped - own));
+        const std::vector<PageRange> absent = absentPages(index);
+        usedEstimates_ |= swapped != own && swapped - own < pagesIn(absent);
+        return MarkedPages(firstPages(absent, swapped - own));
     }
     const std::vector<PageRange> dirty = firstPages(resident, entry->dirty / basePage);
     usedEstimates_ |= !dirty.empty() && pagesIn(dirty) < pagesIn(resident);
@@ -197,8 +199,8 @@ DividedObject ObjectCounter::seen(std::size_t index) {
     }
     const Mapping& mapping = mappings_[index];
     const Descriptor file = openForPageStates(folder_, mapping);
-    const std::optional<CachedPages> inside = cachedPages(file, mapping.fileOffset, mapping.size());
-    const std::optional<CachedPages> below = cachedPages(file, 0, mapping.fileOffset);
+    const std::optional<CachedPages> inside = cachedOrHeldPages(file, mapping.fileOffset, mapping.size());
+    const std::optional<CachedPages> below = cachedOrHeldPages(file, 0, mapping.fileOffset);
     if (!inside || !below) {
         usedEstimates_ = true;
         return charged(index);
