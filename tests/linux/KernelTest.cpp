@@ -117,6 +117,7 @@ TEST_F(KernelTree, NamesEachByteOnceAndCloses) {
           "0x1-0x2 1 htab_map_alloc+0x9/0x3 pages=75 vmalloc\n");
     write("/proc/modules", "ext4 81920 1 - Live 0x0\n");
     write("/proc/iomem", "1000-10ff : Kernel code\n");
+    write("/proc/7/status", "VmPTE: 176 kB\n");
     mach_memory_record record;
     ASSERT_EQ(mach_memory_info(&record), KERN_SUCCESS);
     EXPECT_EQ(record.zone_names, (std::vector<std::string>{"a", "b"}));
@@ -125,7 +126,9 @@ TEST_F(KernelTree, NamesEachByteOnceAndCloses) {
     const auto [dirty, clean] = sitesOf(record);
     const std::string module = "1:" + std::to_string(copyLoadedModuleIdentifiers().begin()->first);
     // Held: 10000 - 1000 free - 60 on lists - 5110 on the reclaim lists - 400 of huge pages in use = 3430.
-    // Named: 800 of slabs, 500 of virtual memory, 8, 12, 32, 100; 200 of page tables are the processes'.
+    // Named: 800 of slabs, 500 of virtual memory, 8, 12, 32, 100; of 200 of page tables the process has 176
+    // and the top-level one.
+    const std::uint64_t tables = 176 + vm_kernel_page_size() / 1024;
     EXPECT_EQ(dirty, (Sizes{{"0:13", 100},
                             {"0:8", 64},
                             {"kernel_clone", 16},
@@ -136,8 +139,9 @@ TEST_F(KernelTree, NamesEachByteOnceAndCloses) {
                             {"0:10", 8},
                             {"0:15", 12},
                             {"huge page pool (unused)", 100},
+                            {"other page tables", 200 - tables},
                             {"other kernel memory", 3430 - 800 - 500 - 8 - 12 - 32 - 100 - 200}}));
-    EXPECT_EQ(clean, (Sizes{{"0:11", 200}, {"0:24", 40}, {"0:22", 1800}, {"kernel code", 0}}));
+    EXPECT_EQ(clean, (Sizes{{"0:11", tables}, {"0:24", 40}, {"0:22", 1800}, {"kernel code", 0}}));
     std::map<std::uint64_t, std::uint64_t> counters;
     for (const mach_memory_site& site : record.sites) {
         if (site.flags == 3) {
@@ -152,6 +156,7 @@ TEST_F(KernelTree, MakesDoWithWhatAnOldOrUnwillingKernelTells) {
     write("/proc/meminfo", meminfo);
     write("/proc/iomem", "0-0 : Kernel code\n");
     write("/proc/modules", "huge 8192000 1 - Live 0x0\n"); // more than any row holds
+    write("/proc/7/status", "VmPTE: 300 kB\n");            // upper levels are not in PageTables
     mach_memory_record record;
     ASSERT_EQ(mach_memory_info(&record), KERN_SUCCESS);
     auto [dirty, clean] = sitesOf(record);
@@ -159,6 +164,9 @@ TEST_F(KernelTree, MakesDoWithWhatAnOldOrUnwillingKernelTells) {
     EXPECT_EQ(dirty["0:12"], 800U) << "all slabs";
     EXPECT_EQ(dirty["vmalloc"], 500U - 64);
     EXPECT_EQ(dirty["0:8"], 64U);
+    EXPECT_FALSE(dirty.contains("other page tables"));
+    EXPECT_EQ(dirty["other kernel memory"],
+              10000 - 1000 - 5110 - 400 - (800 + 500 + 8 + 32 + 100) - 300 - vm_kernel_page_size() / 1024);
     EXPECT_EQ(clean["1:" + std::to_string(copyLoadedModuleIdentifiers().begin()->first)], 8000U);
     EXPECT_EQ(record.notices,
               std::vector<std::string>{

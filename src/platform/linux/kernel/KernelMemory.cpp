@@ -6,8 +6,10 @@
 // of processes, cached files) or is no part of MemTotal (the kernel's image) is not marked as wired, and so
 // is shown as clean only.
 
+#include "platform/bsd_process.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/kernel/KernelTexts.h"
+#include "platform/linux/processes/Ledgers.h"
 #include "platform/linux/walk/Mapping.h"
 #include "platform/linux/walk/ProcessMemoryFiles.h"
 #include "platform/mach_kernel_memory.h"
@@ -19,6 +21,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 namespace tally::platform {
 
@@ -84,6 +87,18 @@ std::uint64_t takeOff(VmallocRows& rows, bool (*matches)(std::string_view), std:
 /// A load tag for a module: the kernel gives it no number.
 std::uint64_t loadTag(const std::string& name) { return std::hash<std::string>()(name); }
 
+/// Bytes of page tables that processes are charged for.
+std::uint64_t chargedPageTables() {
+    std::vector<std::int32_t> pids(static_cast<std::size_t>(std::max(proc_listallpids({}), 0)));
+    pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
+    std::uint64_t sum = 0;
+    for (const std::int32_t pid : pids) {
+        const std::optional<Charges> charges = readCharges(pid, false);
+        sum += charges ? charges->pageTable : 0;
+    }
+    return sum;
+}
+
 class KernelRecord {
   public:
     explicit KernelRecord(const Meminfo& meminfo) : meminfo_(meminfo) {}
@@ -119,6 +134,7 @@ class KernelRecord {
 
     const Meminfo& meminfo_;
     ZoneSums zones_ = decodeZoneinfo(readSystemFile(systemPath("/proc/zoneinfo")).value_or(""), basePage);
+    const std::uint64_t userPageTables_ = chargedPageTables();
     mach_memory_record record_;
     std::uint64_t accounted_ = 0; // bytes of zones and wired sites
     std::uint64_t held_ = 0;      // bytes that the kernel holds
@@ -207,16 +223,17 @@ void KernelRecord::addRowsOfMeminfo() {
     addWired(isTag, processorTag, meminfo_["Percpu"]);
     addWired(isTag, pageMapTag, meminfo_["SecPageTables"]); // of virtual machines and devices
     addWired(isTag, compressedTag, zones_.compressed);
+    // Since 6.12 the kernel's own are among them, before it not even all of the processes' are.
+    addWired(isTag, 0, difference(meminfo_["PageTables"], userPageTables_), "other page tables");
 }
 
 void KernelRecord::addRest() {
-    const std::uint64_t pageTables = meminfo_["PageTables"]; // counted by the processes
-    addWired(isTag, 0, difference(held_, accounted_ + pageTables), "other kernel memory");
+    addWired(isTag, 0, difference(held_, accounted_ + userPageTables_), "other kernel memory");
 }
 
 /// What counts elsewhere.
 void KernelRecord::addClean() {
-    add(isTag, pageTableTag, meminfo_["PageTables"]);
+    add(isTag, pageTableTag, userPageTables_);
     add(isTag | isWired, lockedTag, meminfo_["Mlocked"]);
     add(isTag, fileCacheTag, difference(meminfo_["Cached"] + meminfo_["Buffers"], meminfo_["Shmem"]));
     const std::optional<std::string> iomem = read("/proc/iomem");
