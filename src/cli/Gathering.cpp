@@ -3,13 +3,17 @@
 // What stops one process is a text of that process; only an interrupt stops the gather.
 
 #include "analysis/TLTally.h"
+#include "base/Format.h"
 #include "cli/Usage.h"
 #include "platform/gather.h"
 #include "vm/PhysTallyCollection.h"
 
 #include <algorithm>
+#include <map>
+#include <ranges>
 #include <string>
 #include <utility>
+#include <vector>
 
 namespace tally {
 
@@ -17,6 +21,24 @@ namespace {
 
 bool compareProcessesForGather(const std::shared_ptr<TLProcess>& a, const std::shared_ptr<TLProcess>& b) {
     return a->pid() > b->pid();
+}
+
+/// Leaves what this machine costs every process to the lowest pid of those that are shown, with their number.
+void mergeMachineWarnings(const TLTally::ProcessList& sorted) {
+    std::map<std::string, std::vector<TLProcess*>> processes;
+    for (const auto& process : std::views::reverse(sorted)) {
+        for (const std::string& text : process->takeMachineWarnings()) {
+            if (!process->hiddenFromDisplay()) {
+                processes[text].push_back(process.get());
+            }
+        }
+    }
+    for (const auto& [text, holders] : processes) {
+        for (std::size_t i = 0; i < holders.size() && holders.size() > 1; ++i) {
+            const std::string told = formatted("%s (so for %zu processes)", text.c_str(), holders.size());
+            holders[i]->replaceWarning(text, i == 0 ? told : "");
+        }
+    }
 }
 
 } // namespace
@@ -37,6 +59,7 @@ bool TLTally::gatherAllProcesses() {
             sorted[index]->gatherData();
         }
     });
+    mergeMachineWarnings(sorted);
     // An interrupted sample is never reported, and the process may be in an earlier one that is.
     if (interrupted && !isSample) {
         // Nobody is told what a hidden process says.

@@ -20,9 +20,13 @@ class GatherScope {
     GatherScope& operator=(const GatherScope&) = delete;
 };
 
-/// Takes what the platform noted about the figures of `task` since the last call: texts for the process's
-/// warnings, such as a figure that rights did not allow and an estimate stands in for.
-std::vector<std::string> task_take_notices(mach_port_t task);
+/// Texts for a process's warnings, such as a figure that rights did not allow and an estimate stands in for.
+struct task_notices {
+    std::vector<std::string> of_task;
+    std::vector<std::string> of_machine; // on this machine other processes have the same, for the same reason
+};
+/// Takes what the platform noted about the figures of `task` since the last call.
+task_notices task_take_notices(mach_port_t task);
 
 /// Whether `task` shares memory by descent with another process to which there is a right, so that what it is
 /// charged may stay the same while the pages behind it change. True where that cannot be told.

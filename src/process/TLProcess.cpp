@@ -5,6 +5,8 @@
 #include "process/TLUserProcess.h"
 #include "vm/PhysTallyCollection.h"
 
+#include <algorithm>
+
 namespace tally {
 
 using namespace platform;
@@ -48,6 +50,15 @@ bool TLProcess::initWithBsdInfo(const proc_bsdinfo& info) {
 bool TLProcess::breakDownPhysTally() const { return physTallyCollectionEnabled(); }
 
 std::uint64_t TLProcess::_gatherPageSize() const { return vm_kernel_page_size(); }
+
+void TLProcess::replaceWarning(const std::string& warning, const std::string& text) {
+    const auto found = std::ranges::find(warnings_, warning);
+    if (found != warnings_.end() && text.empty()) {
+        warnings_.erase(found);
+    } else if (found != warnings_.end()) {
+        *found = text;
+    }
+}
 
 void TLProcess::setMemoryRegions(RegionList regions) {
     memoryRegions_ = std::move(regions);

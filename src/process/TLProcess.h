@@ -87,6 +87,14 @@ class TLProcess : public virtual MemoryHolder {
     std::string description() const;
 
     void addWarning(std::string text) { warnings_.push_back(std::move(text)); }
+    /// Adds a warning that other processes have as well, for a reason that is not theirs.
+    void addMachineWarning(std::string text) {
+        warnings_.push_back(machineWarnings_.emplace_back(std::move(text)));
+    }
+    /// Those that were added since the last call.
+    std::vector<std::string> takeMachineWarnings() { return std::exchange(machineWarnings_, {}); }
+    /// Puts `text` in the place of a warning; an empty one takes it away.
+    void replaceWarning(const std::string& warning, const std::string& text);
     void addError(std::string text) { errors_.push_back(std::move(text)); }
     /// Adds a problem of the whole run; only after all workers have finished.
     void _addGlobalError(std::string text) { globalErrors_.push_back(std::move(text)); }
@@ -114,6 +122,7 @@ class TLProcess : public virtual MemoryHolder {
     std::shared_ptr<const TLSharedCache> sharedCache_;
     std::vector<std::string> errors_;
     std::vector<std::string> warnings_;
+    std::vector<std::string> machineWarnings_; // of these
     std::vector<std::string> globalErrors_;
     std::string name_;
     RegionList memoryRegions_;

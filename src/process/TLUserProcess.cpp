@@ -125,8 +125,12 @@ void TLUserProcess::gatherData() {
     enumerateRegions([&](const EnumeratedRegion& mapping) { return recorder.record(mapping); });
     recorder.recordUnmappedOwnedObjects();
     recordPageTables();
-    for (std::string& notice : task_take_notices(task())) {
+    task_notices notices = task_take_notices(task());
+    for (std::string& notice : notices.of_task) {
         addWarning(std::move(notice));
+    }
+    for (std::string& notice : notices.of_machine) {
+        addMachineWarning(std::move(notice));
     }
     walk.regions.shrink_to_fit();
     setMemoryRegions(std::move(walk.regions));

@@ -192,7 +192,7 @@ Gathered gather(const std::vector<int>& pids, std::uint64_t start, std::uint64_t
                 ++gathered.regions;
             }
         }
-        for (std::string& notice : task_take_notices(tasks[i].name())) {
+        for (std::string& notice : task_take_notices(tasks[i].name()).of_machine) {
             gathered.notices.insert(std::move(notice));
         }
     }

@@ -397,7 +397,7 @@ TEST_F(Contract, APortLivesAsLongAsItsReferences) {
         EXPECT_EQ(regionAt(task, 0).status, KERN_SUCCESS);
     }
     task_take_notices(task);
-    EXPECT_TRUE(task_take_notices(task).empty()) << "a notice is told once";
+    EXPECT_TRUE(task_take_notices(task).of_task.empty()) << "a notice is told once";
     ASSERT_EQ(mach_port_deallocate(task), KERN_SUCCESS);
     EXPECT_EQ(regionAt(task, 0).status, KERN_INVALID_ARGUMENT);
     EXPECT_NE(mach_port_retain(task), KERN_SUCCESS);

@@ -22,7 +22,7 @@ class UserProcess : public WalkTest {
 };
 
 TEST_F(UserProcess, IsGatheredOnceIntoRegionsAuxDataAndNotices) {
-    task.notices = {"first", "second"};
+    task.notices = {.of_task = {"first"}, .of_machine = {"second"}};
     const auto made = TLProcess::processWithPid(7);
     EXPECT_FALSE(made->hasMemoryRegions());
     task.usage.ri_phys_tally = 150; // asked for again

@@ -39,7 +39,7 @@ class KernelBuilder {
             addOwnedObject(statement);
         } else if (keyword == "notice") {
             for (ScriptedTask* task : tasks_) {
-                task->notices.push_back(takeWord(statement));
+                task->notices.of_task.push_back(takeWord(statement));
             }
         } else if (keyword == "fail") {
             const std::string call = takeWord(statement);

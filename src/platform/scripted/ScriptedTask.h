@@ -7,6 +7,7 @@
 
 #include "platform/bsd_process.h"
 #include "platform/dyld_inspection.h"
+#include "platform/gather.h"
 #include "platform/kern_return.h"
 #include "platform/mach_vm.h"
 #include "platform/runekit.h"
@@ -128,8 +129,8 @@ struct TaskRecord {
     std::optional<dyld_shared_cache> sharedCache{};
     kern_return_t cacheProcessStatus = 0;
     kern_return_t cacheSnapshotStatus = 0;
-    std::vector<std::string> notices{}; // what the platform has to say about its figures
-    std::int32_t family = 0;            // processes of one family are relatives; 0: none
+    task_notices notices{};  // what the platform has to say about its figures
+    std::int32_t family = 0; // processes of one family are relatives; 0: none
 };
 
 class ScriptedTask : public TaskRecord {

@@ -112,7 +112,7 @@ GatherScope::~GatherScope() {
     state.gathering = false;
 }
 
-std::vector<std::string> task_take_notices(mach_port_t task) {
+task_notices task_take_notices(mach_port_t task) {
     const Answer answer("task_take_notices", PortName{task});
     const auto port = answer.state.ports.find(task); // also of a task that has ended meanwhile
     if (answer.fault != 0 || port == answer.state.ports.end()) {

@@ -1,6 +1,7 @@
 #include "platform/linux/corpse/CorpseFamilies.h"
 
 #include "platform/linux/families/AddressSlots.h"
+#include "platform/linux/io/MachineNotices.h"
 #include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/processes/ProcessStat.h"
 
@@ -106,9 +107,6 @@ class SharingCount {
     SharingSets sets;
 };
 
-constexpr const char* hiddenFramesNotice =
-    "Frame numbers are hidden: what corpses of forked relatives share counts for each of them";
-
 void divideFamily(Spaces members) {
     std::vector<std::size_t> order(members.size());
     for (std::size_t i = 0; i < members.size(); ++i) {
@@ -143,7 +141,7 @@ void divideFamily(Spaces members) {
     for (std::size_t i = 0; i < byPid.size(); ++i) {
         byPid[i]->walk->divide(parts[i]);
         if (byPid[i]->held.areFramesHidden()) {
-            byPid[i]->notices.emplace_back(hiddenFramesNotice);
+            byPid[i]->notices.emplace_back(corpseSharingNotice);
         }
     }
 }

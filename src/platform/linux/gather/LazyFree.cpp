@@ -93,8 +93,8 @@ void ask(Search& search, std::vector<Search::Candidate>::iterator candidate,
 
 } // namespace
 
-bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder, std::uint64_t residentAnonymous) {
-    if (residentAnonymous == 0 || machineState().lazyFree == 0) {
+bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder) {
+    if (machineState().lazyFree == 0) {
         return false;
     }
     Search& current = search();

@@ -11,8 +11,8 @@
 namespace tally::platform {
 
 /// Whether process `pid` has lazily freed memory.
-/// @param folder where its files are. @param residentAnonymous its anonymous memory in bytes.
-bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder, std::uint64_t residentAnonymous);
+/// @param folder where its files are.
+bool hasLazilyFreedMemory(std::int32_t pid, const std::string& folder);
 
 /// Forgets what was found, when a gather begins or ends. @param isGathering whether one begins.
 void restartLazyFreeSearch(bool isGathering);

@@ -5,13 +5,17 @@
 #include "platform/linux/walk/Mapping.h"
 
 #include <sys/sysinfo.h>
+#include <sys/utsname.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <limits>
 #include <mutex>
 #include <optional>
 #include <thread>
+#include <utility>
 
 namespace tally::platform {
 
@@ -44,6 +48,15 @@ bool swapInUseBySystem() {
     return sysinfo(&system) != 0 || system.totalswap != system.freeswap;
 }
 
+/// Before 6.2 each thread kept what it had touched last to itself.
+bool countersLag() {
+    utsname system{};
+    int major = 0;
+    int minor = 0;
+    const bool isTold = uname(&system) == 0 && std::sscanf(system.release, "%d.%d", &major, &minor) == 2;
+    return isTold && std::pair(major, minor) < std::pair(6, 2);
+}
+
 MachineState readMachineState() {
     const std::optional<std::string> meminfo = readSystemFile(systemPath("/proc/meminfo"));
     const std::optional<std::string> vmstat = readSystemFile(systemPath("/proc/vmstat"));
@@ -51,6 +64,8 @@ MachineState readMachineState() {
     const bool cannotMerge = !merged && errno == ENOENT;
     return {.swapInUse = meminfo ? decodeSwapInUse(*meminfo) : swapInUseBySystem(),
             .mergesPages = merged ? numberOf(*merged, "") != 0 : !cannotMerge,
+            .tellsMergedPages = access(systemPath("/proc/self/ksm_merging_pages").c_str(), F_OK) == 0,
+            .countersLag = countersLag(),
             .lazyFree = vmstat ? decodeLazyFree(*vmstat) : std::numeric_limits<std::uint64_t>::max()};
 }
 

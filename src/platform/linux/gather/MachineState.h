@@ -11,7 +11,9 @@ namespace tally::platform {
 /// What cannot be read is taken for what makes processes be asked themselves.
 struct MachineState {
     bool swapInUse = false;
-    bool mergesPages = false; // pages of the same content are one (KSM)
+    bool mergesPages = false;     // pages of the same content are one (KSM)
+    bool tellsMergedPages = true; // by process
+    bool countersLag = false;     // those of resident memory, behind what each thread has touched
     // Bytes that processes have given up and the kernel may take, about; the most where that is not known.
     std::uint64_t lazyFree = 0;
 };

@@ -4,6 +4,7 @@
 #include "platform/gather.h"
 #include "platform/linux/corpse/Corpse.h"
 #include "platform/linux/families/Families.h"
+#include "platform/linux/io/MachineNotices.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/AccountingSwitch.h"
 #include "platform/mach_task.h"
@@ -172,9 +173,14 @@ bool task_has_relatives(mach_port_t task) {
     return !found || found->hasRelatives();
 }
 
-std::vector<std::string> task_take_notices(mach_port_t task) {
-    const std::shared_ptr<Task> found = taskOfPort(task);
-    return found ? found->takeNotices() : std::vector<std::string>();
+task_notices task_take_notices(mach_port_t task) {
+    task_notices notices;
+    if (const std::shared_ptr<Task> found = taskOfPort(task)) {
+        for (std::string& text : found->takeNotices()) {
+            (isOfMachine(text) ? notices.of_machine : notices.of_task).push_back(std::move(text));
+        }
+    }
+    return notices;
 }
 
 } // namespace tally::platform

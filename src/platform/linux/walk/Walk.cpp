@@ -3,6 +3,7 @@
 #include "platform/linux/families/Families.h"
 #include "platform/linux/gather/LazyFree.h"
 #include "platform/linux/gather/MachineState.h"
+#include "platform/linux/io/MachineNotices.h"
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
@@ -30,7 +31,7 @@ WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView
         known = text ? std::optional(decodeStatus(*text)) : std::nullopt;
     }
     facts.asksLocked = !known || known->locked != 0;
-    facts.asksLazyFree = !known || hasLazilyFreedMemory(task.pid, folder, known->residentAnonymous);
+    facts.asksLazyFree = hasLazilyFreedMemory(task.pid, folder);
     return facts;
 }
 
@@ -61,14 +62,10 @@ bool hasMergedPages(const std::string& folder) {
 
 constexpr const char* mergedPagesNotice =
     "Pages that the kernel has merged by their content (KSM) count for every process that has them";
-constexpr const char* pageCacheNotice =
-    "The page cache could not be asked: shared memory and files are counted by the process's own page tables";
 constexpr const char* missedSmapsNotice =
     "Its smaps could not be read: lazily freed memory counts as dirty, and none as locked";
 constexpr const char* unreadRelativesNotice =
     "What is shared with forked relatives counts for each of them: they could not be read side by side";
-constexpr const char* sharingNotice =
-    "Frame numbers are hidden: what is shared with forked relatives is estimated from addresses";
 
 } // namespace
 
@@ -105,8 +102,13 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
     }
     walk->pieces_ = builder.takePieces();
     walk->words_ = builder.takeWords();
-    if (machineState().mergesPages && hasMergedPages(space.folder)) {
+    if (const MachineState machine = machineState(); machine.mergesPages && !machine.tellsMergedPages) {
+        result.notices.emplace_back(untoldMergingNotice);
+    } else if (machine.mergesPages && hasMergedPages(space.folder)) {
         result.notices.emplace_back(mergedPagesNotice);
+    }
+    if (machineState().countersLag) {
+        result.notices.emplace_back(countersNotice);
     }
     if (smaps.wasMissed()) {
         result.notices.emplace_back(missedSmapsNotice);
