@@ -1,13 +1,15 @@
 #!/usr/bin/env python3
 """Holds tally's figures against a population whose truth is known, and against the machine's own counters.
 
-  exact.py TALLY [--thp]
+  exact.py TALLY [--overlay] [--no-counters] [ARGUMENT OF population.py ...]
 
 Starts population.py with its extras and compares, to the byte: the bytes of each exact set of holders, in both views; what
-five children of one family hold between them; what is held and not mapped. Then what the population added to the sum over
-all processes with what it added to /proc/meminfo, within the part given below. Root only. Exit status 1 on a difference.
+five children of one family hold between them; what is held and not mapped. Then, unless others keep the machine busy, what
+the population added to the sum over all processes with what it added to /proc/meminfo, within the part given below. With
+--overlay all of it happens in an overlay over the root file system, as in a container. Exit status 1 on a difference, 77
+where a user may not do this.
 """
-import collections, json, os, subprocess, sys, tempfile
+import collections, json, os, shutil, subprocess, sys, tempfile
 
 HERE = os.path.dirname(os.path.abspath(__file__))
 MIB = 1 << 20
@@ -125,12 +127,32 @@ def views(tally):
     return Report(tally, ["-a", "-x", "kernel"]), Report(tally, ["-a", "-x", "kernel", "--vmObjectDirty"])
 
 
+def run_in_overlay(words):
+    """Runs this script again where an overlay is the root file system, in a mount namespace that ends with it."""
+    folder = tempfile.mkdtemp(dir=os.path.dirname(words[0]))  # a disk's, where the programs are
+    script = """mkdir upper work root && mount -t overlay overlay -o lowerdir=/,upperdir=upper,workdir=work root || exit 77
+                for name in proc sys dev dev/shm; do mount --bind /$name root/$name || exit 77; done
+                exec chroot root "$@" """
+    try:
+        return subprocess.run(["unshare", "-m", "sh", "-c", script, "sh", sys.executable, os.path.abspath(__file__)] + words,
+                              cwd=folder).returncode
+    finally:
+        shutil.rmtree(folder, ignore_errors=True)
+
+
 def main():
-    tally = os.path.abspath(sys.argv[1])
+    tally, arguments = os.path.abspath(sys.argv[1]), sys.argv[2:]
+    if os.geteuid() != 0:
+        print("skipped: all processes are measured by root only")
+        return 77
+    if "--overlay" in arguments:
+        return run_in_overlay([tally] + [word for word in arguments if word != "--overlay"])
+    counts = "--no-counters" not in arguments
     verdicts = Verdicts()
-    counters_before, before = meminfo(), figures_of(*views(tally))
-    population = subprocess.Popen([sys.executable, os.path.join(HERE, "population.py"), "--seconds", "500", "--extras"] + sys.argv[2:],
-                                  stdout=subprocess.PIPE, text=True)
+    if counts:
+        counters_before, before = meminfo(), figures_of(*views(tally))
+    population = subprocess.Popen([sys.executable, os.path.join(HERE, "population.py"), "--seconds", "500", "--extras"] +
+                                  [word for word in arguments if word != "--no-counters"], stdout=subprocess.PIPE, text=True)
     try:
         text = ""
         for line in population.stdout:
@@ -147,8 +169,8 @@ def main():
         arguments = [word for pid in five for word in ("--pid", str(pid))]
         verdicts.equal("five children as the only targets", Report(tally, arguments).sets(
             [(pid, pure["addr"], pure["size"]) for pid in five], ANY), {tuple(sorted(five)): pure["size"]})
-        now = figures_of(default, objects)
-        for counter, part in [("AnonPages", 0.001), ("Shmem", 0.005), ("PageTables", 0.03)]:
+        now = figures_of(default, objects) if counts else {}
+        for counter, part in [("AnonPages", 0.001), ("Shmem", 0.005), ("PageTables", 0.03)] if counts else []:
             verdicts.near("increase of " + counter, now[counter] - before[counter], counters[counter] - counters_before[counter], part)
     finally:
         population.terminate()
