@@ -14,15 +14,13 @@ inline constexpr const char* sharingNotice =
     "Frame numbers are hidden: what is shared with forked relatives is estimated from addresses";
 inline constexpr const char* corpseSharingNotice =
     "Frame numbers are hidden: what corpses of forked relatives share counts for each of them";
-inline constexpr const char* countersNotice =
-    "This kernel counts resident memory with a delay: phys_tally can be off by 64 pages for each thread";
 inline constexpr const char* untoldMergingNotice =
     "Pages are merged by their content (KSM) and count for every "
     "process that has them: this kernel does not tell whose";
 
 inline bool isOfMachine(std::string_view notice) {
-    constexpr std::array<std::string_view, 5> all{pageCacheNotice, sharingNotice, corpseSharingNotice,
-                                                  countersNotice, untoldMergingNotice};
+    constexpr std::array<std::string_view, 4> all{pageCacheNotice, sharingNotice, corpseSharingNotice,
+                                                  untoldMergingNotice};
     return std::ranges::find(all, notice) != all.end();
 }
 

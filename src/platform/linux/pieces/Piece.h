@@ -34,6 +34,13 @@ struct Piece {
     std::uint64_t end() const { return start + size; }
 };
 
+/// What the page tables of a task show, in bytes; a page that is mapped twice counts twice.
+struct ResidentMemory {
+    std::uint64_t anonymous = 0;
+    std::uint64_t shared = 0; // pages of shared memory
+    std::uint64_t swapped = 0;
+};
+
 /// Dispositions of consecutive pages; page numbers count from the start of the piece.
 struct PageWords {
     std::uint64_t firstPage = 0;

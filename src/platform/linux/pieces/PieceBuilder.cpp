@@ -163,4 +163,15 @@ void PieceBuilder::build(std::size_t index) {
     addRest(index, (mapping.end - nextStart_) / basePage);
 }
 
+ResidentMemory PieceBuilder::residentMemory() const {
+    ResidentMemory sum;
+    for (std::size_t i = 0; i < states_.mappings.size(); ++i) {
+        const MappingPages& pages = states_.mappings[i];
+        sum.anonymous += pages.anonymous * basePage;
+        sum.shared += backings_[i].backing == Backing::sharedMemory ? pages.object * basePage : 0;
+        sum.swapped += pages.swapped * basePage;
+    }
+    return sum;
+}
+
 } // namespace tally::platform

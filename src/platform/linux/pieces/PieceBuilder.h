@@ -39,6 +39,7 @@ class PieceBuilder {
 
     std::vector<Piece> takePieces() { return std::move(pieces_); }
     std::vector<PageWords> takeWords() { return std::move(words_); }
+    ResidentMemory residentMemory() const;
     /// As ObjectCounter says.
     bool usedEstimates() const { return objects_.usedEstimates(); }
 

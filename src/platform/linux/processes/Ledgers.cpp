@@ -3,6 +3,7 @@
 #include "platform/linux/processes/Ledgers.h"
 
 #include "platform/bsd_process.h"
+#include "platform/linux/gather/MachineState.h"
 #include "platform/linux/processes/ProcessStat.h"
 #include "platform/linux/walk/Task.h"
 
@@ -39,13 +40,19 @@ Charges chargesOf(const ProcessStatus& status, bool isSecondTenant) {
 }
 
 std::optional<Charges> readChargesOfTask(std::int32_t pid) {
-    const std::optional<ProcessStatus> status = readProcessStatus(pid);
+    std::optional<ProcessStatus> status = readProcessStatus(pid);
     if (!status) {
         return std::nullopt;
     }
     const std::shared_ptr<Task> task = taskOfProcess(pid);
     if (task) {
         task->noteStatus(*status);
+    }
+    if (const auto resident = task ? task->resident() : std::nullopt;
+        resident && machineState().countersLag) {
+        status->residentAnonymous = resident->anonymous;
+        status->residentShared = resident->shared;
+        status->swapped = resident->swapped;
     }
     return chargesOf(*status, task && task->isSecondTenant());
 }

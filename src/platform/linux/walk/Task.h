@@ -48,6 +48,8 @@ class Task {
     }
     /// Keeps what was just read of the process's status, for the walk that follows.
     void noteStatus(const ProcessStatus& status) { status_ = status; }
+    /// What its walk has counted; absent before it was walked as a whole, and of corpses.
+    std::optional<ResidentMemory> resident() const;
     std::vector<std::string> takeNotices();
     /// Adds notices; each is given once.
     void addNotices(std::vector<std::string> notices);

@@ -100,15 +100,13 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
         }
         builder.build(i);
     }
+    walk->resident_ = builder.residentMemory();
     walk->pieces_ = builder.takePieces();
     walk->words_ = builder.takeWords();
     if (const MachineState machine = machineState(); machine.mergesPages && !machine.tellsMergedPages) {
         result.notices.emplace_back(untoldMergingNotice);
     } else if (machine.mergesPages && hasMergedPages(space.folder)) {
         result.notices.emplace_back(mergedPagesNotice);
-    }
-    if (machineState().countersLag) {
-        result.notices.emplace_back(countersNotice);
     }
     if (smaps.wasMissed()) {
         result.notices.emplace_back(missedSmapsNotice);

@@ -43,6 +43,8 @@ class Walk {
     /// there.
     kern_return_t statusPastEnd() const { return statusPastEnd_; }
     const Mapping& mappingOf(const Piece& piece) const { return mappings_[piece.mapping]; }
+    /// What its page tables show, counted page by page.
+    const ResidentMemory& resident() const { return resident_; }
     /// All mappings, in rising order.
     std::span<const Mapping> mappings() const { return mappings_; }
     /// The process folder that the mappings were read in.
@@ -68,6 +70,7 @@ class Walk {
     std::vector<Mapping> mappings_;
     std::vector<Piece> pieces_; // in rising order
     std::vector<PageWords> words_;
+    ResidentMemory resident_;
     kern_return_t statusPastEnd_ = KERN_INVALID_ADDRESS;
 };
 
