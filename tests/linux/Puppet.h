@@ -84,6 +84,9 @@ class TemporaryFolder {
 /// Whether this is root of the machine: neither of a user namespace only, nor bereft of its rights.
 bool isRoot();
 
+/// Whether the kernel is older than `major`.`minor`.
+bool isKernelBefore(int major, int minor);
+
 /// Waits until no other test changes this setting of the machine. @return a descriptor; until it is closed no
 /// other can.
 int lockOfMachine(const std::string& setting);

@@ -48,7 +48,9 @@ class Snapshot : public testing::Test {
         }
         const Outcome outcome = run(command);
         ASSERT_EQ(outcome.status, 0) << outcome.errors;
-        EXPECT_EQ(outcome.errors, "");
+        if (!test::isKernelBefore(6, 5)) { // there the page cache cannot be asked, which is said
+            EXPECT_EQ(outcome.errors, "");
+        }
     }
 
     static Outcome tally(std::vector<std::string> arguments) {

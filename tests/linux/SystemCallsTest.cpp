@@ -85,6 +85,9 @@ int callsForMappings(int mappings) {
 }
 
 TEST(SystemCalls, AreOneAMappingAndFarLessWhereThereAreThousands) {
+    if (isKernelBefore(6, 7)) {
+        GTEST_SKIP() << "this kernel's page tables are read, and not asked for what is there";
+    }
     const int few = callsForMappings(400);
     EXPECT_LE(callsForMappings(1400) - few, 1050);
     const int many = callsForMappings(4000);
@@ -100,6 +103,9 @@ TEST(SystemCalls, DoNotGrowWithMemory) {
 }
 
 TEST(SystemCalls, DoNotGrowWithReservedAddresses) {
+    if (isKernelBefore(6, 7)) {
+        GTEST_SKIP() << "this kernel's page tables are read, and not asked for what is there";
+    }
     const auto callsFor = [](const char* how) {
         const Puppet family({"family", "2", "16", how});
         std::vector<std::string> arguments{"--pid", std::to_string(family.pid())};

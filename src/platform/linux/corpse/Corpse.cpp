@@ -150,7 +150,8 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
         return statusOfUnread();
     }
     Walk::Result result = Walk::read(task, FamilyKey(), task, !accountingSwitchIsOn());
-    capture.charges = readCharges(task.pid, false).value_or(Charges());
+    const auto counted = result.walk ? result.walk->resident() : std::nullopt;
+    capture.charges = readCharges(task.pid, false, counted).value_or(Charges());
     const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
     if (status == KERN_INVALID_ARGUMENT || capture.charges.pageTable == 0) {
         return KERN_TERMINATED; // it can be killed while it holds still
@@ -217,7 +218,7 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
     const std::optional<ProcessStat> stat = readProcessStat(task.pid);
     const FamilyKey key = stat ? familyKeyOf(*stat) : FamilyKey();
     if (auto space = corpseSpaceOfTwin(key, task)) {
-        const std::optional<Charges> charges = readCharges(task.pid, true);
+        const std::optional<Charges> charges = readCharges(task.pid, true, space->walk->resident());
         const std::optional<Identification> identification = charges ? identify(task.pid) : std::nullopt;
         if (!identification) {
             return statusOfUnread();

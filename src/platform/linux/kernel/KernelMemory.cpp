@@ -93,7 +93,7 @@ std::uint64_t chargedPageTables() {
     pids.resize(static_cast<std::size_t>(std::max(proc_listallpids(pids), 0)));
     std::uint64_t sum = 0;
     for (const std::int32_t pid : pids) {
-        const std::optional<Charges> charges = readCharges(pid, false);
+        const std::optional<Charges> charges = readCharges(pid, false, {});
         sum += charges ? charges->pageTable : 0;
     }
     return sum;

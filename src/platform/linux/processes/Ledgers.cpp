@@ -39,28 +39,31 @@ Charges chargesOf(const ProcessStatus& status, bool isSecondTenant) {
     return charges;
 }
 
-std::optional<Charges> readChargesOfTask(std::int32_t pid) {
+/// @param counted what a walk has found, instead of counters that lag.
+std::optional<ProcessStatus> readExactStatus(std::int32_t pid, const std::optional<ResidentMemory>& counted) {
     std::optional<ProcessStatus> status = readProcessStatus(pid);
-    if (!status) {
-        return std::nullopt;
+    if (status && counted && machineState().countersLag) {
+        status->residentAnonymous = counted->anonymous;
+        status->residentShared = counted->shared;
+        status->swapped = counted->swapped;
     }
+    return status;
+}
+
+std::optional<Charges> readChargesOfTask(std::int32_t pid) {
     const std::shared_ptr<Task> task = taskOfProcess(pid);
-    if (task) {
+    const auto status = readExactStatus(pid, task ? task->resident() : std::nullopt);
+    if (status && task) {
         task->noteStatus(*status);
     }
-    if (const auto resident = task ? task->resident() : std::nullopt;
-        resident && machineState().countersLag) {
-        status->residentAnonymous = resident->anonymous;
-        status->residentShared = resident->shared;
-        status->swapped = resident->swapped;
-    }
-    return chargesOf(*status, task && task->isSecondTenant());
+    return status ? std::optional(chargesOf(*status, task && task->isSecondTenant())) : std::nullopt;
 }
 
 } // namespace
 
-std::optional<Charges> readCharges(std::int32_t pid, bool isSecondTenant) {
-    const std::optional<ProcessStatus> status = readProcessStatus(pid);
+std::optional<Charges> readCharges(std::int32_t pid, bool isSecondTenant,
+                                   const std::optional<ResidentMemory>& counted) {
+    const std::optional<ProcessStatus> status = readExactStatus(pid, counted);
     return status ? std::optional(chargesOf(*status, isSecondTenant)) : std::nullopt;
 }
 

@@ -2,6 +2,8 @@
 
 #pragma once
 
+#include "platform/linux/pieces/Piece.h"
+
 #include <cstdint>
 #include <optional>
 
@@ -17,6 +19,8 @@ struct Charges {
 
 /// Reads what process `pid` is charged for; absent when that fails, with errno.
 /// @param isSecondTenant of tasks that share one address space only the first is charged for its page tables.
-std::optional<Charges> readCharges(std::int32_t pid, bool isSecondTenant);
+/// @param counted what a walk has found that was just made: before 6.2 the kernel's counters lag behind it.
+std::optional<Charges> readCharges(std::int32_t pid, bool isSecondTenant,
+                                   const std::optional<ResidentMemory>& counted);
 
 } // namespace tally::platform

@@ -111,10 +111,7 @@ bool Task::hasRelatives() const {
     return corpse_ ? corpse_->hasRelatives() : !key_.isKnown() || countRelatives(key_) > 1;
 }
 
-std::optional<ResidentMemory> Task::resident() const {
-    const bool isWhole = walk_ && walk_->statusPastEnd() == KERN_INVALID_ADDRESS;
-    return isWhole ? std::optional(walk_->resident()) : std::nullopt;
-}
+std::optional<ResidentMemory> Task::resident() const { return walk_ ? walk_->resident() : std::nullopt; }
 
 std::vector<std::string> Task::takeNotices() {
     return corpse_ ? corpse_->takeNotices() : std::exchange(notices_, {});

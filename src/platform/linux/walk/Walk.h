@@ -43,8 +43,10 @@ class Walk {
     /// there.
     kern_return_t statusPastEnd() const { return statusPastEnd_; }
     const Mapping& mappingOf(const Piece& piece) const { return mappings_[piece.mapping]; }
-    /// What its page tables show, counted page by page.
-    const ResidentMemory& resident() const { return resident_; }
+    /// What the page tables show; absent where the walk could not go on to their end.
+    std::optional<ResidentMemory> resident() const {
+        return statusPastEnd_ == KERN_INVALID_ADDRESS ? std::optional(resident_) : std::nullopt;
+    }
     /// All mappings, in rising order.
     std::span<const Mapping> mappings() const { return mappings_; }
     /// The process folder that the mappings were read in.
