@@ -148,7 +148,7 @@ void zooOfSharedMemory() {
     const int ring = static_cast<int>(syscall(SYS_io_uring_setup, 8, &parameters));
     if (ring >= 0) { // else it is forbidden here
         m = map(page, readWrite, MAP_SHARED, ring);
-        std::uint64_t entry = 0; // before 6.10 the kernel shows no page of its own there
+        std::uint64_t entry = 0; // old kernels show no page of their own there
         pread(open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC), &entry, sizeof entry,
               static_cast<off_t>(reinterpret_cast<std::uintptr_t>(m) / page * sizeof entry));
         tell("ring", m, 1, figure("dirty", entry >> 63));

@@ -210,7 +210,7 @@ const Walk* Corpse::walk() const {
     return space_->walk.get();
 }
 
-std::vector<std::string> Corpse::takeNotices() { return takeCorpseNotices(*space_); }
+std::vector<std::string> Corpse::notices() const { return noticesOf(*space_); }
 
 bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpses(space_->key) > 1; }
 

@@ -49,7 +49,8 @@ class Corpse {
     std::span<const std::byte> crashInformation() const { return crashInformation_; }
     /// Whether there is a corpse of another process that descends from the same exec, as far as can be told.
     bool hasRelatives() const;
-    std::vector<std::string> takeNotices();
+    /// What was noted about its figures so far: of two processes with one address space each has it.
+    std::vector<std::string> notices() const;
 
   private:
     MemberIdentity identity_;

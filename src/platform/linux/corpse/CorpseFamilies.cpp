@@ -191,9 +191,9 @@ void settleCorpseFamily(CorpseSpace& space) {
     space.held = HeldPages();
 }
 
-std::vector<std::string> takeCorpseNotices(CorpseSpace& space) {
+std::vector<std::string> noticesOf(const CorpseSpace& space) {
     const std::scoped_lock lock(corpseTable().mutex);
-    return std::exchange(space.notices, {});
+    return space.notices;
 }
 
 std::size_t countCorpses(const FamilyKey& key) {

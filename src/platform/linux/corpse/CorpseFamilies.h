@@ -22,8 +22,8 @@ std::shared_ptr<CorpseSpace> corpseSpaceOfTwin(const FamilyKey& key, MemberIdent
 /// nothing.
 void settleCorpseFamily(CorpseSpace& space);
 
-/// Takes what there is to say of the space, for whichever of its tasks comes first.
-std::vector<std::string> takeCorpseNotices(CorpseSpace& space);
+/// What there is to say of the figures of the space so far.
+std::vector<std::string> noticesOf(const CorpseSpace& space);
 
 /// How many spaces descend from the exec of `key`.
 std::size_t countCorpses(const FamilyKey& key);

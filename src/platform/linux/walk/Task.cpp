@@ -114,7 +114,10 @@ bool Task::hasRelatives() const {
 std::optional<ResidentMemory> Task::resident() const { return walk_ ? walk_->resident() : std::nullopt; }
 
 std::vector<std::string> Task::takeNotices() {
-    return corpse_ ? corpse_->takeNotices() : std::exchange(notices_, {});
+    if (corpse_) {
+        addNotices(corpse_->notices());
+    }
+    return std::exchange(notices_, {});
 }
 
 const Walk* Task::walk(kern_return_t* status) {
