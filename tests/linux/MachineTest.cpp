@@ -125,6 +125,9 @@ TEST(Machine, WhatSeveralTouchOfAnObjectCountsOnce) {
     for (const char* seed : {"1", "2"}) {
         const Outcome outcome =
             run({"/usr/bin/python3", UNIONS, TALLY_PROGRAM, PUPPET_PROGRAM, folder.path(), seed});
+        if (outcome.status == 77) {
+            GTEST_SKIP() << "the page cache cannot be asked here";
+        }
         EXPECT_EQ(outcome.status, 0) << outcome.errors;
         EXPECT_NE(outcome.output.find("memory:"), std::string::npos) << outcome.output;
     }

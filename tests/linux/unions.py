@@ -5,7 +5,8 @@
 
 Each kind of object is mapped in windows that overlap, some twice, some for reading only; pages are read, written and, with
 swap in use, swapped out. The summary must hold every page that somebody's page tables show once, in the state that it is in,
-and every swapped one of the windows. Prints the kinds that were compared; exit status 1 with what differs.
+and every swapped one of the windows. Prints the kinds that were compared; exit status 1 with what differs, 77 where
+the page cache cannot be asked.
 """
 import ctypes, json, mmap, os, random, subprocess, sys
 
@@ -76,10 +77,10 @@ def summary_of(tally, members, output, kind, *options):
 
 
 def cachestat(file, first, pages):
-    """How many pages of a range are in memory, how many of these not on disk yet, and how many swapped out; none where it
-    cannot be asked."""
+    """How many pages of a range are in memory, how many of these not on disk yet, and how many swapped out."""
     counts = (ctypes.c_uint64 * 5)()
-    LIBC.syscall(451, file, (ctypes.c_uint64 * 2)(first * PAGE, pages * PAGE), counts, 0)
+    if LIBC.syscall(451, file, (ctypes.c_uint64 * 2)(first * PAGE, pages * PAGE), counts, 0) != 0:
+        sys.exit(77)
     return counts[0], min(counts[1] + counts[2], counts[0]), counts[3]
 
 
