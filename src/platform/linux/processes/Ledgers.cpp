@@ -5,6 +5,7 @@
 #include "platform/bsd_process.h"
 #include "platform/linux/gather/MachineState.h"
 #include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/walk/Mapping.h"
 #include "platform/linux/walk/Task.h"
 
 #include <algorithm>
@@ -17,7 +18,9 @@ namespace tally::platform {
 namespace {
 
 constexpr std::array<const char*, 2> entryNames{"page_table", "phys_tally"};
-constexpr std::uint64_t topLevelTable = 4096; // one page, which VmPTE leaves out
+/// What VmPTE leaves out: the top-level table is a page. Larger pages map so much that it has a few entries
+/// only, from a cache of the kernel's.
+const std::uint64_t topLevelTable = basePage == 4096 ? basePage : 0;
 
 /// The charges of the process that this thread read last: the usage record and the ledger that are asked one
 /// after the other come from one read, so that they agree.
