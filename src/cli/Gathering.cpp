@@ -10,7 +10,6 @@
 
 #include <algorithm>
 #include <map>
-#include <ranges>
 #include <string>
 #include <utility>
 #include <vector>
@@ -26,10 +25,10 @@ bool compareProcessesForGather(const std::shared_ptr<TLProcess>& a, const std::s
 /// Leaves what this machine costs every process to the lowest pid of those that are shown, with their number.
 void mergeMachineWarnings(const TLTally::ProcessList& sorted) {
     std::map<std::string, std::vector<TLProcess*>> processes;
-    for (const auto& process : std::views::reverse(sorted)) {
-        for (const std::string& text : process->takeMachineWarnings()) {
-            if (!process->hiddenFromDisplay()) {
-                processes[text].push_back(process.get());
+    for (auto process = sorted.rbegin(); process != sorted.rend(); ++process) {
+        for (const std::string& text : (*process)->takeMachineWarnings()) {
+            if (!(*process)->hiddenFromDisplay()) {
+                processes[text].push_back(process->get());
             }
         }
     }

@@ -10,7 +10,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdio>
 #include <limits>
 #include <mutex>
 #include <optional>
@@ -51,9 +50,13 @@ bool swapInUseBySystem() {
 /// Before 6.2 each thread kept what it had touched last to itself.
 bool countersLag() {
     utsname system{};
+    if (uname(&system) != 0) {
+        return false;
+    }
+    std::string_view release = system.release;
     int major = 0;
     int minor = 0;
-    const bool isTold = uname(&system) == 0 && std::sscanf(system.release, "%d.%d", &major, &minor) == 2;
+    const bool isTold = takeNumber(release, &major) && takeChar(release, '.') && takeNumber(release, &minor);
     return isTold && std::pair(major, minor) < std::pair(6, 2);
 }
 
