@@ -5,6 +5,7 @@
 
 #include "platform/kern_return.h"
 
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -18,6 +19,9 @@ class GatherScope {
     ~GatherScope();
     GatherScope(const GatherScope&) = delete;
     GatherScope& operator=(const GatherScope&) = delete;
+
+  private:
+    std::shared_ptr<void> gather_; // the platform's own
 };
 
 /// Texts for a process's warnings, such as a figure that rights did not allow and an estimate stands in for.

@@ -4,7 +4,7 @@
 #include "platform/linux/images/ImageSegments.h"
 #include "platform/linux/images/LayoutTable.h"
 #include "platform/linux/io/SystemFiles.h"
-#include "platform/linux/walk/DecodeMaps.h"
+#include "platform/linux/pages/DecodeMaps.h"
 #include "platform/mach_task.h"
 #include "platform/runekit.h"
 

@@ -7,7 +7,7 @@
 #include "platform/linux/io/Descriptor.h"
 #include "platform/linux/owned/HeldFiles.h"
 #include "platform/linux/owned/OwnedGather.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 #include "platform/mach_task.h"
 
 #include <fcntl.h>

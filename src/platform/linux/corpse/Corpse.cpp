@@ -1,6 +1,5 @@
 #include "platform/linux/corpse/Corpse.h"
 
-#include "platform/bsd_process.h"
 #include "platform/linux/corpse/CorpseFamilies.h"
 #include "platform/linux/corpse/KcdataWriter.h"
 #include "platform/linux/corpse/StopSignals.h"
@@ -8,21 +7,19 @@
 #include "platform/linux/images/SymbolOwners.h"
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/machine/Charges.h"
+#include "platform/linux/machine/MachineState.h"
+#include "platform/linux/machine/ProcessStat.h"
+#include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/Executable.h"
 #include "platform/linux/objects/FilesAhead.h"
-#include "platform/linux/processes/Executable.h"
-#include "platform/linux/processes/Ledgers.h"
-#include "platform/linux/processes/ProcessStat.h"
-#include "platform/linux/walk/AccountingSwitch.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
-#include "platform/linux/walk/Task.h"
-#include "platform/mach_task.h"
+#include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <chrono>
-#include <cstring>
 #include <future>
-#include <map>
-#include <mutex>
 #include <optional>
 #include <system_error>
 #include <thread>
@@ -51,15 +48,12 @@ struct Identification {
 
 /// Absent on failure, with errno.
 std::optional<Identification> identify(std::int32_t pid) {
-    Identification identification;
-    proc_bsdinfo info;
-    if (proc_pidinfo(pid, &info) != sizeof info) {
+    const std::optional<ProcessStat> stat = readProcessStat(pid);
+    if (!stat) {
         return std::nullopt;
     }
-    identification.flags = (info.pbi_flags & PROC_FLAG_LP64) != 0 ? flag64bit : 0;
-    identification.path = executableLink(pid).value_or(
-        std::string(info.pbi_name, strnlen(info.pbi_name, sizeof info.pbi_name)));
-    return identification;
+    return Identification{.path = executableLink(pid).value_or(stat->comm),
+                          .flags = is64bitProgram(*stat) ? flag64bit : 0};
 }
 
 std::vector<std::byte> crashInformationOf(std::int32_t pid, const Identification& identification,
@@ -77,25 +71,46 @@ std::vector<std::byte> crashInformationOf(std::int32_t pid, const Identification
 
 /// Whether another process can descend from the same exec. Who will be asked for later is not known yet.
 bool canHaveLiveRelatives(std::int32_t pid, const FamilyKey& key) {
-    std::vector<std::int32_t> pids(static_cast<std::size_t>(std::max(proc_listallpids({}), 0)));
-    const int count = proc_listallpids(pids);
-    pids.resize(std::min(pids.size(), static_cast<std::size_t>(std::max(count, 0))));
-    return key.isKnown() && (pids.empty() || std::ranges::any_of(pids, [&](std::int32_t other) {
-                                 const auto stat = readProcessStat(other);
-                                 return other != pid && (stat ? familyKeyOf(*stat) == key : isRefusal(errno));
-                             }));
+    const auto pids = listNumbered(systemPath("/proc"));
+    return key.isKnown() && (!pids || std::ranges::any_of(*pids, [&](std::int32_t other) {
+               const auto stat = readProcessStat(other);
+               return other != pid && (stat ? familyKeyOf(*stat) == key : isRefusal(errno));
+           }));
+}
+
+constexpr std::size_t mostOpened = 256; // smaps stands in for the others
+
+/// Whether a walk asks the page cache of such a file which of its pages there are.
+bool asksPages(Backing backing, const Mapping& mapping, bool objectView) {
+    return (backing == Backing::sharedMemory && (objectView || machineState().swapInUse)) ||
+           (backing == Backing::file && (objectView || mapping.shared));
 }
 
 /// Asks of a running process's files what is needed of them, so that none is asked while the process holds
 /// still.
-FilesAhead askAhead(MemberIdentity task) {
+FilesAhead askAhead(MemberIdentity task, bool objectView) {
     FilesAhead ahead;
     ProcessMemoryFiles files;
     std::vector<Mapping> mappings;
-    if (files.open(task.pid, task.startTicks, &mappings) == KERN_SUCCESS) {
-        ahead.ask(files.folder, mappings, !accountingSwitchIsOn());
-        symbolOwnersOf(mappings, files.folder); // the headers of its files are remembered
+    if (files.open(task.pid, task.startTicks, &mappings) != KERN_SUCCESS) {
+        return ahead;
     }
+    std::size_t opened = 0;
+    for (const Mapping& mapping : mappings) {
+        if (!mapping.isFileBacked()) {
+            continue;
+        }
+        FilesAhead::Known& known = ahead.enter(mapping);
+        if (known.object.backing == Backing::anonymous) { // new
+            known.object = backingOf(mapping, files.folder);
+        }
+        if (asksPages(known.object.backing, mapping, objectView) && !known.file.isOpen() &&
+            opened < mostOpened) {
+            known.file = openForPageStates(files.folder, mapping);
+            ++opened;
+        }
+    }
+    symbolOwnersOf(mappings, files.folder); // the headers of its files are remembered
     return ahead;
 }
 
@@ -111,6 +126,7 @@ kern_return_t statusOfUnread() { return isRefusal(errno) ? KERN_FAILURE : KERN_T
 
 /// What is found out while the process holds still.
 struct Capture {
+    bool objectView = false;
     FilesAhead files;
     bool hasRelatives = false; // by which it is known what else to read
     std::optional<Identification> identification;
@@ -149,7 +165,7 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
     if (!capture.identification) {
         return statusOfUnread();
     }
-    Walk::Result result = Walk::read(task, FamilyKey(), task, !accountingSwitchIsOn());
+    Walk::Result result = Walk::read(task, FamilyKey(), task, capture.objectView);
     const auto counted = result.walk ? result.walk->resident() : std::nullopt;
     capture.charges = readCharges(task.pid, false, counted).value_or(Charges());
     const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
@@ -192,17 +208,6 @@ kern_return_t runApart(const Work& work, const Meanwhile& meanwhile) {
     return result.get();
 }
 
-/// Crash information that callers have asked for and not given back.
-struct MappedInformation {
-    std::mutex mutex;
-    std::map<const std::byte*, std::vector<std::byte>> buffers;
-};
-
-MappedInformation& mappedInformation() {
-    static MappedInformation information;
-    return information;
-}
-
 } // namespace
 
 const Walk* Corpse::walk() const {
@@ -214,7 +219,7 @@ std::vector<std::string> Corpse::notices() const { return noticesOf(*space_); }
 
 bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpses(space_->key) > 1; }
 
-kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
+kern_return_t makeCorpse(MemberIdentity task, bool objectView, std::shared_ptr<Corpse>* corpse) {
     const std::optional<ProcessStat> stat = readProcessStat(task.pid);
     const FamilyKey key = stat ? familyKeyOf(*stat) : FamilyKey();
     if (auto space = corpseSpaceOfTwin(key, task)) {
@@ -233,8 +238,9 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
         space->execRandom = readExecRandom(task.pid);
     }
     Capture capture;
+    capture.objectView = objectView;
     capture.hasRelatives = canHaveLiveRelatives(task.pid, key);
-    capture.files = askAhead(task);
+    capture.files = askAhead(task, objectView);
     SeizedThreads seized;
     const kern_return_t status =
         runApart([&] { return lookAt(task, seized, *space, capture); }, [&] { seized.takeNoteOfEnds(); });
@@ -245,41 +251,6 @@ kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse) {
             task, space, crashInformationOf(task.pid, *capture.identification, capture.charges));
     }
     return status;
-}
-
-kern_return_t task_generate_corpse(mach_port_t task, mach_port_t* corpse) {
-    *corpse = MACH_PORT_NULL;
-    const std::shared_ptr<Task> live = taskOfPort(task);
-    if (!live || live->corpse() != nullptr) {
-        return KERN_INVALID_ARGUMENT;
-    }
-    std::shared_ptr<Corpse> made;
-    const kern_return_t status = makeCorpse(live->identity(), &made);
-    if (status == KERN_SUCCESS) {
-        *corpse = makePort(std::make_shared<Task>(std::move(made)));
-    }
-    return status;
-}
-
-kern_return_t task_map_corpse_info_64(mach_port_t corpse, std::span<const std::byte>* buffer) {
-    *buffer = {};
-    const std::shared_ptr<Task> task = taskOfPort(corpse);
-    if (!task || task->corpse() == nullptr) {
-        return KERN_INVALID_ARGUMENT;
-    }
-    const auto information = task->corpse()->crashInformation();
-    std::vector<std::byte> copy(information.begin(), information.end());
-    *buffer = copy;
-    MappedInformation& mapped = mappedInformation();
-    const std::scoped_lock lock(mapped.mutex);
-    mapped.buffers.emplace(copy.data(), std::move(copy));
-    return KERN_SUCCESS;
-}
-
-kern_return_t vm_deallocate(std::span<const std::byte> buffer) {
-    MappedInformation& mapped = mappedInformation();
-    const std::scoped_lock lock(mapped.mutex);
-    return mapped.buffers.erase(buffer.data()) == 1 ? KERN_SUCCESS : KERN_INVALID_ADDRESS;
 }
 
 } // namespace tally::platform

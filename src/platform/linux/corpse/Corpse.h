@@ -6,12 +6,8 @@
 #pragma once
 
 #include "platform/kern_return.h"
-#include "platform/linux/corpse/HeldPages.h"
-#include "platform/linux/families/FamilyKey.h"
-#include "platform/linux/walk/Walk.h"
-#include "platform/runekit.h"
+#include "platform/linux/corpse/CorpseSpace.h"
 
-#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
@@ -21,19 +17,6 @@
 #include <vector>
 
 namespace tally::platform {
-
-/// The address space of a corpse. Tasks that have one in common have one here too, as it was when the first
-/// of them was looked at.
-struct CorpseSpace {
-    MemberIdentity owner;
-    FamilyKey key;
-    std::array<std::uint64_t, 2> execRandom{}; // of programs whose layout is fixed, else zeros
-    std::unique_ptr<Walk> walk;
-    std::vector<RKSymbolOwner> images;
-    HeldPages held; // of processes that have relatives
-    std::vector<std::string> notices;
-    bool isSettled = false; // what relatives share is known
-};
 
 class Corpse {
   public:
@@ -60,7 +43,8 @@ class Corpse {
 
 /// Makes a corpse of the process `task`. Its threads hold still for as long as it takes to read their page
 /// tables.
+/// @param objectView as for Walk::read.
 /// @return KERN_SUCCESS, or what StoppedThreads or Walk say.
-kern_return_t makeCorpse(MemberIdentity task, std::shared_ptr<Corpse>* corpse);
+kern_return_t makeCorpse(MemberIdentity task, bool objectView, std::shared_ptr<Corpse>* corpse);
 
 } // namespace tally::platform

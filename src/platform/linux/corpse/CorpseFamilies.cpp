@@ -2,8 +2,8 @@
 
 #include "platform/linux/families/AddressSlots.h"
 #include "platform/linux/io/MachineNotices.h"
+#include "platform/linux/machine/ProcessStat.h"
 #include "platform/linux/objects/ObjectId.h"
-#include "platform/linux/processes/ProcessStat.h"
 
 #include <algorithm>
 #include <mutex>

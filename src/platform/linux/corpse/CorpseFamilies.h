@@ -4,7 +4,7 @@
 
 #pragma once
 
-#include "platform/linux/corpse/Corpse.h"
+#include "platform/linux/corpse/CorpseSpace.h"
 
 #include <memory>
 #include <string>

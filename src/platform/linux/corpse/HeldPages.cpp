@@ -1,9 +1,9 @@
 #include "platform/linux/corpse/HeldPages.h"
 
-#include "platform/linux/walk/PageSource.h"
-#include "platform/linux/walk/PagemapEntry.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
-#include "platform/linux/walk/SmapsOfProcess.h"
+#include "platform/linux/pages/PageSource.h"
+#include "platform/linux/pages/PagemapEntry.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
+#include "platform/linux/pages/SmapsOfProcess.h"
 
 #include <algorithm>
 #include <cerrno>

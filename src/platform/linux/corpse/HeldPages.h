@@ -9,7 +9,7 @@
 #include "platform/kern_return.h"
 #include "platform/linux/families/SharedParts.h"
 #include "platform/linux/families/SharingSets.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <cstddef>
 #include <cstdint>

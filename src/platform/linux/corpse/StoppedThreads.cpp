@@ -2,16 +2,14 @@
 
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
-#include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/machine/ProcessStat.h"
 
-#include <dirent.h>
 #include <sys/ptrace.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <chrono>
 #include <cstring>
 #include <memory>
@@ -36,17 +34,7 @@ std::string threadFolder(std::int32_t pid, std::int32_t thread) {
 }
 
 std::vector<std::int32_t> listThreads(std::int32_t pid) {
-    const std::unique_ptr<DIR, int (*)(DIR*)> folder(opendir((processFolder(pid) + "/task").c_str()),
-                                                     closedir);
-    std::vector<std::int32_t> threads;
-    while (const dirent* entry = folder ? readdir(folder.get()) : nullptr) {
-        std::int32_t id = 0;
-        const char* const end = entry->d_name + std::strlen(entry->d_name);
-        if (std::from_chars(entry->d_name, end, id).ptr == end) {
-            threads.push_back(id);
-        }
-    }
-    return threads;
+    return listNumbered(processFolder(pid) + "/task").value_or(std::vector<std::int32_t>());
 }
 
 /// The state of the thread, as a letter; that of one that has ended when it is not listed.

@@ -6,7 +6,7 @@
 
 #pragma once
 
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <cstddef>
 #include <cstdint>

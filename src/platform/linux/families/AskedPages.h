@@ -6,7 +6,7 @@
 
 #pragma once
 
-#include "platform/linux/walk/PageSource.h"
+#include "platform/linux/pages/PageSource.h"
 
 #include <cstddef>
 #include <cstdint>

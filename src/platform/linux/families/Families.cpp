@@ -1,5 +1,6 @@
 #include "platform/linux/families/Families.h"
 
+#include "platform/linux/io/Gather.h"
 #include "platform/linux/objects/ObjectId.h"
 
 #include <algorithm>
@@ -31,28 +32,35 @@ struct Family {
     std::vector<AddressSpace> spaces;    // once the scan is done
 };
 
-struct FamilyTable {
+/// The address spaces to which there are rights.
+struct SpaceTable {
     std::mutex mutex;
     std::map<FamilyKey, Relatives> relatives;
-    bool isGathering = false;
+};
+
+SpaceTable& spaceTable() {
+    static SpaceTable table;
+    return table;
+}
+
+/// The families of one gather.
+struct FamilyTable {
+    std::mutex mutex;
     bool isPrepared = false;
     // The random bytes of an exec tell programs apart whose layout is fixed; zeros for all others.
     std::map<std::pair<FamilyKey, std::array<std::uint64_t, 2>>, Family> families;
     std::map<std::int32_t, Family*> familyOfPid;
 };
 
-FamilyTable& familyTable() {
-    static FamilyTable table;
-    return table;
-}
-
 bool isBefore(const MemberIdentity& a, const MemberIdentity& b) { return a.pid < b.pid; }
 
 /// Finds the families of two address spaces and more among all tasks.
 void prepare(FamilyTable& table) {
     table.isPrepared = true;
-    for (const auto& [key, relatives] : table.relatives) {
-        if (relatives.size() < 2) {
+    SpaceTable& spaces = spaceTable();
+    const std::scoped_lock lock(spaces.mutex);
+    for (const auto& [key, relatives] : spaces.relatives) {
+        if (relatives.size() < 2 || !key.isKnown()) {
             continue;
         }
         for (const Tenants& tenants : relatives) {
@@ -68,7 +76,7 @@ void prepare(FamilyTable& table) {
     for (auto& [key, family] : table.families) {
         std::sort(family.members.begin(), family.members.end(), isBefore);
         for (const MemberIdentity& member : family.members) {
-            const Relatives& relatives = table.relatives[key.first];
+            const Relatives& relatives = spaces.relatives[key.first];
             const auto tenants = std::find_if(relatives.begin(), relatives.end(), [&](const Tenants& each) {
                 return each.tasks.front().pid == member.pid;
             });
@@ -81,12 +89,12 @@ void prepare(FamilyTable& table) {
 } // namespace
 
 AddressSpaceOwner enterAddressSpace(const FamilyKey& key, MemberIdentity task) {
-    if (!key.isKnown()) {
-        return std::make_shared<MemberIdentity>(task);
-    }
-    FamilyTable& table = familyTable();
+    SpaceTable& table = spaceTable();
     const std::scoped_lock lock(table.mutex);
     Relatives& relatives = table.relatives[key];
+    if (!key.isKnown()) {
+        return relatives.emplace_back(Tenants{{task}, std::make_shared<MemberIdentity>(task)}).owner;
+    }
     std::size_t low = 0;
     std::size_t high = relatives.size();
     while (low < high) {
@@ -109,12 +117,12 @@ AddressSpaceOwner enterAddressSpace(const FamilyKey& key, MemberIdentity task) {
 }
 
 MemberIdentity identityOf(const AddressSpaceOwner& owner) {
-    const std::scoped_lock lock(familyTable().mutex);
+    const std::scoped_lock lock(spaceTable().mutex);
     return *owner;
 }
 
 void leaveAddressSpace(const FamilyKey& key, MemberIdentity task) {
-    FamilyTable& table = familyTable();
+    SpaceTable& table = spaceTable();
     const std::scoped_lock lock(table.mutex);
     const auto found = table.relatives.find(key);
     if (found == table.relatives.end()) {
@@ -137,8 +145,22 @@ void leaveAddressSpace(const FamilyKey& key, MemberIdentity task) {
     }
 }
 
+std::map<std::int32_t, FamilyKey> enteredProcesses() {
+    SpaceTable& table = spaceTable();
+    const std::scoped_lock lock(table.mutex);
+    std::map<std::int32_t, FamilyKey> processes;
+    for (const auto& [key, relatives] : table.relatives) {
+        for (const Tenants& tenants : relatives) {
+            for (const MemberIdentity& task : tenants.tasks) {
+                processes.emplace(task.pid, key);
+            }
+        }
+    }
+    return processes;
+}
+
 std::size_t countRelatives(const FamilyKey& key) {
-    FamilyTable& table = familyTable();
+    SpaceTable& table = spaceTable();
     const std::scoped_lock lock(table.mutex);
     const auto found = table.relatives.find(key);
     std::size_t count = 0;
@@ -153,11 +175,12 @@ std::size_t countRelatives(const FamilyKey& key) {
 }
 
 std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity owner) {
-    FamilyTable& table = familyTable();
-    std::unique_lock lock(table.mutex);
-    if (!table.isGathering || !key.isKnown()) {
+    FamilyTable* const gathered = key.isKnown() ? Gather::table<FamilyTable>() : nullptr;
+    if (gathered == nullptr) {
         return std::nullopt;
     }
+    FamilyTable& table = *gathered;
+    std::unique_lock lock(table.mutex);
     if (!table.isPrepared) {
         prepare(table);
     }
@@ -182,21 +205,6 @@ std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity
         return std::nullopt;
     }
     return --own.readers[index] == 0 ? std::move(space) : space;
-}
-
-void beginFamilies() {
-    FamilyTable& table = familyTable();
-    const std::scoped_lock lock(table.mutex);
-    table.isGathering = true;
-}
-
-void endFamilies() {
-    FamilyTable& table = familyTable();
-    const std::scoped_lock lock(table.mutex);
-    table.isGathering = false;
-    table.isPrepared = false;
-    table.families.clear();
-    table.familyOfPid.clear();
 }
 
 } // namespace tally::platform

@@ -9,6 +9,8 @@
 #include "platform/linux/families/FamilyKey.h"
 #include "platform/linux/families/FamilyScan.h"
 
+#include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 
@@ -19,6 +21,7 @@ namespace tally::platform {
 using AddressSpaceOwner = std::shared_ptr<const MemberIdentity>;
 
 /// Enters a task to which a right was made, and with it every relative that shares its address space whole.
+/// Nothing is known of the relatives of a task without a known key.
 AddressSpaceOwner enterAddressSpace(const FamilyKey& key, MemberIdentity task);
 
 MemberIdentity identityOf(const AddressSpaceOwner& owner);
@@ -26,15 +29,14 @@ MemberIdentity identityOf(const AddressSpaceOwner& owner);
 /// Takes back what enterAddressSpace entered.
 void leaveAddressSpace(const FamilyKey& key, MemberIdentity task);
 
+/// The processes to which there are rights, with the keys of their families.
+std::map<std::int32_t, FamilyKey> enteredProcesses();
+
 /// How many processes to which there are rights, be it several, descend from the exec of `key`.
 std::size_t countRelatives(const FamilyKey& key);
 
 /// The address space of the process that `owner` stands for, read together with its relatives. Absent when it
 /// has none among the tasks, when no gather is under way, or when it could not be read with them.
 std::optional<AddressSpace> takeFamilySpace(const FamilyKey& key, MemberIdentity owner);
-
-/// Begins and ends the gather for which families are found.
-void beginFamilies();
-void endFamilies();
 
 } // namespace tally::platform

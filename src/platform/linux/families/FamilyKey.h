@@ -6,7 +6,7 @@
 
 #pragma once
 
-#include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/machine/ProcessStat.h"
 
 #include <array>
 #include <compare>

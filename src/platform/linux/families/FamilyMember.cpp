@@ -1,7 +1,7 @@
 #include "platform/linux/families/FamilyMember.h"
 
-#include "platform/linux/walk/PageScan.h"
-#include "platform/linux/walk/PagemapEntry.h"
+#include "platform/linux/pages/PageScan.h"
+#include "platform/linux/pages/PagemapEntry.h"
 
 #include <algorithm>
 #include <cerrno>

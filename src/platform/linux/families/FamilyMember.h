@@ -13,11 +13,11 @@
 #include "platform/linux/families/AskedPages.h"
 #include "platform/linux/families/SharedParts.h"
 #include "platform/linux/families/SharingSets.h"
-#include "platform/linux/walk/Mapping.h"
-#include "platform/linux/walk/PageSource.h"
-#include "platform/linux/walk/PageStates.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
-#include "platform/linux/walk/SmapsOfProcess.h"
+#include "platform/linux/pages/Mapping.h"
+#include "platform/linux/pages/PageSource.h"
+#include "platform/linux/pages/PageStates.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
+#include "platform/linux/pages/SmapsOfProcess.h"
 
 #include <array>
 #include <atomic>

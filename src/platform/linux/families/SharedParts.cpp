@@ -1,7 +1,7 @@
 #include "platform/linux/families/SharedParts.h"
 
 #include "platform/linux/objects/ObjectId.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <algorithm>
 #include <unordered_map>

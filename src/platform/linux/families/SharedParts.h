@@ -9,6 +9,7 @@
 
 #include "platform/linux/families/AddressSlots.h"
 #include "platform/linux/families/SharingSets.h"
+#include "platform/linux/machine/MemberIdentity.h"
 
 #include <cstddef>
 #include <cstdint>
@@ -16,12 +17,6 @@
 #include <vector>
 
 namespace tally::platform {
-
-/// Who a member of a family is.
-struct MemberIdentity {
-    std::int32_t pid = 0;
-    std::uint64_t startTicks = 0;
-};
 
 /// What one member holds of one shared object behind one of its mappings.
 struct SharedPart {

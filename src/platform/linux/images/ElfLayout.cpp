@@ -1,7 +1,7 @@
 #include "platform/linux/images/ElfLayout.h"
 
 #include "platform/linux/io/SystemFiles.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <gelf.h>
 #include <libelf.h>

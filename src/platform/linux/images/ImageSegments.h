@@ -6,7 +6,7 @@
 #pragma once
 
 #include "platform/linux/images/ElfLayout.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 #include "platform/runekit.h"
 
 #include <cstdint>

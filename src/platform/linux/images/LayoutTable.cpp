@@ -1,9 +1,9 @@
 #include "platform/linux/images/LayoutTable.h"
 
 #include "base/Format.h"
-#include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/objects/FileInquiry.h"
 #include "platform/linux/objects/MapFiles.h"
 
 #include <sys/stat.h>

@@ -4,7 +4,7 @@
 
 #include "platform/linux/images/ElfLayout.h"
 #include "platform/linux/objects/Backing.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <memory>
 #include <string>

@@ -1,15 +1,9 @@
-// The images of a task: the ELF files among its mappings, and the pages of code that the kernel gives it.
-
 #include "platform/linux/images/SymbolOwners.h"
 
-#include "platform/linux/corpse/Corpse.h"
 #include "platform/linux/images/ImageSegments.h"
 #include "platform/linux/images/LayoutTable.h"
-#include "platform/linux/io/Notes.h"
 #include "platform/linux/objects/Backing.h"
 #include "platform/linux/objects/ObjectId.h"
-#include "platform/linux/walk/Task.h"
-#include "platform/runekit.h"
 
 #include <algorithm>
 #include <map>
@@ -67,27 +61,5 @@ std::vector<RKSymbolOwner> symbolOwnersOf(std::span<const Mapping> mappings, con
     }
     return owners;
 }
-
-void RKForeachSymbolOwner(mach_port_t port, const std::function<void(const RKSymbolOwner&)>& handler) {
-    const std::shared_ptr<Task> task = taskOfPort(port);
-    if (task && task->corpse() != nullptr) {
-        std::ranges::for_each(task->corpse()->images(), handler);
-        return;
-    }
-    kern_return_t status = KERN_SUCCESS;
-    const Walk* walk = task ? task->walk(&status) : nullptr;
-    if (walk == nullptr) {
-        return; // the walk of the regions meets that too, and reports it
-    }
-    std::vector<std::string> notes;
-    {
-        const NoteTaker taker(notes);
-        std::ranges::for_each(symbolOwnersOf(walk->mappings(), walk->folder()), handler);
-    }
-    task->addNotices(std::move(notes));
-}
-
-// The kernel lists files by the paths that they were found at in the end, as the task sees them.
-std::string RKResolvedPath(mach_port_t /*task*/, std::string_view path) { return std::string(path); }
 
 } // namespace tally::platform

@@ -2,12 +2,16 @@
 
 #include "platform/linux/io/Notes.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/resource.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <charconv>
+#include <cstring>
+#include <memory>
 
 namespace tally::platform {
 
@@ -147,6 +151,28 @@ std::optional<std::string> readSystemLink(const std::string& path) {
         }
         target.resize(target.size() * 2);
     }
+}
+
+std::optional<std::vector<std::int32_t>> listNumbered(const std::string& path) {
+    const std::unique_ptr<DIR, int (*)(DIR*)> folder(opendir(path.c_str()), closedir);
+    if (!folder) {
+        return std::nullopt;
+    }
+    std::vector<std::int32_t> numbers;
+    errno = 0; // by which a failure differs from the end
+    while (const dirent* entry = readdir(folder.get())) {
+        const char* const end = entry->d_name + std::strlen(entry->d_name);
+        std::int32_t number = 0;
+        const auto result = std::from_chars(entry->d_name, end, number);
+        if (result.ec == std::errc() && result.ptr == end) {
+            numbers.push_back(number);
+        }
+    }
+    if (errno != 0) {
+        return std::nullopt;
+    }
+    std::sort(numbers.begin(), numbers.end());
+    return numbers;
 }
 
 } // namespace tally::platform

@@ -14,6 +14,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace tally::platform {
 
@@ -48,6 +49,10 @@ std::optional<std::string> readSystemFile(const std::string& path);
 /// The same for a file that the kernel makes as one record, as it does those that tell of a whole process:
 /// what the first read gives is all, unless it fills the buffer.
 std::optional<std::string> readSystemRecord(const std::string& path);
+
+/// The entries of the folder at `path` whose names are numbers, in rising order; absent on failure, with
+/// errno.
+std::optional<std::vector<std::int32_t>> listNumbered(const std::string& path);
 
 /// Makes room for `count` more descriptors than are usual; but for root, as far as the hard limit goes.
 void allowDescriptors(std::size_t count);

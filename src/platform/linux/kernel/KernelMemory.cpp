@@ -7,11 +7,11 @@
 // is shown as clean only.
 
 #include "platform/bsd_process.h"
+#include "platform/linux/io/Pages.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/kernel/KernelTexts.h"
-#include "platform/linux/processes/Ledgers.h"
-#include "platform/linux/walk/Mapping.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
+#include "platform/linux/machine/Charges.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
 #include "platform/mach_kernel_memory.h"
 
 #include <algorithm>

@@ -3,6 +3,7 @@
 #include "platform/linux/objects/FileSystems.h"
 #include "platform/linux/objects/FilesAhead.h"
 #include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
 
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -51,7 +52,7 @@ BackingObject backingOf(const Mapping& mapping, const std::string& folder, const
             return *known;
         }
     }
-    object.device = deviceOf(mapping);
+    object.device = mapping.device();
     object.inode = mapping.inode;
     const FileSystemKind system = kindOfFileSystem(mapping, folder, descriptor);
     const bool internal = mapping.deviceMajor == 0 &&

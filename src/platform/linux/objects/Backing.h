@@ -1,33 +1,15 @@
-// What stands behind a mapping.
+// Finds out what stands behind a mapping.
 
 #pragma once
 
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/objects/BackingObject.h"
+#include "platform/linux/pages/Mapping.h"
 
-#include <cstdint>
 #include <string>
 
 namespace tally::platform {
 
-enum class Backing : std::uint8_t {
-    anonymous,    // private memory of the task
-    special,      // the kernel's own pages: [vdso], [vvar]
-    sharedMemory, // tmpfs files, named or deleted, memfd, SysV segments, shared anonymous memory
-    hugetlb,      // pages of the hugetlb pool
-    file,         // any other regular file
-    device,       // a device's memory, or what a driver shows
-};
-
-/// What a mapping that is listed in the process folder `folder` shows, and how its object is told from
-/// others.
-struct BackingObject {
-    Backing backing = Backing::anonymous;
-    bool hasName = false; // a file that a path leads, or led, to
-    std::uint64_t device = 0;
-    std::uint64_t inode = 0;
-    bool isSysV = false; // SysV segments and memfds share one numbering
-};
-
+/// What a mapping that is listed in the process folder `folder` shows.
 /// @param descriptor for a file that the process has open instead of mapped: the path of its descriptor.
 BackingObject backingOf(const Mapping& mapping, const std::string& folder,
                         const std::string& descriptor = "");

@@ -1,10 +1,10 @@
 #include "platform/linux/objects/FileSystems.h"
 
-#include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
+#include "platform/linux/objects/FileInquiry.h"
 #include "platform/linux/objects/FilesAhead.h"
-#include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
 
 #include <linux/magic.h>
 
@@ -74,7 +74,7 @@ FileSystem fileSystemOfFile(const Mapping& mapping, const std::string& path) {
         return {FileSystemKind::sharedMemory, true};
     }
     const std::optional<FileAnswer> file =
-        FilesAhead::ofThisThread() == nullptr ? inquire(deviceOf(mapping), path) : std::nullopt;
+        FilesAhead::ofThisThread() == nullptr ? inquire(mapping.device(), path) : std::nullopt;
     if (file) {
         switch (file->fileSystemType) {
         case TMPFS_MAGIC:
@@ -104,7 +104,7 @@ FileSystemTable& fileSystemTable() {
 FileSystem fileSystemOf(const Mapping& mapping, const std::string& folder, const std::string& descriptor) {
     FileSystemTable& table = fileSystemTable();
     const std::scoped_lock lock(table.mutex);
-    const auto found = table.byDevice.find(deviceOf(mapping));
+    const auto found = table.byDevice.find(mapping.device());
     if (found != table.byDevice.end()) {
         return found->second;
     }
@@ -117,14 +117,10 @@ FileSystem fileSystemOf(const Mapping& mapping, const std::string& folder, const
     if (!system) {
         system = fileSystemOfFile(mapping, descriptor.empty() ? mapFilePath(folder, mapping) : descriptor);
     }
-    return table.byDevice[deviceOf(mapping)] = *system;
+    return table.byDevice[mapping.device()] = *system;
 }
 
 } // namespace
-
-std::uint64_t deviceOf(const Mapping& mapping) {
-    return std::uint64_t{mapping.deviceMajor} << 32 | mapping.deviceMinor;
-}
 
 FileSystemKind kindOfFileSystem(const Mapping& mapping, const std::string& folder,
                                 const std::string& descriptor) {

@@ -3,7 +3,7 @@
 
 #pragma once
 
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <cstdint>
 #include <string>
@@ -20,9 +20,6 @@ enum class FileSystemKind : std::uint8_t {
 
 inline constexpr std::uint32_t internalMount =
     1; // 00:01, the kernel's own tmpfs: memfds, SysV segments, shared memory
-
-/// The device of a mapping as one number.
-std::uint64_t deviceOf(const Mapping& mapping);
 
 /// The kind of the file system that `mapping` of the process folder `folder` shows a file of.
 /// @param descriptor for a file that the process has open instead of mapped: the path of its descriptor.

@@ -1,9 +1,5 @@
 #include "platform/linux/objects/FilesAhead.h"
 
-#include "platform/linux/gather/MachineState.h"
-#include "platform/linux/objects/FileSystems.h"
-#include "platform/linux/objects/MapFiles.h"
-
 #include <fcntl.h>
 
 #include <utility>
@@ -12,35 +8,12 @@ namespace tally::platform {
 
 namespace {
 
-constexpr std::size_t mostOpened = 256; // smaps stands in for the others
-
 thread_local const FilesAhead* used = nullptr;
 
 } // namespace
 
 FilesAhead::Key FilesAhead::keyOf(const Mapping& mapping) {
-    return {deviceOf(mapping), mapping.inode, mapping.name};
-}
-
-void FilesAhead::ask(const std::string& folder, std::span<const Mapping> mappings, bool objectView) {
-    const bool swapInUse = machineState().swapInUse;
-    std::size_t opened = 0;
-    for (const Mapping& mapping : mappings) {
-        if (!mapping.isFileBacked()) {
-            continue;
-        }
-        Known& known = known_[keyOf(mapping)];
-        if (known.object.backing == Backing::anonymous) { // new
-            known.object = backingOf(mapping, folder);
-        }
-        const Backing backing = known.object.backing;
-        const bool isAsked = (backing == Backing::sharedMemory && (objectView || swapInUse)) ||
-                             (backing == Backing::file && (objectView || mapping.shared));
-        if (isAsked && !known.file.isOpen() && opened < mostOpened) {
-            known.file = openForPageStates(folder, mapping);
-            ++opened;
-        }
-    }
+    return {mapping.device(), mapping.inode, mapping.name};
 }
 
 const BackingObject* FilesAhead::objectOf(const Mapping& mapping) const {

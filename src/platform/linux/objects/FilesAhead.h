@@ -6,12 +6,11 @@
 #pragma once
 
 #include "platform/linux/io/Descriptor.h"
-#include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/BackingObject.h"
+#include "platform/linux/pages/Mapping.h"
 
-#include <cstddef>
 #include <cstdint>
 #include <map>
-#include <span>
 #include <string>
 #include <tuple>
 
@@ -19,9 +18,13 @@ namespace tally::platform {
 
 class FilesAhead {
   public:
-    /// Asks the files behind the mappings of the process folder `folder`; those whose page cache a walk would
-    /// ask are opened. @param objectView whether that is to be one as the VM objects see it.
-    void ask(const std::string& folder, std::span<const Mapping> mappings, bool objectView);
+    struct Known {
+        BackingObject object; // anonymous at first, as no file is
+        Descriptor file;      // where its page cache will be asked
+    };
+
+    /// What is known of the file behind the mapping, to be filled in.
+    Known& enter(const Mapping& mapping) { return known_[keyOf(mapping)]; }
 
     /// What the mapping shows; null when it was not asked for.
     const BackingObject* objectOf(const Mapping& mapping) const;
@@ -41,10 +44,6 @@ class FilesAhead {
     };
 
   private:
-    struct Known {
-        BackingObject object;
-        Descriptor file;
-    };
     using Key = std::tuple<std::uint64_t, std::uint64_t, std::string>; // device, inode, name
 
     static Key keyOf(const Mapping& mapping);

@@ -1,4 +1,5 @@
 #include "platform/linux/objects/MapFiles.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
 
 #include "base/Format.h"
 #include "platform/linux/io/Notes.h"
@@ -41,11 +42,6 @@ Descriptor openForStates(const std::string& path) {
 }
 
 } // namespace
-
-std::string mapFilePath(const std::string& folder, const Mapping& mapping) {
-    return formatted("%s/map_files/%llx-%llx", folder.c_str(), static_cast<unsigned long long>(mapping.start),
-                     static_cast<unsigned long long>(mapping.end));
-}
 
 Descriptor openRegularFile(const std::string& path) {
     struct stat status {};
@@ -111,7 +107,7 @@ Descriptor openMappedFile(const std::string& folder, const Mapping& mapping) {
 std::optional<FileAnswer> inquireMappedFile(const std::string& folder, const Mapping& mapping) {
     const bool isLocal = isLocalFileSystem(mapping, folder);
     // On the way to a file of a disk can be anybody's mount.
-    const std::uint64_t device = isLocal ? unknownDevice : deviceOf(mapping);
+    const std::uint64_t device = isLocal ? unknownDevice : mapping.device();
     std::optional<FileAnswer> file = inquire(device, mapFilePath(folder, mapping));
     if (file || errno == ETIMEDOUT || !mapping.name.starts_with('/')) {
         return file;

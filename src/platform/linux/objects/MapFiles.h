@@ -6,17 +6,14 @@
 #pragma once
 
 #include "platform/linux/io/Descriptor.h"
-#include "platform/linux/io/FileInquiry.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/objects/FileInquiry.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <cstdint>
 #include <optional>
 #include <string>
 
 namespace tally::platform {
-
-/// The path by which the file behind a mapping of the process folder is reached, whatever its name is.
-std::string mapFilePath(const std::string& folder, const Mapping& mapping);
 
 /// Opens `path` for reading if a regular file is there: opening anything else can wait, or act on a device.
 Descriptor openRegularFile(const std::string& path);

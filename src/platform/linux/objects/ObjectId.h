@@ -4,7 +4,7 @@
 
 #pragma once
 
-#include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/BackingObject.h"
 
 #include <cstdint>
 

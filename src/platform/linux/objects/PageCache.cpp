@@ -1,6 +1,6 @@
 #include "platform/linux/objects/PageCache.h"
 
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <linux/magic.h>
 #include <sys/mman.h>

@@ -1,10 +1,10 @@
 #include "platform/linux/owned/HeldFiles.h"
 
-#include "platform/linux/gather/MachineState.h"
-#include "platform/linux/io/FileInquiry.h"
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
+#include "platform/linux/machine/MachineState.h"
 #include "platform/linux/objects/Backing.h"
+#include "platform/linux/objects/FileInquiry.h"
 #include "platform/linux/objects/MapFiles.h"
 #include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/objects/PageCache.h"
@@ -28,8 +28,6 @@ namespace tally::platform {
 namespace {
 
 constexpr std::uint64_t blockSize = 512;
-
-std::uint64_t wholePages(std::uint64_t size) { return (size + basePage - 1) / basePage * basePage; }
 
 constexpr const char* descriptorsUnread = "Descriptors could not be looked at";
 constexpr const char* memoryLeftOut = "memory that only they keep is left out";

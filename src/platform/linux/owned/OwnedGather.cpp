@@ -1,5 +1,6 @@
 #include "platform/linux/owned/OwnedGather.h"
 
+#include "platform/linux/io/Gather.h"
 #include "platform/linux/io/SystemFiles.h"
 
 #include <ctime>
@@ -25,17 +26,11 @@ SegmentsByCreator readSegments() {
     return segments;
 }
 
-struct OwnedGather {
+struct OwnedTable {
     std::mutex mutex;
-    bool isUnderWay = false;
     std::unordered_map<std::uint64_t, std::int32_t> listedBy; // object id to pid
-    SegmentsByCreator segments;
+    const SegmentsByCreator segments = readSegments();
 };
-
-OwnedGather& ownedGather() {
-    static OwnedGather gather;
-    return gather;
-}
 
 std::int64_t secondsOf(clockid_t clock) {
     timespec now{};
@@ -52,16 +47,18 @@ std::int64_t startTime(std::uint64_t startTicks) {
 } // namespace
 
 bool claimOwnedObject(std::uint64_t objectId, std::int32_t pid) {
-    OwnedGather& gather = ownedGather();
-    const std::scoped_lock lock(gather.mutex);
-    return !gather.isUnderWay || gather.listedBy.try_emplace(objectId, pid).first->second == pid;
+    OwnedTable* const table = Gather::table<OwnedTable>();
+    if (table == nullptr) {
+        return true;
+    }
+    const std::scoped_lock lock(table->mutex);
+    return table->listedBy.try_emplace(objectId, pid).first->second == pid;
 }
 
 std::vector<SysVSegment> segmentsCreatedBy(std::int32_t pid, std::uint64_t startTicks) {
-    OwnedGather& gather = ownedGather();
-    const std::scoped_lock lock(gather.mutex);
-    const SegmentsByCreator read = gather.isUnderWay ? SegmentsByCreator() : readSegments();
-    const auto [first, last] = (gather.isUnderWay ? gather.segments : read).equal_range(pid);
+    const OwnedTable* const table = Gather::table<OwnedTable>();
+    const SegmentsByCreator read = table == nullptr ? readSegments() : SegmentsByCreator();
+    const auto [first, last] = (table == nullptr ? read : table->segments).equal_range(pid);
     std::vector<SysVSegment> segments;
     for (auto at = first; at != last; ++at) {
         constexpr std::int64_t slack = 1;
@@ -70,22 +67,6 @@ std::vector<SysVSegment> segmentsCreatedBy(std::int32_t pid, std::uint64_t start
         }
     }
     return segments;
-}
-
-void beginOwned() {
-    OwnedGather& gather = ownedGather();
-    const std::scoped_lock lock(gather.mutex);
-    gather.isUnderWay = true;
-    gather.listedBy.clear();
-    gather.segments = readSegments();
-}
-
-void endOwned() {
-    OwnedGather& gather = ownedGather();
-    const std::scoped_lock lock(gather.mutex);
-    gather.isUnderWay = false;
-    gather.listedBy.clear();
-    gather.segments.clear();
 }
 
 } // namespace tally::platform

@@ -17,8 +17,4 @@ bool claimOwnedObject(std::uint64_t objectId, std::int32_t pid);
 /// The SysV segments that process `pid`, which started at `startTicks`, has created. Read once per gather.
 std::vector<SysVSegment> segmentsCreatedBy(std::int32_t pid, std::uint64_t startTicks);
 
-/// Begins and ends the gather.
-void beginOwned();
-void endOwned();
-
 } // namespace tally::platform

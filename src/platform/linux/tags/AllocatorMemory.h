@@ -8,8 +8,8 @@
 
 #pragma once
 
-#include "platform/linux/walk/Mapping.h"
-#include "platform/linux/walk/PageStates.h"
+#include "platform/linux/pages/Mapping.h"
+#include "platform/linux/pages/PageStates.h"
 
 #include <cstdint>
 #include <span>

@@ -2,7 +2,7 @@
 
 #pragma once
 
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 namespace tally::platform {
 

@@ -2,7 +2,7 @@
 
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/pages/Mapping.h"
 
 #include <cerrno>
 #include <utility>

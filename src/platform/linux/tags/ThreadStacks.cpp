@@ -3,16 +3,14 @@
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
-#include "platform/linux/processes/ProcessStat.h"
+#include "platform/linux/machine/ProcessStat.h"
 #include "platform/linux/tags/NamelessMemory.h"
 #include "platform/linux/tags/TagTable.h"
-
-#include <dirent.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstddef>
-#include <memory>
+#include <string>
 #include <vector>
 
 namespace tally::platform {
@@ -43,21 +41,15 @@ std::vector<std::uint64_t> stackPointers(const std::string& folder) {
     std::vector<std::uint64_t> pointers;
     // The folder is a thread's own where the first thread has ended.
     const std::string parent = folder.substr(0, folder.find("/task/")) + "/task";
-    const std::unique_ptr<DIR, int (*)(DIR*)> threads(opendir(parent.c_str()), closedir);
-    for (std::size_t asked = 0; threads && asked < mostThreadsAsked;) {
-        const dirent* thread = readdir(threads.get());
-        if (thread == nullptr) {
-            break;
+    std::vector<std::int32_t> threads = listNumbered(parent).value_or(std::vector<std::int32_t>());
+    threads.resize(std::min(threads.size(), mostThreadsAsked));
+    for (const std::int32_t thread : threads) {
+        const auto text = readSystemRecord(parent + "/" + std::to_string(thread) + "/syscall");
+        if (!text) {
+            noteRefusal("Stack pointers could not be read", errno, stacksUnnamed);
         }
-        if (thread->d_name[0] != '.') {
-            ++asked;
-            const auto text = readSystemRecord(parent + "/" + thread->d_name + "/syscall");
-            if (!text) {
-                noteRefusal("Stack pointers could not be read", errno, stacksUnnamed);
-            }
-            if (const auto pointer = decodeStackPointer(text.value_or(""))) {
-                pointers.push_back(*pointer);
-            }
+        if (const auto pointer = decodeStackPointer(text.value_or(""))) {
+            pointers.push_back(*pointer);
         }
     }
     std::sort(pointers.begin(), pointers.end());

@@ -1,18 +1,18 @@
 #include "platform/linux/walk/Walk.h"
 
 #include "platform/linux/families/Families.h"
-#include "platform/linux/gather/LazyFree.h"
-#include "platform/linux/gather/MachineState.h"
 #include "platform/linux/io/MachineNotices.h"
 #include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/io/TextScan.h"
-#include "platform/linux/pieces/PieceBuilder.h"
-#include "platform/linux/pieces/SharedPieces.h"
-#include "platform/linux/processes/ProcessStat.h"
-#include "platform/linux/walk/PageSource.h"
-#include "platform/linux/walk/ProcessMemoryFiles.h"
-#include "platform/linux/walk/SmapsOfProcess.h"
+#include "platform/linux/machine/MachineState.h"
+#include "platform/linux/machine/ProcessStat.h"
+#include "platform/linux/pages/PageSource.h"
+#include "platform/linux/pages/ProcessMemoryFiles.h"
+#include "platform/linux/pages/SmapsOfProcess.h"
+#include "platform/linux/walk/LazyFree.h"
+#include "platform/linux/walk/PieceBuilder.h"
+#include "platform/linux/walk/SharedPieces.h"
 
 #include <algorithm>
 #include <array>

@@ -8,9 +8,10 @@
 #include "platform/kern_return.h"
 #include "platform/linux/families/FamilyKey.h"
 #include "platform/linux/families/SharedParts.h"
-#include "platform/linux/pieces/Piece.h"
-#include "platform/linux/processes/ProcessStat.h"
-#include "platform/linux/walk/Mapping.h"
+#include "platform/linux/machine/Charges.h"
+#include "platform/linux/machine/ProcessStat.h"
+#include "platform/linux/pages/Mapping.h"
+#include "platform/linux/walk/Piece.h"
 
 #include <array>
 #include <cstdint>
