@@ -7,8 +7,10 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <span>
 #include <string>
+#include <vector>
 
 namespace tally::platform {
 
@@ -110,11 +112,24 @@ std::ptrdiff_t sysctl_procargs2(std::int32_t pid, std::span<char> area);
 int sysctlbyname_read(const char* name, std::int32_t* value);
 int sysctlbyname_write(const char* name, std::int32_t value);
 
-/// The list of what a task owns ("vm.get_owned_vmobjects"): a 64-bit count N, then N records of seven 64-bit
-/// words. With no room `*length` becomes the size that is needed; otherwise the bytes that were filled in, at
-/// most `reply.size()` of them.
-/// @return 0, or -1 with errno.
-int sysctl_owned_vmobjects(std::uint32_t task, std::span<std::byte> reply, std::size_t* length);
+/// An object that a task keeps alive, whether it maps it or not. Sizes in bytes.
+struct owned_vmobject {
+    std::uint64_t id = 0;
+    std::uint64_t virtualSize = 0;
+    std::uint64_t residentSize = 0;
+    std::uint64_t wiredSize = 0;
+    std::uint64_t reusableSize = 0;
+    std::uint64_t compressedSize = 0; // swapped out
+    bool noTally = false;             // somebody else is charged for it
+    std::uint8_t ledgerTag = 0;       // 0-7
+    std::uint8_t purgeable = 0;       // VM_PURGABLE_...
+
+    bool holdsMemory() const { return residentSize + compressedSize != 0; }
+};
+
+/// What a task owns ("vm.get_owned_vmobjects"). @return absent with errno; ENOENT where there is no such
+/// list.
+std::optional<std::vector<owned_vmobject>> sysctl_owned_vmobjects(std::uint32_t task);
 
 /// Page size of the kernel in bytes.
 std::uint64_t vm_kernel_page_size();

@@ -1,8 +1,6 @@
 #include "process/TLProcess.h"
 
 #include "base/Format.h"
-#include "process/TLKernelProcess.h"
-#include "process/TLUserProcess.h"
 #include "vm/PhysTallyCollection.h"
 
 #include <algorithm>
@@ -10,30 +8,6 @@
 namespace tally {
 
 using namespace platform;
-
-std::shared_ptr<TLProcess> TLProcess::processWithPid(std::int32_t pid, kern_return_t* refusal) {
-    if (refusal != nullptr) {
-        *refusal = KERN_SUCCESS;
-    }
-    proc_bsdinfo info;
-    return proc_pidinfo(pid, &info) == sizeof info ? processWithBsdInfo(info, refusal) : nullptr;
-}
-
-std::shared_ptr<TLProcess> TLProcess::processWithBsdInfo(const proc_bsdinfo& info, kern_return_t* refusal) {
-    if (refusal != nullptr) {
-        *refusal = KERN_SUCCESS;
-    }
-    std::shared_ptr<TLProcess> process;
-    if ((info.pbi_flags & PROC_FLAG_SYSTEM) != 0) {
-        process = std::make_shared<TLKernelProcess>();
-    } else {
-        process = std::make_shared<TLUserProcess>();
-    }
-    process->refusal_ = refusal;
-    const bool isReadable = process->initWithBsdInfo(info);
-    process->refusal_ = nullptr;
-    return isReadable ? process : nullptr;
-}
 
 bool TLProcess::initWithBsdInfo(const proc_bsdinfo& info) {
     pid_ = static_cast<std::int32_t>(info.pbi_pid);

@@ -5,6 +5,7 @@
 #include "platform/gather.h"
 #include "process/LedgerLayout.h"
 #include "vm/ImageData.h"
+#include "vm/OwnedObjects.h"
 #include "vm/PageClassification.h"
 #include "vm/RegionRecorder.h"
 #include "vm/RegionWalk.h"

@@ -6,46 +6,23 @@
 
 #pragma once
 
-#include "base/IntegerTable.h"
 #include "base/Name.h"
+#include "vm/WalkedTask.h"
 
-#include <cstdint>
 #include <optional>
 
 namespace tally {
-
-struct TLMemoryRegion;
-class WalkedTask;
-
-/// One record of the kernel's reply (56 bytes); sizes in bytes.
-struct OwnedVmObject {
-    std::uint64_t objectId = 0;
-    std::uint64_t virtualSize = 0;
-    std::uint64_t residentSize = 0;
-    std::uint64_t wiredSize = 0;
-    std::uint64_t reusableSize = 0;
-    std::uint64_t compressedSize = 0;
-    std::uint64_t flags = 0;
-
-    bool isNotCharged() const { return (flags & 1) != 0; }
-    std::uint64_t ledgerTag() const { return flags >> 1 & 7; }
-    int purgeState() const { return static_cast<int>(flags >> 4 & 3); }
-};
-static_assert(sizeof(OwnedVmObject) == 56);
-
-/// By object id.
-using OwnedVmObjects = IntegerTable<OwnedVmObject>;
 
 /// The objects that `task` owns; absent when the accounting switch is off or the kernel does not list them.
 std::optional<OwnedVmObjects> gatherOwnedVmObjects(WalkedTask& task);
 
 /// Marks `region` as the object's and gives it the sizes that the owner is charged.
-void chargeOwnedObject(TLMemoryRegion& region, const OwnedVmObject& object);
+void chargeOwnedObject(TLMemoryRegion& region, const platform::owned_vmobject& object);
 
 /// `tagName`, with the name of the object's ledger tag in parentheses when that has one.
-Name nameWithLedgerTag(Name tagName, const OwnedVmObject& object);
+Name nameWithLedgerTag(Name tagName, const platform::owned_vmobject& object);
 
 /// The region of an object that no mapping of its owner shows.
-TLMemoryRegion unmappedRegionForOwnedObject(const OwnedVmObject& object);
+TLMemoryRegion unmappedRegionForOwnedObject(const platform::owned_vmobject& object);
 
 } // namespace tally

@@ -1,6 +1,7 @@
 #include "vm/RegionRecorder.h"
 
 #include "base/Format.h"
+#include "vm/OwnedObjects.h"
 #include "vm/SharedCachePieces.h"
 #include "vm/TagNames.h"
 
@@ -163,12 +164,12 @@ void RegionRecorder::matchOwnedObject(TLMemoryRegion& region, const EnumeratedRe
 
 void RegionRecorder::recordUnmappedOwnedObjects() {
     if (const auto& owned = task_.walk.ownedVmObjects) {
-        std::vector<const OwnedVmObject*> records;
+        std::vector<const owned_vmobject*> records;
         for (const auto& [id, record] : *owned) {
             records.push_back(&record);
         }
-        std::ranges::sort(records, std::less(), &OwnedVmObject::objectId); // the table has no order
-        for (const OwnedVmObject* record : records) {
+        std::ranges::sort(records, std::less(), &owned_vmobject::id); // the table has no order
+        for (const owned_vmobject* record : records) {
             task_.walk.regions.push_back(unmappedRegionForOwnedObject(*record));
         }
     }

@@ -81,7 +81,7 @@ void TLMemoryObject::addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t
 void TLMemoryObject::finalizeSizes(bool breakDown) {
     tl_assert(!accurateSizes_, "!self.accurateSizes");
     const TLRangeSizes united = rangeList_              ? rangeList_->sumSizes()
-                                : onlyRange_ != nullptr ? sizesOf(*onlyRange_)
+                                : onlyRange_ != nullptr ? onlyRange_->sizes()
                                                         : TLRangeSizes();
     onlyRange_ = nullptr;
     if (breakDown) {

@@ -54,4 +54,21 @@ void TLMemoryRegion::addSubrange(std::uint64_t subrangeStart, std::uint64_t subr
     subrangeList->addSubrange(subrangeStart, subrangeSize, pageSize, sizes);
 }
 
+TLRangeSizes TLMemoryRegion::sizes() const {
+    return {.dirty = dirtySize,
+            .swapped = swappedSize,
+            .clean = cleanNonSpecSize,
+            .reclaimable = reclaimableSize,
+            .wired = wired ? size : 0};
+}
+
+// Beside the region rather than in the list, which knows nothing of regions.
+void TLRangeList::addRegionRange(const TLMemoryRegion& region, std::uint64_t pageSize) {
+    if (region.subrangeList) {
+        mergeRangeList(*region.subrangeList, pageSize);
+        return;
+    }
+    addSubrange(region.offset, region.size, pageSize, region.sizes());
+}
+
 } // namespace tally

@@ -63,6 +63,8 @@ struct TLMemoryRegion {
     std::uint64_t end() const { return start == TLNotSet ? TLNotSet : start + size; }
     /// Sets `size`; an end below the start stops the program.
     void setEnd(std::uint64_t end);
+    /// Its sizes as one range.
+    TLRangeSizes sizes() const;
     /// `name`, and after a blank `detailedName` when that has characters.
     std::string fullName() const;
     /// Whether several processes may see different parts of the mapping.

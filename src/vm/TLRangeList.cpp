@@ -1,7 +1,6 @@
 #include "vm/TLRangeList.h"
 
 #include "vm/PageRounding.h"
-#include "vm/TLMemoryRegion.h"
 
 #include <algorithm>
 #include <iterator>
@@ -33,14 +32,6 @@ TLRangeSizes mergedSizes(const TLRangeSizes& a, const TLRangeSizes& b, std::uint
 }
 
 } // namespace
-
-TLRangeSizes sizesOf(const TLMemoryRegion& region) {
-    return {.dirty = region.dirtySize,
-            .swapped = region.swappedSize,
-            .clean = region.cleanNonSpecSize,
-            .reclaimable = region.reclaimableSize,
-            .wired = region.wired ? region.size : 0};
-}
 
 TLRangeList::~TLRangeList() {
     while (head_) { // one by one: a chain of nodes that free each other would use up the stack
@@ -112,14 +103,6 @@ void TLRangeList::makeIndex() {
     for (TLRangeListNode* node = head_.get(); node != nullptr; node = node->next.get()) {
         index_->emplace_hint(index_->end(), node->start, node);
     }
-}
-
-void TLRangeList::addRegionRange(const TLMemoryRegion& region, std::uint64_t pageSize) {
-    if (region.subrangeList) {
-        mergeRangeList(*region.subrangeList, pageSize);
-        return;
-    }
-    addSubrange(region.offset, region.size, pageSize, sizesOf(region));
 }
 
 void TLRangeList::mergeRangeList(const TLRangeList& other, std::uint64_t pageSize) {

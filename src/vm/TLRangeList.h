@@ -28,9 +28,6 @@ struct TLRangeSizes {
     friend bool operator==(const TLRangeSizes&, const TLRangeSizes&) = default;
 };
 
-/// The sizes of a region that is one range.
-TLRangeSizes sizesOf(const TLMemoryRegion& region);
-
 struct TLRangeListNode {
     std::uint64_t start = 0; // offset in the VM object, bytes
     std::uint64_t size = 0;

@@ -5,10 +5,11 @@
 
 #pragma once
 
+#include "base/IntegerTable.h"
+#include "platform/bsd_process.h"
 #include "platform/kern_return.h"
 #include "platform/mach_vm.h"
 #include "vm/MemoryHolder.h"
-#include "vm/OwnedObjects.h"
 #include "vm/TLImage.h"
 #include "vm/TLMemoryRegion.h"
 #include "vm/TLSharedCache.h"
@@ -22,6 +23,9 @@
 #include <vector>
 
 namespace tally {
+
+/// By object id.
+using OwnedVmObjects = IntegerTable<platform::owned_vmobject>;
 
 /// What exists while a process is gathered and no longer.
 struct WalkState {

@@ -1,11 +1,11 @@
 // The decoders of the kernel's texts, with the odd lines that real machines show.
 
 #include "platform/linux/machine/MachineState.h"
-#include "platform/linux/objects/ObjectId.h"
-#include "platform/linux/walk/CountedPages.h"
-#include "platform/linux/objects/Executable.h"
 #include "platform/linux/machine/ProcessStat.h"
+#include "platform/linux/objects/Executable.h"
+#include "platform/linux/objects/ObjectId.h"
 #include "platform/linux/pages/DecodeMaps.h"
+#include "platform/linux/walk/CountedPages.h"
 
 #include <gtest/gtest.h>
 

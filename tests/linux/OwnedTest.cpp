@@ -29,24 +29,13 @@ namespace {
 
 using test::Puppet;
 
-std::vector<OwnedRecord> ownedBy(std::int32_t pid) {
+std::vector<owned_vmobject> ownedBy(std::int32_t pid) {
     mach_port_t task = MACH_PORT_NULL;
     EXPECT_EQ(task_read_for_pid(pid, &task), KERN_SUCCESS);
     const PortRight right(task);
-    std::size_t length = 0;
-    EXPECT_EQ(sysctl_owned_vmobjects(task, {}, &length), 0);
-    std::vector<std::byte> reply(length + sizeof(OwnedRecord));
-    EXPECT_EQ(sysctl_owned_vmobjects(task, std::span(reply).first(4), &length), 0);
-    EXPECT_EQ(length, 4U);
-    EXPECT_EQ(sysctl_owned_vmobjects(task, reply, &length), 0);
-    std::uint64_t count = 0;
-    std::memcpy(&count, reply.data(), sizeof count);
-    EXPECT_EQ(length, sizeof count + count * sizeof(OwnedRecord));
-    std::vector<OwnedRecord> records(count);
-    for (std::size_t i = 0; i < count; ++i) {
-        std::memcpy(&records[i], &reply[sizeof count + i * sizeof(OwnedRecord)], sizeof(OwnedRecord));
-    }
-    return records;
+    const auto owned = sysctl_owned_vmobjects(task);
+    EXPECT_TRUE(owned);
+    return owned.value_or(std::vector<owned_vmobject>());
 }
 
 /// A file of `size` bytes of which the first `pages` are there.
@@ -95,9 +84,9 @@ TEST(Owned, WhatADescriptorOrASegmentAloneKeepsIsListedToTheByte) {
         expected.insert({2 << 20, 2 << 20, 2 << 20});
     }
     Sizes found;
-    for (const OwnedRecord& r : ownedBy(getpid())) {
+    for (const owned_vmobject& r : ownedBy(getpid())) {
         found.insert({r.virtualSize, r.residentSize, r.wiredSize});
-        EXPECT_EQ(r.flags, OwnedRecord::notPurgeable);
+        EXPECT_EQ(r.purgeable, VM_PURGABLE_DENY);
         EXPECT_EQ(r.reusableSize + r.compressedSize, 0U);
     }
     EXPECT_EQ(segmentsCreatedBy(getpid(), 0).size(), 2U);
@@ -172,28 +161,29 @@ TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
     struct Case {
         std::string link;
         const char* info;
-        std::vector<std::uint64_t> record; // flags, virtual, resident, wired, reusable size; empty: none
+        std::vector<std::uint64_t>
+            record; // 1 for no tally, ledger tag, virtual, resident, wired, reusable size; empty: none
     };
     const Case cases[] = {
         {"/dmabuf:",
          "pos:\t0\nino:\t91\nsize:\t65536\nexp_name:\tsystem\nname:\ta: b\n",
-         {56, 65536, 65536, 0, 0}},
+         {0, 4, 65536, 65536, 0, 0}},
         {"/dmabuf:", "ino:\t92\nsize:\t4096\nexp_name:\tudmabuf\n", {}}, // a memfd has these pages
         {"/dmabuf:", "size:\t4096\n", {}},                               // no telling it from others
         {"/dmabuf:", "ino:\t93\nsize:\tmany\n", {}},
         {card,
          "drm-client-id:\t7\ndrm-total-system0:\t9 MiB\ndrm-shared-system0:\t2048 KiB\ndrm-engine-x:\t1 ns\n"
          "drm-resident-system0:\t5 MiB\ndrm-purgeable-system0:\t4096\ndrm-resident-vram0:\t64 MiB\n",
-         {56, 7 << 20, 3 << 20, 0, 4096}},
+         {0, 4, 7 << 20, 3 << 20, 0, 4096}},
         {card,
          "drm-client-id: 8\ndrm-memory-gtt: 100 KiB\ndrm-memory-cpu: 4 KiB\n",
-         {56, 106496, 106496, 0, 0}},
+         {0, 4, 106496, 106496, 0, 0}},
         {card, "drm-resident-memory: 1 MiB\n", {}}, // of which client?
         {card, "drm-client-id: 9\ndrm-resident-memory: 1 KiB\ndrm-shared-memory: 2 KiB\n", {}},
         {card, "drm-client-id: 9\ndrm-resident-memory: 99999999999999999 GiB\n", {}},
         {"anon_inode:bpf-map",
          "max_entries:\t2\nmemlock:\t36864\nmap_id:\t3\n",
-         {49, 36864, 36864, 36864, 0}},
+         {1, 0, 36864, 36864, 36864, 0}},
         {"anon_inode:[eventfd]", "memlock:\t36864\nmap_id:\t4\n", {}},
         {"/" + std::string(4000, 'x') + " (deleted)", "ino:\t91\nsize:\t65536\n", {}},
     };
@@ -201,13 +191,13 @@ TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
         std::filesystem::create_symlink(c.link, folder.path() + "/fd/3");
         std::ofstream(folder.path() + "/fdinfo/3") << c.info;
         std::vector<std::uint64_t> record;
-        EXPECT_TRUE(forEachHeldObject(folder.path(), [&](const OwnedRecord& r) {
-            record = {r.flags, r.virtualSize, r.residentSize, r.wiredSize, r.reusableSize};
+        EXPECT_TRUE(forEachHeldObject(folder.path(), [&](const owned_vmobject& r) {
+            record = {r.noTally, r.ledgerTag, r.virtualSize, r.residentSize, r.wiredSize, r.reusableSize};
         }));
         EXPECT_EQ(record, c.record) << c.info;
         std::filesystem::remove(folder.path() + "/fd/3");
     }
-    EXPECT_FALSE(forEachHeldObject(folder.path() + "/none", [](const OwnedRecord&) {}));
+    EXPECT_FALSE(forEachHeldObject(folder.path() + "/none", [](const owned_vmobject&) {}));
 }
 
 } // namespace

@@ -137,7 +137,7 @@ class KernelBuilder {
 
     void addOwnedObject(CaseStatement& statement) {
         const auto size = [&](const char* key) { return statement.number(key).value_or(0); };
-        const ScriptedOwnedObject object{
+        const owned_vmobject object{
             .id = size("id"),
             .virtualSize = size("virtual"),
             .residentSize = size("resident"),

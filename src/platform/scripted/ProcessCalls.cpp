@@ -39,20 +39,6 @@ std::string argumentArea(const ScriptedTask& task) {
     return area;
 }
 
-std::vector<std::byte> ownedReply(const ScriptedTask& task) {
-    if (task.ownedReply || task.owned->empty()) {
-        return task.ownedReply.value_or(std::vector<std::byte>());
-    }
-    std::vector<std::uint64_t> words{task.owned->size()};
-    for (const ScriptedOwnedObject& object : *task.owned) {
-        const std::uint64_t flags = (object.noTally ? 1 : 0) | object.ledgerTag << 1 | object.purgeable << 4;
-        words.insert(words.end(), {object.id, object.virtualSize, object.residentSize, object.wiredSize,
-                                   object.reusableSize, object.compressedSize, flags});
-    }
-    const auto bytes = std::as_bytes(std::span(words));
-    return {bytes.begin(), bytes.end()};
-}
-
 } // namespace
 
 int proc_listallpids(std::span<std::int32_t> pids) {
@@ -219,23 +205,14 @@ int sysctlbyname_write(const char* name, std::int32_t value) {
     return 0;
 }
 
-int sysctl_owned_vmobjects(std::uint32_t task, std::span<std::byte> reply, std::size_t* length) {
-    const Answer answer("sysctl_owned_vmobjects", PortName{task}, {reply.size()});
+std::optional<std::vector<owned_vmobject>> sysctl_owned_vmobjects(std::uint32_t task) {
+    const Answer answer("sysctl_owned_vmobjects", PortName{task});
     const ScriptedTask* scripted = answer.taskOfPort(task);
-    if (answer.fault != 0 || scripted == nullptr) {
-        return Answer::refuse(answer.fault != 0 ? answer.fault : ESRCH);
+    if (answer.fault != 0 || scripted == nullptr || !scripted->owned) {
+        errno = answer.fault != 0 ? answer.fault : scripted == nullptr ? ESRCH : ENOENT;
+        return std::nullopt;
     }
-    if (!scripted->owned && !scripted->ownedReply) {
-        return Answer::refuse(ENOENT);
-    }
-    const std::vector<std::byte> whole = ownedReply(*scripted);
-    if (reply.empty()) {
-        *length = whole.size();
-        return 0;
-    }
-    *length = std::min(whole.size(), reply.size());
-    std::copy_n(whole.begin(), *length, reply.begin());
-    return 0;
+    return scripted->owned;
 }
 
 std::uint64_t vm_kernel_page_size() { return Answer("vm_kernel_page_size").kernel.pageSize; }

@@ -11,6 +11,7 @@
 
 #include "platform/clock.h"
 #include "platform/mach_kernel_memory.h"
+#include "platform/scripted/PlatformCalls.h"
 #include "platform/scripted/ScriptedTask.h"
 
 #include <cstdint>
@@ -25,23 +26,7 @@
 
 namespace tally::platform {
 
-/// One call that was made.
-struct CallRecord {
-    std::string name;
-    std::int32_t pid = -1;                // whom it was about; -1: no process
-    std::vector<std::uint64_t> arguments; // its numbers, in the order of the call's parameters
-    std::string text;                     // its string
-
-    friend bool operator==(const CallRecord&, const CallRecord&) = default;
-};
-
-/// Which calls are meant; they are counted from the moment that this is said.
-struct CallSelector {
-    std::uint64_t nth = 1;             // the first one, from 1
-    std::uint64_t times = 1;           // how many in a row
-    std::optional<std::int32_t> pid{}; // only those about this process
-};
-inline constexpr std::uint64_t Always = ~std::uint64_t{0}; // a value of `times`
+struct KernelState;
 
 struct ScriptedKernelSymbol {
     std::uint64_t start = 0;
@@ -127,11 +112,10 @@ class ScriptedKernel {
     std::set<std::string, std::less<>> internalContent; // subsystems for which it is installed
 
     /// What the answers keep between calls; only they see into it.
-    struct State;
-    State& state() { return *state_; }
+    KernelState& state() { return *state_; }
 
   private:
-    std::unique_ptr<State> state_;
+    std::unique_ptr<KernelState> state_;
 };
 
 } // namespace tally::platform

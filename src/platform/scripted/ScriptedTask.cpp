@@ -1,7 +1,6 @@
 #include "platform/scripted/ScriptedTask.h"
 
 #include "base/Format.h"
-#include "platform/scripted/ScriptedKernel.h"
 
 #include <algorithm>
 #include <iterator>
@@ -110,9 +109,9 @@ void ScriptedTask::settle(ScriptedMapping& mapping, std::uint64_t previousEnd) {
     if (mapping.size == 0) {
         const std::size_t pages =
             std::max(mapping.pages.length(), mapping.objectPages ? mapping.objectPages->length() : 0);
-        mapping.size = mapping.nested.empty() ? pages * kernel_->pageSize : at - *mapping.start;
+        mapping.size = mapping.nested.empty() ? pages * *pageSize_ : at - *mapping.start;
     }
-    const bool isWhole = mapping.size % kernel_->pageSize == 0 && *mapping.start % kernel_->pageSize == 0;
+    const bool isWhole = mapping.size % *pageSize_ == 0 && *mapping.start % *pageSize_ == 0;
     if (mapping.size == 0 || !isWhole || mapping.end() < at || mapping.end() < *mapping.start) {
         throw std::invalid_argument(formatted("no mapping: %#llx bytes at %#llx",
                                               static_cast<long long>(mapping.size),
@@ -126,7 +125,7 @@ void ScriptedTask::settle(ScriptedMapping& mapping, std::uint64_t previousEnd) {
         mapping.shareMode = mapping.object.value_or(0) != 0 ? SM_SHARED : SM_PRIVATE;
     }
     if (!mapping.object) {
-        mapping.object = kernel_->makeObjectId();
+        mapping.object = makeObjectId_();
     }
 }
 

@@ -14,14 +14,13 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <optional>
 #include <string>
 #include <vector>
 
 namespace tally::platform {
-
-class ScriptedKernel;
 
 /// What the kernel counts in one mapping; in pages.
 struct PageCounts {
@@ -89,19 +88,6 @@ struct ScriptedMapping {
     bool hasExternalPager() const { return externalPager.value_or(!file.empty()); }
 };
 
-/// One object that a task owns, in the order of the kernel's reply.
-struct ScriptedOwnedObject {
-    std::uint64_t id = 0;
-    std::uint64_t virtualSize = 0;
-    std::uint64_t residentSize = 0;
-    std::uint64_t wiredSize = 0;
-    std::uint64_t reusableSize = 0;
-    std::uint64_t compressedSize = 0;
-    bool noTally = false;
-    std::uint8_t ledgerTag = 0; // 0-7
-    std::uint8_t purgeable = VM_PURGABLE_NONVOLATILE;
-};
-
 enum class TaskState { alive, zombie, gone };
 
 struct TaskRecord {
@@ -121,9 +107,7 @@ struct TaskRecord {
     std::uint32_t dirtyFlags = 0;                 // PROC_DIRTY_...
     rusage_info_v5 usage{};                       // bytes
     std::map<std::string, std::int64_t> ledger{}; // balances by entry name; the others are 0
-    std::optional<std::vector<ScriptedOwnedObject>> owned{
-        std::in_place};                                 // absent: the kernel has no such list
-    std::optional<std::vector<std::byte>> ownedReply{}; // raw bytes in place of `owned`
+    std::optional<std::vector<owned_vmobject>> owned{std::in_place}; // absent: the kernel has no such list
     std::vector<RKSymbolOwner> images{};
     std::map<std::string, std::string> resolvedPaths{}; // symbolic links, as the task sees them
     std::optional<dyld_shared_cache> sharedCache{};
@@ -135,8 +119,10 @@ struct TaskRecord {
 
 class ScriptedTask : public TaskRecord {
   public:
-    ScriptedTask(ScriptedKernel& kernel, TaskRecord record)
-        : TaskRecord(std::move(record)), kernel_(&kernel) {}
+    /// @param pageSize the kernel's. @param makeObjectId gives ids that no other object has.
+    ScriptedTask(const std::uint64_t& pageSize, std::function<std::uint64_t()> makeObjectId,
+                 TaskRecord record)
+        : TaskRecord(std::move(record)), pageSize_(&pageSize), makeObjectId_(std::move(makeObjectId)) {}
 
     /// Adds a mapping. @return the mapping, which stays where it is and may be changed.
     /// Throws std::invalid_argument when it is empty, not of whole pages or overlaps another one.
@@ -157,7 +143,8 @@ class ScriptedTask : public TaskRecord {
   private:
     void settle(ScriptedMapping& mapping, std::uint64_t previousEnd);
 
-    ScriptedKernel* kernel_;
+    const std::uint64_t* pageSize_;
+    std::function<std::uint64_t()> makeObjectId_;
     std::map<std::uint64_t, ScriptedMapping> mappings_; // by start
 };
 

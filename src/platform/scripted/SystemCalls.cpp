@@ -15,8 +15,7 @@ constexpr std::int64_t nanosecondsPerSecond = 1'000'000'000;
 
 class InterruptSource final : public SignalSource {
   public:
-    InterruptSource(ScriptedKernel::State& state, ScriptedKernel::State::InterruptHandler handler)
-        : state_(state) {
+    InterruptSource(KernelState& state, KernelState::InterruptHandler handler) : state_(state) {
         state_.interruptHandlers[this] = std::move(handler);
     }
     ~InterruptSource() override { cancel(); }
@@ -26,12 +25,12 @@ class InterruptSource final : public SignalSource {
     }
 
   private:
-    ScriptedKernel::State& state_;
+    KernelState& state_;
 };
 
 class Timer final : public TimerSource {
   public:
-    Timer(ScriptedKernel::State& state, SerialQueue& queue, std::function<void(std::uint64_t)> handler)
+    Timer(KernelState& state, SerialQueue& queue, std::function<void(std::uint64_t)> handler)
         : state_(state), timer_{.queue = &queue, .handler = std::move(handler)} {
         state_.timer = &timer_;
     }
@@ -49,8 +48,8 @@ class Timer final : public TimerSource {
     }
 
   private:
-    ScriptedKernel::State& state_;
-    ScriptedKernel::State::Timer timer_;
+    KernelState& state_;
+    KernelState::Timer timer_;
 };
 
 /// The first mapping of `task` that shows the file of `path`; null when there is none.
@@ -94,8 +93,8 @@ std::unique_ptr<SignalSource> dispatch_source_interrupt(InterruptSignals which,
     }
     return std::make_unique<InterruptSource>(
         answer.state,
-        ScriptedKernel::State::InterruptHandler{
-            .call = std::move(handler), .takesTermination = which == InterruptSignals::sigintAndTermination});
+        KernelState::InterruptHandler{.call = std::move(handler),
+                                      .takesTermination = which == InterruptSignals::sigintAndTermination});
 }
 
 void restoreDefaultInterruptAction() { const Answer answer("restoreDefaultInterruptAction"); }

@@ -107,7 +107,7 @@ GatherScope::GatherScope() {
 }
 
 GatherScope::~GatherScope() {
-    ScriptedKernel::State& state = ScriptedKernel::current().state();
+    KernelState& state = ScriptedKernel::current().state();
     const std::lock_guard lock(state.mutex);
     state.gathering = false;
 }

@@ -4,11 +4,13 @@
 
 #include "platform/bsd_process.h"
 #include "platform/linux/calls/Task.h"
+#include "platform/linux/io/Notes.h"
 #include "platform/linux/io/SystemFiles.h"
 #include "platform/linux/machine/Charges.h"
 #include "platform/linux/machine/ProcessStat.h"
 #include "platform/linux/objects/Executable.h"
 #include "platform/linux/objects/FileInquiry.h"
+#include "platform/linux/owned/OwnedObjects.h"
 
 #include <unistd.h>
 
@@ -16,7 +18,9 @@
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <iterator>
 #include <memory>
+#include <ranges>
 #include <string>
 #include <vector>
 
@@ -212,6 +216,29 @@ int proc_regionfilename(std::int32_t pid, std::uint64_t address, std::span<char>
     const std::size_t length = std::min(name.size(), buffer.size());
     std::memcpy(buffer.data(), name.data(), length);
     return static_cast<int>(length);
+}
+
+std::optional<std::vector<owned_vmobject>> sysctl_owned_vmobjects(std::uint32_t port) {
+    const std::shared_ptr<Task> task = taskOfPort(port);
+    kern_return_t status = KERN_SUCCESS;
+    const Walk* walk = task ? task->walk(&status) : nullptr;
+    if (walk == nullptr) {
+        errno = task ? ENOENT : ESRCH; // why a task cannot be walked is for the walk to say
+        return std::nullopt;
+    }
+    std::vector<std::string> notes;
+    std::optional<OwnedObjects> objects;
+    {
+        const NoteTaker taker(notes);
+        objects = ownedObjectsOf(task->identity(), walk->mappings(), walk->folder());
+    }
+    if (!objects) {
+        return std::nullopt;
+    }
+    task->addNotices(std::move(notes));
+    std::vector<owned_vmobject> list;
+    std::ranges::copy(*objects | std::views::values, std::back_inserter(list));
+    return list;
 }
 
 std::uint64_t vm_kernel_page_size() { return basePage; }

@@ -57,13 +57,15 @@ bool isOnDevice(std::string_view region) {
                        [&](std::string_view name) { return region.starts_with(name); });
 }
 
+constexpr std::uint8_t graphicsLedger = 4;
+
 std::uint64_t less(std::uint64_t a, std::uint64_t b) { return a > b ? a - b : 0; }
 
 } // namespace
 
-std::optional<OwnedRecord> decodeDmaBuffer(std::string_view text) {
+std::optional<owned_vmobject> decodeDmaBuffer(std::string_view text) {
     std::uint64_t number = 0;
-    OwnedRecord record{.flags = OwnedRecord::notPurgeable | OwnedRecord::graphics};
+    owned_vmobject record{.ledgerTag = graphicsLedger, .purgeable = VM_PURGABLE_DENY};
     bool isMemfd = false;
     forEachLine(text, [&](std::string_view key, std::string_view value) {
         if (key == "ino") {
@@ -74,11 +76,11 @@ std::optional<OwnedRecord> decodeDmaBuffer(std::string_view text) {
             isMemfd = value == "udmabuf";
         }
     });
-    record.objectId = objectIdOfKernelBuffer(KernelBuffer::dmaBuffer, number);
+    record.id = objectIdOfKernelBuffer(KernelBuffer::dmaBuffer, number);
     return number != 0 && !isMemfd && record.holdsMemory() ? std::optional(record) : std::nullopt;
 }
 
-std::optional<OwnedRecord> decodeGraphicsClient(std::string_view text) {
+std::optional<owned_vmobject> decodeGraphicsClient(std::string_view text) {
     std::optional<std::uint64_t> client;
     std::map<std::string_view, RegionMemory> regions;
     forEachLine(text, [&](std::string_view key, std::string_view value) {
@@ -92,20 +94,20 @@ std::optional<OwnedRecord> decodeGraphicsClient(std::string_view text) {
             }
         }
     });
-    OwnedRecord record{.flags = OwnedRecord::notPurgeable | OwnedRecord::graphics};
+    owned_vmobject record{.ledgerTag = graphicsLedger, .purgeable = VM_PURGABLE_DENY};
     for (const auto& [name, region] : regions) {
         const std::uint64_t resident = less(std::max(region.resident, region.memory), region.shared);
         record.residentSize += resident;
         record.reusableSize += std::min(region.purgeable, resident);
         record.virtualSize += std::max(less(region.total, region.shared), resident);
     }
-    record.objectId = objectIdOfKernelBuffer(KernelBuffer::graphicsClient, client.value_or(0));
+    record.id = objectIdOfKernelBuffer(KernelBuffer::graphicsClient, client.value_or(0));
     return client && record.holdsMemory() ? std::optional(record) : std::nullopt;
 }
 
-std::optional<OwnedRecord> decodeBpfMap(std::string_view text) {
+std::optional<owned_vmobject> decodeBpfMap(std::string_view text) {
     std::optional<std::uint64_t> map;
-    OwnedRecord record{.flags = OwnedRecord::notPurgeable | OwnedRecord::notCharged};
+    owned_vmobject record{.noTally = true, .purgeable = VM_PURGABLE_DENY};
     forEachLine(text, [&](std::string_view key, std::string_view value) {
         std::uint64_t number = 0;
         if (key == "map_id" && takeNumber(value, &number)) {
@@ -114,7 +116,7 @@ std::optional<OwnedRecord> decodeBpfMap(std::string_view text) {
             record.virtualSize = record.residentSize = record.wiredSize = sizeOf(value);
         }
     });
-    record.objectId = objectIdOfKernelBuffer(KernelBuffer::bpfMap, map.value_or(0));
+    record.id = objectIdOfKernelBuffer(KernelBuffer::bpfMap, map.value_or(0));
     return map && record.holdsMemory() ? std::optional(record) : std::nullopt;
 }
 

@@ -54,8 +54,8 @@ bool readStatus(const std::string& descriptor, std::string_view link, struct sta
 }
 
 /// A file without a name that only its descriptors, or mappings, keep: absent when it is none in memory.
-std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::string& descriptor,
-                                      std::string_view link) {
+std::optional<owned_vmobject> memoryFile(const std::string& folder, const std::string& descriptor,
+                                         std::string_view link) {
     struct statx status {};
     if (!readStatus(descriptor, link, status)) {
         noteRefusal(descriptorsUnread, errno, memoryLeftOut);
@@ -74,8 +74,8 @@ std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::stri
     if (!isHuge && object.backing != Backing::sharedMemory) {
         return std::nullopt;
     }
-    OwnedRecord record;
-    record.objectId = objectIdOfFile(object);
+    owned_vmobject record{.purgeable = VM_PURGABLE_DENY};
+    record.id = objectIdOfFile(object);
     record.residentSize = status.stx_blocks * blockSize; // what is swapped out included
     record.virtualSize = std::max<std::uint64_t>(status.stx_size, record.residentSize);
     if (isHuge) {
@@ -92,7 +92,7 @@ std::optional<OwnedRecord> memoryFile(const std::string& folder, const std::stri
     return record;
 }
 
-std::optional<OwnedRecord> recordOf(const std::string& folder, const char* number, std::string_view link) {
+std::optional<owned_vmobject> recordOf(const std::string& folder, const char* number, std::string_view link) {
     if (link.starts_with('/') && link.ends_with(" (deleted)")) {
         return memoryFile(folder, folder + "/fd/" + number, link);
     }
@@ -112,7 +112,7 @@ std::optional<OwnedRecord> recordOf(const std::string& folder, const char* numbe
 
 } // namespace
 
-bool forEachHeldObject(const std::string& folder, const std::function<void(const OwnedRecord&)>& found) {
+bool forEachHeldObject(const std::string& folder, const std::function<void(const owned_vmobject&)>& found) {
     const std::unique_ptr<DIR, int (*)(DIR*)> descriptors(opendir((folder + "/fd").c_str()), closedir);
     if (!descriptors) {
         const int error = errno;

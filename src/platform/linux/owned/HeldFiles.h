@@ -2,7 +2,8 @@
 
 #pragma once
 
-#include "platform/linux/owned/OwnedRecord.h"
+#include "platform/bsd_process.h"
+#include "platform/mach_vm.h"
 
 #include <cstdint>
 #include <functional>
@@ -16,6 +17,6 @@ namespace tally::platform {
 /// Cost: a listing and a link a descriptor; more is asked only where the link says that it matters. No
 /// descriptor's file is opened, but for those in memory while swap is in use.
 /// @return false with errno when the descriptors cannot be listed.
-bool forEachHeldObject(const std::string& folder, const std::function<void(const OwnedRecord&)>& found);
+bool forEachHeldObject(const std::string& folder, const std::function<void(const owned_vmobject&)>& found);
 
 } // namespace tally::platform

@@ -50,31 +50,31 @@ class MappedObjects {
     std::optional<std::unordered_set<std::uint64_t>> ids_; // made when first asked
 };
 
-void listSegments(MemberIdentity task, const MappedObjects& mapped, OwnedRecords* records) {
+void listSegments(MemberIdentity task, const MappedObjects& mapped, OwnedObjects* records) {
     for (const SysVSegment& segment : segmentsCreatedBy(task.pid, task.startTicks)) {
         constexpr std::uint64_t internalMount = 1; // where the kernel keeps segments: device 00:01
-        OwnedRecord record;
-        record.objectId = objectIdOfFile(
+        owned_vmobject record{.purgeable = VM_PURGABLE_DENY};
+        record.id = objectIdOfFile(
             {.backing = Backing::sharedMemory, .device = internalMount, .inode = segment.id, .isSysV = true});
         record.residentSize = segment.resident;
         record.compressedSize = segment.swapped;
         record.virtualSize = std::max(wholePages(segment.size), segment.resident + segment.swapped);
         if (record.holdsMemory() && !mapped.containSysV(segment.id)) {
-            records->emplace(record.objectId, record);
+            records->emplace(record.id, record);
         }
     }
 }
 
 /// What is swapped out is an object of its own, as it is where somebody maps it.
-void divideSwapped(OwnedRecords* records) {
-    OwnedRecords swapped;
+void divideSwapped(OwnedObjects* records) {
+    OwnedObjects swapped;
     for (auto& [id, record] : *records) {
         if (record.compressedSize != 0) {
-            OwnedRecord part = record;
-            part.objectId = objectIdOfMarkedPages(id);
+            owned_vmobject part = record;
+            part.id = objectIdOfMarkedPages(id);
             part.virtualSize = part.compressedSize;
             part.residentSize = 0;
-            swapped.emplace(part.objectId, part);
+            swapped.emplace(part.id, part);
             record.virtualSize -= std::min(record.virtualSize, record.compressedSize);
             record.compressedSize = 0;
         }
@@ -85,13 +85,13 @@ void divideSwapped(OwnedRecords* records) {
 
 } // namespace
 
-std::optional<OwnedRecords> ownedObjectsOf(MemberIdentity task, std::span<const Mapping> mappings,
+std::optional<OwnedObjects> ownedObjectsOf(MemberIdentity task, std::span<const Mapping> mappings,
                                            const std::string& folder) {
-    OwnedRecords records;
+    OwnedObjects records;
     MappedObjects mapped(mappings, folder);
-    const bool isListed = forEachHeldObject(folder, [&](const OwnedRecord& record) {
-        if (!mapped.contain(record.objectId)) {
-            records.emplace(record.objectId, record);
+    const bool isListed = forEachHeldObject(folder, [&](const owned_vmobject& record) {
+        if (!mapped.contain(record.id)) {
+            records.emplace(record.id, record);
         }
     });
     if (!isListed && !isRefusal(errno)) {
