@@ -8,10 +8,10 @@
 #include "analysis/TLMemoryCategory.h"
 #include "analysis/TLProcessGroup.h"
 #include "base/IntegerTable.h"
-#include "output/protocol/TLOutputFormatter.h"
-#include "output/protocol/TLTime.h"
 #include "platform/dispatch.h"
 #include "process/TLProcess.h"
+#include "report/TLOutputFormatter.h"
+#include "report/TLTime.h"
 
 #include <atomic>
 #include <cstdint>

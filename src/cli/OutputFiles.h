@@ -7,9 +7,9 @@
 #pragma once
 
 #include "cli/TLTallyArgs.h"
-#include "output/protocol/TLOutputFormatter.h"
 #include "platform/output_file.h"
 #include "process/TLProcess.h"
+#include "report/TLOutputFormatter.h"
 
 #include <memory>
 #include <span>

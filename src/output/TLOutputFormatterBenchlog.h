@@ -6,9 +6,9 @@
 #pragma once
 
 #include "base/JSONString.h"
-#include "output/protocol/TLOutputFormatter.h"
-#include "output/protocol/TLTime.h"
 #include "platform/benchlog.h"
+#include "report/TLOutputFormatter.h"
+#include "report/TLTime.h"
 
 #include <cstdint>
 #include <map>

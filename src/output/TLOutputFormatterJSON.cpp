@@ -5,9 +5,9 @@
 #include "analysis/TLProcessGroup.h"
 #include "base/BatchEnumeration.h"
 #include "base/JSONString.h"
-#include "output/protocol/TLTime.h"
 #include "platform/clock.h"
 #include "process/TLProcess.h"
+#include "report/TLTime.h"
 #include "vm/PhysTallyCollection.h"
 
 #include <cstdio>

@@ -6,8 +6,8 @@
 #pragma once
 
 #include "output/JSONWriter.h"
-#include "output/protocol/TLOutputFormatter.h"
 #include "platform/output_file.h"
+#include "report/TLOutputFormatter.h"
 
 #include <cstdint>
 #include <memory>

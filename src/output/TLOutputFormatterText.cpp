@@ -6,9 +6,9 @@
 #include "base/Format.h"
 #include "output/CategoryTable.h"
 #include "output/RegionListing.h"
-#include "output/protocol/TLTime.h"
 #include "platform/clock.h"
 #include "process/TLProcess.h"
+#include "report/TLTime.h"
 #include "vm/PhysTallyCollection.h"
 
 #include <array>

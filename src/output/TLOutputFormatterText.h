@@ -5,7 +5,7 @@
 #pragma once
 
 #include "output/ValueFormat.h"
-#include "output/protocol/TLOutputFormatter.h"
+#include "report/TLOutputFormatter.h"
 
 #include <cstdint>
 #include <cstdio>

@@ -1,4 +1,4 @@
-#include "output/protocol/TLTime.h"
+#include "report/TLTime.h"
 #include "platform/scripted/ScriptedKernel.h"
 
 #include <gtest/gtest.h>

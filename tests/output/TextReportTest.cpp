@@ -2,7 +2,7 @@
 // kind of name carries a control character, and none may reach the terminal.
 
 #include "output/PrintedReport.h"
-#include "output/protocol/TLTime.h"
+#include "report/TLTime.h"
 
 namespace tally {
 namespace {

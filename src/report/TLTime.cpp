@@ -1,6 +1,6 @@
 // TLTime: reading the clocks and turning ticks and wall time into what reports print.
 
-#include "output/protocol/TLTime.h"
+#include "report/TLTime.h"
 
 namespace tally {
 
