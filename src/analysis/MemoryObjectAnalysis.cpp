@@ -23,14 +23,14 @@ bool isTextOrLinkedit(const TLMemoryRegion& region) {
 /// that uses the cache.
 std::uint64_t sharedCacheKey(const TLMemoryRegion& region, const TLSharedCache& cache, std::int32_t pid) {
     const std::uint64_t key = region.start - cache.baseAddress + 1;
-    const bool isOwnData = !isTextOrLinkedit(region) && (region.dirtySize != 0 || region.swappedSize != 0);
+    const bool isOwnData = !isTextOrLinkedit(region) && (region.chargedSize() != 0);
     return isOwnData ? key ^ (static_cast<std::uint64_t>(pid) << 32) : key;
 }
 
 std::uint64_t sumOfRegions(const TLProcess& process) {
     std::uint64_t sum = 0;
     for (const TLMemoryRegion& region : process.memoryRegions()) {
-        sum += region.dirtySize + region.swappedSize;
+        sum += region.chargedSize();
     }
     return sum;
 }
@@ -40,7 +40,7 @@ std::uint64_t sumOfDistinctObjects(const TLProcess& process) {
     std::unordered_set<const TLMemoryObject*> counted;
     for (const TLMemoryRegion& region : process.memoryRegions()) {
         if (counted.insert(region.memoryObject).second) {
-            sum += region.memoryObject->totalDirtySize + region.memoryObject->totalSwappedSize;
+            sum += region.memoryObject->totals.charged();
         }
     }
     return sum;

@@ -10,12 +10,7 @@ void TLMemoryCategory::addMemoryObject(std::shared_ptr<const TLMemoryObject> obj
     if (!object) {
         return;
     }
-    totalDirtySize += object->totalDirtySize;
-    totalSwappedSize += object->totalSwappedSize;
-    totalCleanSize += object->totalCleanSize;
-    totalReclaimableSize += object->totalReclaimableSize;
-    totalWiredSize += object->totalWiredSize;
-    totalRegions += static_cast<std::int32_t>(object->memoryRegions().size());
+    totals += TLMemoryTotals{object->totals, static_cast<std::uint32_t>(object->memoryRegions().size())};
     if (!firstMemoryObject_) {
         firstMemoryObject_ = std::move(object);
     }
@@ -46,12 +41,7 @@ std::string categoryKey(const TLMemoryObject& object, bool summarize) {
 TLMemoryTotals totalsForCategories(const TLCategoryDictionary& categories) {
     TLMemoryTotals totals;
     for (const auto& [key, category] : categories) {
-        totals.dirty += category.totalDirtySize;
-        totals.swapped += category.totalSwappedSize;
-        totals.clean += category.totalCleanSize;
-        totals.reclaimable += category.totalReclaimableSize;
-        totals.wired += category.totalWiredSize;
-        totals.regions += static_cast<std::uint32_t>(category.totalRegions);
+        totals += category.totals;
     }
     return totals;
 }

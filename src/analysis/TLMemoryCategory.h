@@ -12,6 +12,18 @@
 
 namespace tally {
 
+/// The sums of a row, or of several.
+struct TLMemoryTotals : TLRangeSizes {
+    std::uint32_t regions = 0;
+
+    TLMemoryTotals& operator+=(const TLMemoryTotals& other) {
+        TLRangeSizes::operator+=(other);
+        regions += other.regions;
+        return *this;
+    }
+    friend bool operator==(const TLMemoryTotals&, const TLMemoryTotals&) = default;
+};
+
 class TLMemoryCategory {
   public:
     TLMemoryCategory() = default;
@@ -31,13 +43,7 @@ class TLMemoryCategory {
     Name detailedName() const; // absent for a summary category
     std::string fullName() const;
 
-    std::int32_t totalRegions = 0;
-    // Bytes.
-    std::uint64_t totalDirtySize = 0;
-    std::uint64_t totalSwappedSize = 0;
-    std::uint64_t totalCleanSize = 0;
-    std::uint64_t totalReclaimableSize = 0;
-    std::uint64_t totalWiredSize = 0;
+    TLMemoryTotals totals;
 
   private:
     bool isSummary_ = false;
@@ -46,18 +52,6 @@ class TLMemoryCategory {
 
 /// Category key to category. In ascending order of keys, which sorts rows that are otherwise equal.
 using TLCategoryDictionary = std::map<std::string, TLMemoryCategory, std::less<>>;
-
-/// Sums over a category dictionary; bytes.
-struct TLMemoryTotals {
-    std::uint64_t dirty = 0;
-    std::uint64_t swapped = 0;
-    std::uint64_t clean = 0;
-    std::uint64_t reclaimable = 0;
-    std::uint64_t wired = 0;
-    std::uint32_t regions = 0;
-
-    friend bool operator==(const TLMemoryTotals&, const TLMemoryTotals&) = default;
-};
 
 /// The key under which `object` is filed: its name, or without `summarize` its full name.
 std::string categoryKey(const TLMemoryObject& object, bool summarize);

@@ -25,7 +25,7 @@ struct Column {
 };
 
 constexpr std::array<Column, 5> columns = {{
-    {"Dirty", 7, 11, 0, [](const TLMemoryTotals& row) { return row.dirty + row.swapped; }},
+    {"Dirty", 7, 11, 0, [](const TLMemoryTotals& row) { return row.charged(); }},
     {"(Swapped)", 11, 14, TLTextOptionSwapped, [](const TLMemoryTotals& row) { return row.swapped; }},
     {"Clean", 11, 14, 0, [](const TLMemoryTotals& row) { return row.clean; }},
     {"Reclaimable", 13, 14, 0, [](const TLMemoryTotals& row) { return row.reclaimable; }},
@@ -72,18 +72,12 @@ void printRow(std::FILE* output, const ValueFormat& format, const TLMemoryTotals
         std::to_string(static_cast<std::int32_t>(row.regions)), category);
 }
 
-TLMemoryTotals totalsOf(const TLMemoryCategory& category) {
-    return {category.totalDirtySize, category.totalSwappedSize,
-            category.totalCleanSize, category.totalReclaimableSize,
-            category.totalWiredSize, static_cast<std::uint32_t>(category.totalRegions)};
-}
-
 /// What rows are sorted by, the largest first; what is equal stays in the order of keys.
 using SortKey = std::array<std::uint64_t, 3>;
 
 SortKey sortKey(const TLMemoryTotals& row, std::string_view sort) {
     if (sort == "Dirty") {
-        return {row.dirty + row.swapped, row.reclaimable, row.clean};
+        return {row.charged(), row.reclaimable, row.clean};
     }
     if (sort == "Swapped") {
         return {row.swapped};
@@ -113,7 +107,7 @@ std::vector<Row> sortedRows(const TLCategoryDictionary& categories, std::string_
     std::vector<Row> rows;
     rows.reserve(categories.size());
     for (const auto& entry : categories) {
-        rows.push_back({sortKey(totalsOf(entry.second), sort), &entry});
+        rows.push_back({sortKey(entry.second.totals, sort), &entry});
     }
     std::ranges::stable_sort(rows, std::ranges::greater(), &Row::sortKey);
     return rows;
@@ -135,7 +129,7 @@ void printCategoryTable(std::FILE* output, const ValueFormat& format, const TLCa
                 continue;
             }
             const Name name = category.name();
-            printRow(output, format, totalsOf(category),
+            printRow(output, format, category.totals,
                      format.displayName(name.isNull() ? key : name.view(), category.detailedName()));
         }
     });

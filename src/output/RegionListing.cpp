@@ -26,7 +26,7 @@ void printRegion(std::FILE* output, const ValueFormat& format, const TLMemoryReg
         std::fprintf(output, " %7llu", Word{pageCount(bytes, pageSize)});
     };
     printPages(region.size);
-    printPages(region.dirtySize + region.swappedSize);
+    printPages(region.chargedSize());
     if (format.shows(TLTextOptionSwapped)) {
         printPages(region.swappedSize);
     }

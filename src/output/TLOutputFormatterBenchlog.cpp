@@ -60,7 +60,7 @@ void TLOutputFormatterBenchlog::printProcessTotal(std::optional<std::uint64_t> t
 
 void TLOutputFormatterBenchlog::addCategoryTotals(const Categories& categories) {
     for (const auto& [key, category] : categories) {
-        currentProcessTotals_[category.fullName()] += category.totalDirtySize + category.totalSwappedSize;
+        currentProcessTotals_[category.fullName()] += category.totals.charged();
     }
 }
 
@@ -106,11 +106,10 @@ void TLOutputFormatterBenchlog::emitAuxEntries(const TLAuxDictionary& dictionary
 void TLOutputFormatterBenchlog::printSummaryCategories(const Categories& categories,
                                                        const TLMemoryTotals& total, bool /*hadErrors*/) {
     beginGroup();
-    addBytes("total_memory", static_cast<double>(total.dirty + total.swapped), allProcesses);
+    addBytes("total_memory", static_cast<double>(total.charged()), allProcesses);
     blwriter_record_tag(*writer_, bltag_summary);
     for (const auto& [key, category] : categories) {
-        addBytes(category.fullName(),
-                 static_cast<double>(category.totalDirtySize + category.totalSwappedSize), allProcesses);
+        addBytes(category.fullName(), static_cast<double>(category.totals.charged()), allProcesses);
     }
 }
 

@@ -42,7 +42,7 @@ void writeNumberUnlessZero(JSONWriter& json, const char* key, std::uint64_t valu
 
 void writeSizes(JSONWriter& json, const TLMemoryTotals& sizes) {
     json.beginObject();
-    writeNumber(json, "dirty", sizes.dirty + sizes.swapped);
+    writeNumber(json, "dirty", sizes.charged());
     writeNumber(json, "swapped", sizes.swapped);
     writeNumber(json, "clean", sizes.clean);
     writeNumber(json, "reclaimable", sizes.reclaimable);
@@ -55,12 +55,7 @@ void writeCategoryEntries(JSONWriter& json, const TLOutputFormatter::Categories&
                           DistinctKeys keys = {}) {
     for (const auto& [key, category] : categories) {
         json.key(keys.keyFor(category.fullName()));
-        writeSizes(json, {.dirty = category.totalDirtySize,
-                          .swapped = category.totalSwappedSize,
-                          .clean = category.totalCleanSize,
-                          .reclaimable = category.totalReclaimableSize,
-                          .wired = category.totalWiredSize,
-                          .regions = static_cast<std::uint32_t>(category.totalRegions)});
+        writeSizes(json, category.totals);
     }
 }
 
@@ -285,7 +280,7 @@ void TLOutputFormatterJSON::printSummaryCategories(const Categories& categories,
     json_.key(sum);
     writeSizes(json_, total);
     json_.endObject();
-    writeNumber(json_, "total tally", total.dirty + total.swapped);
+    writeNumber(json_, "total tally", total.charged());
 }
 
 void TLOutputFormatterJSON::printGlobalAuxData(const std::optional<TLAuxDictionary>& auxData) {

@@ -180,7 +180,7 @@ void TLOutputFormatterText::printSummaryCategories(const Categories& categories,
     }
     printSeparator();
     std::fprintf(output_, "Summary Tally: %s%s\n",
-                 format_.formatValue(static_cast<std::int64_t>(total.dirty + total.swapped)).c_str(),
+                 format_.formatValue(static_cast<std::int64_t>(total.charged())).c_str(),
                  hadErrors ? " (may be invalid due to errors)" : "");
     printSeparator();
     std::fputc('\n', output_);

@@ -159,7 +159,7 @@ void RegionRecorder::matchOwnedObject(TLMemoryRegion& region, const EnumeratedRe
     } else {
         return;
     }
-    ownedBehindMappings_ += region.dirtySize + region.swappedSize;
+    ownedBehindMappings_ += region.chargedSize();
 }
 
 void RegionRecorder::recordUnmappedOwnedObjects() {
@@ -189,7 +189,7 @@ void RegionRecorder::recordKernelsUnmappedRegion() {
                                    "be over-counted by %" PRIu64 " bytes",
                                    surplus));
     }
-    if (region.dirtySize + region.swappedSize != 0) {
+    if (region.chargedSize() != 0) {
         region.start = TLNotSet;
         task_.walk.regions.push_back(std::move(region));
     }

@@ -11,19 +11,11 @@ namespace tally {
 
 namespace {
 
-std::uint64_t wiredBytes(const TLMemoryRegion& region) { return region.wired ? region.size : 0; }
-
-/// What the regions' processes are charged; bytes.
-struct Charges {
-    std::uint64_t dirty = 0;
-    std::uint64_t swapped = 0;
-};
-
-Charges sumOfCharges(const TLRegionPointers& regions) {
-    Charges sum;
+/// What the regions hold one by one; bytes.
+TLRangeSizes sumOfSizes(const TLRegionPointers& regions) {
+    TLRangeSizes sum;
     for (const TLMemoryRegion* region : regions) {
-        sum.dirty += region->dirtySize;
-        sum.swapped += region->swappedSize;
+        sum += region->sizes();
     }
     return sum;
 }
@@ -80,28 +72,21 @@ void TLMemoryObject::addRegionWithPageSize(TLMemoryRegion& region, std::uint64_t
 
 void TLMemoryObject::finalizeSizes(bool breakDown) {
     tl_assert(!accurateSizes_, "!self.accurateSizes");
-    const TLRangeSizes united = rangeList_              ? rangeList_->sumSizes()
-                                : onlyRange_ != nullptr ? onlyRange_->sizes()
-                                                        : TLRangeSizes();
+    totals = rangeList_              ? rangeList_->sumSizes()
+             : onlyRange_ != nullptr ? onlyRange_->sizes()
+                                     : TLRangeSizes();
     onlyRange_ = nullptr;
     if (breakDown) {
-        const Charges charged = sumOfCharges(memoryRegions_);
-        totalDirtySize = charged.dirty;
-        totalSwappedSize = charged.swapped;
-    } else {
-        totalDirtySize = united.dirty;
-        totalSwappedSize = united.swapped;
-        if (!processMemoryRegions_.empty() && physTallyCollectionEnabled()) {
-            for (const auto& [pid, regions] : processMemoryRegions_) {
-                const Charges charged = sumOfCharges(regions);
-                totalDirtySize = std::max(totalDirtySize, charged.dirty);
-                totalSwappedSize = std::max(totalSwappedSize, charged.swapped);
-            }
+        const TLRangeSizes sum = sumOfSizes(memoryRegions_);
+        totals.dirty = sum.dirty;
+        totals.swapped = sum.swapped;
+    } else if (!processMemoryRegions_.empty() && physTallyCollectionEnabled()) {
+        for (const auto& [pid, regions] : processMemoryRegions_) {
+            const TLRangeSizes sum = sumOfSizes(regions);
+            totals.dirty = std::max(totals.dirty, sum.dirty);
+            totals.swapped = std::max(totals.swapped, sum.swapped);
         }
     }
-    totalCleanSize = united.clean;
-    totalReclaimableSize = united.reclaimable;
-    totalWiredSize = united.wired;
     rangeList_.reset();
     if (!processListsAddInformation()) {
         processMemoryRegions_ = {};
@@ -132,10 +117,7 @@ bool TLMemoryObject::processListsAddInformation() const {
         return false;
     }
     return std::ranges::any_of(processMemoryRegions_, [this](const ProcessRegionList& list) {
-        const TLMemoryRegion& region = *list.second.front();
-        return list.second.size() > 1 || region.dirtySize != totalDirtySize ||
-               region.swappedSize != totalSwappedSize || region.cleanNonSpecSize != totalCleanSize ||
-               region.reclaimableSize != totalReclaimableSize || wiredBytes(region) != totalWiredSize;
+        return list.second.size() > 1 || list.second.front()->sizes() != totals;
     });
 }
 
@@ -200,9 +182,9 @@ std::shared_ptr<const TLMemoryObject> TLMemoryObject::viewForProcess(const Memor
     }
     if (ownerPid != -1 && ownerPid != process.pid()) { // another process pays for it
         const auto paidByOwner = view->copy();
-        paidByOwner->totalDirtySize = 0;
-        paidByOwner->totalSwappedSize = 0;
-        paidByOwner->totalCleanSize = view->totalCleanSize + totalDirtySize + totalSwappedSize;
+        paidByOwner->totals.dirty = 0;
+        paidByOwner->totals.swapped = 0;
+        paidByOwner->totals.clean = view->totals.clean + totals.charged();
         view = paidByOwner;
     }
     return view;
@@ -211,10 +193,8 @@ std::shared_ptr<const TLMemoryObject> TLMemoryObject::viewForProcess(const Memor
 std::shared_ptr<TLMemoryObject> TLMemoryObject::copy() const {
     tl_assert(accurateSizes_ && !rangeList_, "self.accurateSizes && !self.rangeList");
     const auto copied = std::make_shared<TLMemoryObject>();
-    copied->totalDirtySize = totalDirtySize;
-    copied->totalSwappedSize = totalSwappedSize;
-    copied->totalCleanSize = totalCleanSize;
-    copied->totalWiredSize = totalWiredSize;
+    copied->totals = totals;
+    copied->totals.reclaimable = 0;
     copied->original_ = shared_from_this();
     copied->hasUnmappedOwnedRegion_ = hasUnmappedOwnedRegion_;
     copied->accurateSizes_ = true;

@@ -77,13 +77,8 @@ class TLMemoryObject : public std::enable_shared_from_this<TLMemoryObject> {
     /// A copy of a final object: its dirty, swapped, clean and wired totals, its regions and its owner.
     std::shared_ptr<TLMemoryObject> copy() const;
 
-    // Totals in bytes, valid once accurateSizes.
-    std::uint64_t totalDirtySize = 0;
-    std::uint64_t totalCleanSize = 0;
-    std::uint64_t totalSwappedSize = 0;
-    std::uint64_t totalReclaimableSize = 0;
+    TLRangeSizes totals;        // valid once accurateSizes
     std::int32_t ownerPid = -1; // -1: none
-    std::uint64_t totalWiredSize = 0;
 
     /// The object's place in a list that the report under way makes of its objects: a region leads to it
     /// without a look-up. Only the report uses it.

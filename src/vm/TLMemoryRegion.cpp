@@ -41,8 +41,7 @@ bool TLMemoryRegion::needsSubrangeBreakdown(std::uint64_t pageSize) const {
     }
     const bool isUniform =
         dirtySize == size || swappedSize == size || cleanNonSpecSize == size || reclaimableSize == size;
-    const bool isUntouched =
-        dirtySize == 0 && swappedSize == 0 && cleanNonSpecSize == 0 && reclaimableSize == 0;
+    const bool isUntouched = chargedSize() == 0 && cleanNonSpecSize == 0 && reclaimableSize == 0;
     return !isUniform && !isUntouched;
 }
 

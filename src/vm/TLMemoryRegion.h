@@ -6,6 +6,7 @@
 #pragma once
 
 #include "base/Name.h"
+#include "vm/TLRangeSizes.h"
 
 #include <cstdint>
 #include <memory>
@@ -15,7 +16,6 @@ namespace tally {
 
 class TLMemoryObject;
 class TLRangeList;
-struct TLRangeSizes;
 
 /// User tag of memory that is owned but not mapped.
 inline constexpr std::uint32_t TLUnmappedTag = 0xFFFFFFFF;
@@ -63,6 +63,7 @@ struct TLMemoryRegion {
     std::uint64_t end() const { return start == TLNotSet ? TLNotSet : start + size; }
     /// Sets `size`; an end below the start stops the program.
     void setEnd(std::uint64_t end);
+    std::uint64_t chargedSize() const { return dirtySize + swappedSize; }
     /// Its sizes as one range.
     TLRangeSizes sizes() const;
     /// `name`, and after a blank `detailedName` when that has characters.

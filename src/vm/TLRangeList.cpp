@@ -114,11 +114,7 @@ void TLRangeList::mergeRangeList(const TLRangeList& other, std::uint64_t pageSiz
 TLRangeSizes TLRangeList::sumSizes() const {
     TLRangeSizes sum;
     for (const TLRangeListNode* node = rangeListHead(); node != nullptr; node = node->next.get()) {
-        sum.dirty += node->sizes.dirty;
-        sum.swapped += node->sizes.swapped;
-        sum.clean += node->sizes.clean;
-        sum.reclaimable += node->sizes.reclaimable;
-        sum.wired += node->sizes.wired;
+        sum += node->sizes;
     }
     return sum;
 }

@@ -9,6 +9,8 @@
 
 #pragma once
 
+#include "vm/TLRangeSizes.h"
+
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -16,17 +18,6 @@
 namespace tally {
 
 struct TLMemoryRegion;
-
-/// Byte counts of a range or a sum of ranges.
-struct TLRangeSizes {
-    std::uint64_t dirty = 0;
-    std::uint64_t swapped = 0;
-    std::uint64_t clean = 0;
-    std::uint64_t reclaimable = 0;
-    std::uint64_t wired = 0;
-
-    friend bool operator==(const TLRangeSizes&, const TLRangeSizes&) = default;
-};
 
 struct TLRangeListNode {
     std::uint64_t start = 0; // offset in the VM object, bytes

@@ -39,18 +39,11 @@ TEST(ValueFormat, ShortensPaths) {
 TEST(CategoryTable, PutsTheLargestFirstAndEqualRowsInTheOrderOfKeys) {
     TLCategoryDictionary categories;
     // B, a and d have ten dirty bytes: the more reclaimable one comes first, then the cleaner one.
-    for (const auto& [key, dirty, swapped, clean, reclaimable, wired, regions] :
-         {std::tuple{"a", 4, 6, 2, 5, 0, 1}, std::tuple{"B", 10, 0, 2, 7, 0, 2},
-          std::tuple{"c", 20, 0, 1, 0, 1, 1}, std::tuple{"d", 10, 0, 3, 5, 0, 3},
-          std::tuple{"e", 9, 0, 9, 1, 0, 0}}) {
-        TLMemoryCategory& row = categories[key];
-        row.totalDirtySize = dirty;
-        row.totalSwappedSize = swapped;
-        row.totalCleanSize = clean;
-        row.totalReclaimableSize = reclaimable;
-        row.totalWiredSize = wired;
-        row.totalRegions = regions;
-    }
+    categories["a"].totals = {{4, 6, 2, 5, 0}, 1};
+    categories["B"].totals = {{10, 0, 2, 7, 0}, 2};
+    categories["c"].totals = {{20, 0, 1, 0, 1}, 1};
+    categories["d"].totals = {{10, 0, 3, 5, 0}, 3};
+    categories["e"].totals = {{9, 0, 9, 1, 0}, 0};
     // A row's letter each, in the order of columns; a capital is before the small letters.
     const std::string expected[] = {"cBdae", "aBcde", "edBac", "Badec", "cBade", "dBace", "Bacde"};
     const auto sorts = TLOutputFormatterText::textSortColumns();

@@ -113,7 +113,8 @@ TEST_F(TextReportTest, OneReportAfterTheOther) {
         formatter.printSummaryCategories({}, {}, false);
         formatter.printGlobalAuxData(TLAuxDictionary());
         formatter.startAtTime(std::nullopt); // a clock that cannot be read
-        formatter.printSummaryCategories({}, {.dirty = 5 * page, .swapped = 4 * page, .wired = 1}, false);
+        formatter.printSummaryCategories({}, {{.dirty = 5 * page, .swapped = 4 * page, .wired = 1}, 0},
+                                         false);
         formatter.printGlobalAuxData(std::nullopt);
     });
     const std::string separator(80, '=');

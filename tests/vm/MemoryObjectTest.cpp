@@ -80,8 +80,8 @@ TEST_F(MemoryObject, HasTheTotalsOfAUnionAndListsOnlyWhereTheyTellMore) {
     for (const auto& [rows, charged, breakDown, dirty, swapped, lists] : cases) {
         setPhysTallyCollectionEnabled(charged ? 1 : 0);
         const auto object = objectOf(rows, -1, breakDown);
-        EXPECT_EQ(object->totalDirtySize, dirty);
-        EXPECT_EQ(object->totalSwappedSize, swapped);
+        EXPECT_EQ(object->totals.dirty, dirty);
+        EXPECT_EQ(object->totals.swapped, swapped);
         EXPECT_EQ(object->processMemoryRegions().size(), lists);
     }
 }
@@ -98,9 +98,9 @@ TEST_F(MemoryObject, LooksDifferentToEachProcess) {
     for (const auto& [owner, viewer, dirty, clean, reclaimable, regions] : cases) {
         const auto object = objectOf({{1, 8, 4}, {1, 8}, {2, 3}}, owner);
         const auto view = object->viewForProcess(viewer);
-        EXPECT_EQ(view->totalDirtySize, dirty);
-        EXPECT_EQ(view->totalCleanSize, clean);
-        EXPECT_EQ(view->totalReclaimableSize, reclaimable);
+        EXPECT_EQ(view->totals.dirty, dirty);
+        EXPECT_EQ(view->totals.clean, clean);
+        EXPECT_EQ(view->totals.reclaimable, reclaimable);
         EXPECT_EQ(view->memoryRegions().size(), regions);
     }
 }
