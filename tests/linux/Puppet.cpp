@@ -6,7 +6,6 @@
 #include <sys/file.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
-#include <sys/swap.h>
 #include <sys/syscall.h>
 #include <sys/utsname.h>
 #include <sys/wait.h>
@@ -40,8 +39,7 @@ struct Pipe {
 };
 
 /// Starts `command` with the given descriptors as 0, 1 and 2 (-1: as they are).
-int start(const std::vector<std::string>& command, int input, int output, int errors,
-          const std::string& folder = "") {
+int start(const std::vector<std::string>& command, int input, int output, int errors) {
     std::vector<char*> arguments;
     for (const std::string& word : command) {
         arguments.push_back(const_cast<char*>(word.c_str()));
@@ -61,9 +59,7 @@ int start(const std::vector<std::string>& command, int input, int output, int er
                 dup2(wanted[i], i);
             }
         }
-        if (folder.empty() || chdir(folder.c_str()) == 0) {
-            execv(arguments[0], arguments.data());
-        }
+        execv(arguments[0], arguments.data());
         _exit(127);
     }
     return pid;
@@ -144,10 +140,10 @@ Puppet::~Puppet() {
     close(input_);
 }
 
-Outcome run(const std::vector<std::string>& command, const std::string& folder) {
+Outcome run(const std::vector<std::string>& command) {
     const Pipe out;
     const Pipe err;
-    const int pid = start(command, -1, out.writing, err.writing, folder);
+    const int pid = start(command, -1, out.writing, err.writing);
     close(out.writing);
     close(err.writing);
     Outcome outcome;
@@ -171,32 +167,6 @@ void expectSameReport(const std::function<std::string()>& usual, const std::func
     }
     GTEST_SKIP() << "the machine changes pages of files all the time";
 }
-
-Background::Background(const std::vector<std::string>& command, const std::string& folder) {
-    const auto create = [&](const char* name) {
-        return open((folder + "/" + name).c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    };
-    const int output = create("out");
-    const int errors = create("err");
-    pid_ = start(command, -1, output, errors, folder);
-    close(output);
-    close(errors);
-}
-
-Background::~Background() {
-    if (pid_ > 0) {
-        kill(pid_, SIGKILL);
-        wait();
-    }
-}
-
-bool Background::hasEnded() const {
-    siginfo_t ended{};
-    return waitid(P_PID, static_cast<id_t>(pid_), &ended, WEXITED | WNOHANG | WNOWAIT) == 0 &&
-           ended.si_pid != 0;
-}
-
-int Background::wait() { return waitFor(std::exchange(pid_, -1)); }
 
 TemporaryFolder::TemporaryFolder() {
     std::string path = std::filesystem::temp_directory_path() / "tally-test-XXXXXX";
@@ -244,21 +214,6 @@ HugePagePool::HugePagePool(int pages) {
 
 HugePagePool::~HugePagePool() {
     std::ofstream(poolFile) << before_;
-    close(lock_);
-}
-
-SwapFile::SwapFile(std::size_t mebibytes) : lock_(lockOfMachine("swap")) {
-    const std::string path = folder_.path() + "/swap";
-    const int file = open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600);
-    const bool hasRoom = posix_fallocate(file, 0, static_cast<off_t>(mebibytes << 20)) == 0;
-    close(file);
-    isOn_ = hasRoom && run({"/usr/sbin/mkswap", path}).status == 0 && swapon(path.c_str(), 0) == 0;
-}
-
-SwapFile::~SwapFile() {
-    if (isOn_) {
-        swapoff((folder_.path() + "/swap").c_str());
-    }
     close(lock_);
 }
 

@@ -45,30 +45,12 @@ struct Outcome {
     std::string errors;
 };
 
-/// Runs a program to its end. `folder` is its current folder, empty for the test's own.
-Outcome run(const std::vector<std::string>& command, const std::string& folder = "");
+/// Runs a program to its end.
+Outcome run(const std::vector<std::string>& command);
 
 /// Expects that `found` reports what `usual` does, which it is asked before and after until the machine
 /// changed nothing meanwhile (it writes files back, or drops pages of them). The functions give reports.
 void expectSameReport(const std::function<std::string()>& usual, const std::function<std::string()>& found);
-
-/// A program that runs beside the test, with its output in the files "out" and "err" of its folder; ended by
-/// pid when the holder goes away.
-class Background {
-  public:
-    Background(const std::vector<std::string>& command, const std::string& folder);
-    ~Background();
-    Background(const Background&) = delete;
-    Background& operator=(const Background&) = delete;
-
-    int pid() const { return pid_; }
-    bool hasEnded() const;
-    /// Waits for the end. @return the exit status, or 128 + the signal.
-    int wait();
-
-  private:
-    int pid_ = -1;
-};
 
 /// A folder of the test's own, removed with what is in it.
 class TemporaryFolder {
@@ -103,19 +85,6 @@ class HugePagePool {
     int lock_ = -1;
     int before_ = 0;
     int granted_ = 0;
-};
-
-/// A swap file of the test's own, alone among tests, off and removed in the end.
-class SwapFile {
-  public:
-    explicit SwapFile(std::size_t mebibytes);
-    ~SwapFile();
-    bool isOn() const { return isOn_; }
-
-  private:
-    TemporaryFolder folder_;
-    int lock_ = -1;
-    bool isOn_ = false;
 };
 
 } // namespace tally::test
