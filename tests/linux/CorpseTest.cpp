@@ -7,11 +7,8 @@
 #include "process/TLCorpseProcess.h"
 #include "vm/PhysTallyCollection.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <spawn.h>
 #include <sys/mman.h>
-#include <sys/ptrace.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -20,7 +17,6 @@
 #include <filesystem>
 #include <fstream>
 #include <random>
-#include <regex>
 #include <set>
 #include <thread>
 
@@ -123,44 +119,6 @@ TEST_F(Corpse, ShowsOneInstantOfTwoHundredThreadsThatMapAndUnmap) {
     EXPECT_GT(tallies.size(), 5U) << "nothing changes, so that nothing is shown";
 }
 
-TEST_F(Corpse, LetsGoOfEveryThreadWhenTheToolIsKilledOrStopped) {
-    const Puppet busy({"churn", "200"});
-    const Puppet stopped({"churn", "20"});
-    stop(stopped.pid());
-    std::mt19937 random(1);
-    for (int round = 0; round < 40; ++round) {
-        const int pid = (round % 2 == 0 ? busy : stopped).pid();
-        std::string arguments[] = {TALLY_PROGRAM, "--forkCorpse", "--pid", std::to_string(pid)};
-        char* words[] = {arguments[0].data(), arguments[1].data(), arguments[2].data(), arguments[3].data(),
-                         nullptr};
-        posix_spawn_file_actions_t actions;
-        posix_spawn_file_actions_init(&actions);
-        posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
-        posix_spawnattr_t
-            group; // of its own, as a shell gives it, or the terminal's signal would stop nothing
-        posix_spawnattr_init(&group);
-        posix_spawnattr_setflags(&group, POSIX_SPAWN_SETPGROUP);
-        pid_t tool = 0;
-        ASSERT_EQ(posix_spawn(&tool, words[0], &actions, &group, words, environ), 0);
-        posix_spawn_file_actions_destroy(&actions);
-        posix_spawnattr_destroy(&group);
-        awaitTracer(pid);
-        std::this_thread::sleep_for(std::chrono::microseconds(random() % 4000));
-        if (round % 4 < 2) {
-            kill(tool, SIGTSTP);
-        } else {
-            kill(tool, SIGKILL);
-            waitpid(tool, nullptr, 0);
-        }
-        expectThreads(busy.pid(), 201, "RSD");
-        expectThreads(stopped.pid(), 21, "T");
-        if (round % 4 < 2) {
-            kill(tool, SIGKILL);
-            waitpid(tool, nullptr, 0);
-        }
-    }
-}
-
 TEST_F(Corpse, LeavesAStoppedProcessStoppedAndItsContinuingPossible) {
     const Puppet puppet({"idle"});
     const PortRight task = portOf(puppet.pid());
@@ -249,38 +207,6 @@ TEST_F(Corpse, OfAProcessThatLoadsProgramsIsWholeOrNone) {
     EXPECT_GT(whole, 0);
 }
 
-/// What the tool reports, but for the word that tells corpses, and for lines as long as the names between
-/// them.
-std::string reportOf(const std::vector<std::string>& command) {
-    const Outcome outcome = run(command);
-    EXPECT_EQ(outcome.errors, "");
-    return std::regex_replace(outcome.output, std::regex(R"( \(corpse\)|={2,})"), "");
-}
-
-TEST_F(Corpse, ReportsWhatStillProcessesReport) {
-    const std::vector<std::string> shapes[] = {{"zoo"},
-                                               {"leaderless"},
-                                               {"twins"},
-                                               {"family", "3", "600", "half"},
-                                               {"family", "5", "3000", "random"},
-                                               {"family", "2", "2048", "huge"},
-                                               {"family", "2", "600", "grow"}};
-    for (const std::vector<std::string>& shape : shapes) {
-        if (&shape != shapes && !isRoot()) {
-            GTEST_SKIP() << "relatives of corpses are told by frame numbers, which are for root";
-        }
-        const Puppet puppet(shape);
-        for (const std::string view : {"--swapped", "--vmObjectDirty"}) { // the first changes no figure
-            std::vector<std::string> command{TALLY_PROGRAM, "-f", "bytes",
-                                             view,          "-t", std::to_string(puppet.pid())};
-            std::vector<std::string> ofCorpse = command;
-            ofCorpse.insert(ofCorpse.begin() + 1, "--forkCorpse");
-            SCOPED_TRACE(shape[0] + " " + view);
-            expectSameReport([&] { return reportOf(command); }, [&] { return reportOf(ofCorpse); });
-        }
-    }
-}
-
 /// Pages of a corpse between two addresses: its own, and those it shares with relatives.
 std::pair<std::uint32_t, std::uint32_t> ownAndShared(const PortRight& corpse, std::uint64_t start,
                                                      std::uint64_t end) {
@@ -345,30 +271,7 @@ TEST_F(Corpse, SharesNothingWithARelativeThatWasForkedLater) {
     }
 }
 
-TEST_F(Corpse, ThatCannotBeHadIsSaidAndTheRunGoesOn) {
-    Puppet puppet({"idle"});
-    const Puppet other({"idle"});
-    const std::string pid = std::to_string(puppet.pid());
-    const std::vector<std::string> command{TALLY_PROGRAM, "--forkCorpse", "--pid",
-                                           pid,           "--pid",        std::to_string(other.pid())};
-    const auto expectRefused = [&](const std::string& reason, std::vector<std::string> prefix, int others) {
-        prefix.insert(prefix.end(), command.begin(), command.end());
-        const Outcome outcome = run(prefix);
-        const std::string start = "Unable to fork a corpse of process puppet [";
-        EXPECT_TRUE(outcome.errors.starts_with(start + pid + "]: " + reason + "\n")) << outcome.errors;
-        EXPECT_EQ(outcome.status, others == 0 ? 1 : 0);
-        EXPECT_EQ(outcome.output.find("puppet [" + std::to_string(other.pid()) + "] (corpse)") !=
-                      std::string::npos,
-                  others != 0);
-    };
-    ASSERT_EQ(ptrace(PTRACE_SEIZE, puppet.pid(), nullptr, nullptr), 0);
-    expectRefused("already traced", {}, 1);
-    ptrace(PTRACE_INTERRUPT, puppet.pid(), nullptr, nullptr);
-    waitpid(puppet.pid(), nullptr, __WALL);
-    ptrace(PTRACE_DETACH, puppet.pid(), nullptr, nullptr);
-    expectRefused("no access", {PUPPET_PROGRAM, "refuse", "0"}, 0); // as where tracing is forbidden
-    puppet.end(true);
-    expectRefused("terminated", {}, 1);
+TEST_F(Corpse, OfAProcessThatWaitsInTheKernelIsGivenUp) {
     const pid_t waiting = fork();
     if (waiting == 0) { // in the kernel, for what a child of it does
         setpgid(0, 0);

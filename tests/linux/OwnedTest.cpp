@@ -126,33 +126,6 @@ TEST(Owned, OfSeveralHoldersTheFirstThatAsksListsAnObjectInAGather) {
     }
 }
 
-TEST(Owned, TheHolderPaysForWhatOthersMapAndASearchFindsThem) {
-    if (geteuid() != 0) {
-        GTEST_SKIP() << "only root can search all processes";
-    }
-    const SharedFile file(16);
-    const Puppet holder({"open", file.path}, LAYOUTS_PROGRAM);
-    const Puppet mapper({"fill", file.path, "10"});
-    unlink(file.path.c_str());
-    const std::string held = std::to_string(holder.pid());
-    const std::string mapped = std::to_string(mapper.pid());
-    const auto report = [&](std::vector<std::string> arguments) {
-        arguments.insert(arguments.begin(), {TALLY_PROGRAM, "-w", "-v", "-f", "bytes", "--pid", held});
-        return test::run(arguments).output;
-    };
-    /// The dirty bytes of the file in the section that begins with `title`.
-    const auto bytesIn = [&](const std::string& text, const std::string& title) {
-        const std::size_t row = text.find("    mapped file " + file.path + " (deleted)\n", text.find(title));
-        EXPECT_NE(row, std::string::npos) << text;
-        return std::atoi(text.c_str() + text.rfind('\n', row) + 1);
-    };
-    const std::string both = report({"--pid", mapped});
-    EXPECT_EQ(bytesIn(both, "Shared with puppet [" + mapped + "]"), 16 * 4096);
-    EXPECT_EQ(bytesIn(both, "Shared with layouts [" + held + "]"), 0);
-    EXPECT_EQ(bytesIn(both, "Summary Tally"), 16 * 4096);
-    EXPECT_EQ(bytesIn(report({"--unmapped"}), "Shared with puppet [" + mapped + "]"), 16 * 4096);
-}
-
 TEST(Owned, ADriversWordsAreTakenByTheLinksOfItsDescriptors) {
     const test::TemporaryFolder folder;
     std::filesystem::create_directory(folder.path() + "/fd");

@@ -154,20 +154,6 @@ Outcome run(const std::vector<std::string>& command) {
     return outcome;
 }
 
-void expectSameReport(const std::function<std::string()>& usual, const std::function<std::string()>& found) {
-    std::string before = usual();
-    for (int left = 20; left > 0; --left) {
-        const std::string report = found();
-        std::string after = usual();
-        if (report == before || report == after || before == after) {
-            EXPECT_EQ(report, report == before ? before : after);
-            return;
-        }
-        before = std::move(after);
-    }
-    GTEST_SKIP() << "the machine changes pages of files all the time";
-}
-
 TemporaryFolder::TemporaryFolder() {
     std::string path = std::filesystem::temp_directory_path() / "tally-test-XXXXXX";
     if (mkdtemp(path.data()) == nullptr) {

@@ -3,7 +3,6 @@
 #pragma once
 
 #include <cstdint>
-#include <functional>
 #include <map>
 #include <string>
 #include <vector>
@@ -47,10 +46,6 @@ struct Outcome {
 
 /// Runs a program to its end.
 Outcome run(const std::vector<std::string>& command);
-
-/// Expects that `found` reports what `usual` does, which it is asked before and after until the machine
-/// changed nothing meanwhile (it writes files back, or drops pages of them). The functions give reports.
-void expectSameReport(const std::function<std::string()>& usual, const std::function<std::string()>& found);
 
 /// A folder of the test's own, removed with what is in it.
 class TemporaryFolder {

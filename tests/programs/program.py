@@ -1,7 +1,7 @@
 #!/usr/bin/env python3
 """The tool itself on real processes: its report, its messages, and how it ends."""
 import os, re, shutil, signal, time
-from running import HEAPSNAP, PUPPET, TALLY, Background, TestCase, contents_of, is_root, libc, main, run
+from running import HEAPSNAP, LAYOUTS, PUPPET, TALLY, Background, TestCase, contents_of, is_root, libc, main, run
 
 STATX, KCMP, READLINKAT = {"x86_64": (332, 312, 267)}.get(os.uname().machine, (291, 272, 78))  # numbers of system calls
 MAPPING_QUERY, PAGE_SCAN = "0xc0686611", "0xc0606610"
@@ -132,6 +132,28 @@ class Program(TestCase):
             outcome = run("/usr/bin/timeout", "-s", "KILL", "60", *way)
             self.assertEqual(outcome.status, 0, way)
             self.assertEqual("it does not answer" in outcome.output + outcome.errors, way[1] != "--pid", way)
+
+    def test_the_holder_pays_for_what_others_map_and_a_search_finds_them(self):
+        if os.geteuid() != 0:
+            self.skipTest("only root can search all processes")
+        path = "/dev/shm/tally-test-owned-%d" % os.getpid()
+        with open(path, "w") as file:
+            file.write("x" * 16 * 4096)
+        holder, mapper = self.puppet("open", path, program=LAYOUTS), self.puppet("fill", path, 10)
+        os.remove(path)
+
+        def bytes_in(title, *targets):
+            """The dirty bytes of the file in the section that begins with `title`."""
+            report = run(TALLY, "-w", "-v", "-f", "bytes", "--pid", holder.pid, *targets).output
+            row = re.search(r"(?m)^ *(\d+) B .*    mapped file %s \(deleted\)$" % path, report[report.find(title):])
+            self.assertTrue(row, report)
+            return int(row[1])
+
+        shared = "Shared with puppet [%s]" % mapper.pid
+        self.assertEqual(bytes_in(shared, "--pid", mapper.pid), 16 * 4096)
+        self.assertEqual(bytes_in("Shared with layouts [%s]" % holder.pid, "--pid", mapper.pid), 0)
+        self.assertEqual(bytes_in("Summary Tally", "--pid", mapper.pid), 16 * 4096)
+        self.assertEqual(bytes_in(shared, "--unmapped"), 16 * 4096)
 
     def test_processes_that_come_and_go_disturb_nothing(self):
         ended = self.puppet("idle")

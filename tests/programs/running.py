@@ -1,10 +1,10 @@
 """What tests of the programs share: real processes of known memory, runs, and how a test is called by ctest.
 
-The programs are named by the environment: TALLY, HEAPSNAP, PUPPET. A test file ends with running.main(), which takes the
+The programs are named by the environment: TALLY, HEAPSNAP, PUPPET, LAYOUTS. A test file ends with running.main(), which takes the
 tests to run as arguments; one that was skipped is said, with exit status 77."""
 import collections, contextlib, ctypes, os, platform, re, signal, subprocess, sys, tempfile, unittest
 
-TALLY, HEAPSNAP, PUPPET = (os.environ.get(name, "") for name in ("TALLY", "HEAPSNAP", "PUPPET"))
+TALLY, HEAPSNAP, PUPPET, LAYOUTS = (os.environ.get(name, "") for name in ("TALLY", "HEAPSNAP", "PUPPET", "LAYOUTS"))
 FIRST_USER_NAMESPACE = 0xEFFFFFFD  # of every kernel
 ADMIN = 1 << 21  # CAP_SYS_ADMIN
 libc = ctypes.CDLL(None)
