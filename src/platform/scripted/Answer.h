@@ -37,7 +37,7 @@ class Answer {
     ScriptedTask* taskOfPort(mach_port_t port) const;
     /// The process of `pid` that runs; null otherwise.
     ScriptedTask* runningTask(std::int32_t pid) const;
-    bool isCharged() const { return kernel.selfRegionTally.value_or(0) != 0; }
+    View view() const { return kernel.selfRegionTally.value_or(0) != 0 ? View::charged : View::object; }
 
     /// The end of a call that fails with errno.
     static int refuse(int error) {

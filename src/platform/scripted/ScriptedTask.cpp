@@ -44,14 +44,14 @@ char letterForCounts(const PageCounts& counts, std::size_t index) {
                                                       : '.';
 }
 
-const PageStates& statesOf(const ScriptedMapping& mapping, bool charged) {
-    return !charged && mapping.objectPages ? *mapping.objectPages : mapping.pages;
+const PageStates& statesOf(const ScriptedMapping& mapping, View view) {
+    return view == View::object && mapping.objectPages ? *mapping.objectPages : mapping.pages;
 }
 
 } // namespace
 
-std::int32_t pageWord(const ScriptedMapping& mapping, bool charged, std::size_t index) {
-    const PageStates& states = statesOf(mapping, charged);
+std::int32_t pageWord(const ScriptedMapping& mapping, View view, std::size_t index) {
+    const PageStates& states = statesOf(mapping, view);
     if (!states.words.empty()) {
         return index < states.words.size() ? states.words[index] : 0;
     }
@@ -64,14 +64,14 @@ std::int32_t pageWord(const ScriptedMapping& mapping, bool charged, std::size_t 
     return wordOfLetter(letter, mapping.hasExternalPager());
 }
 
-PageCounts pageCounts(const ScriptedMapping& mapping, bool charged) {
-    const PageStates& states = statesOf(mapping, charged);
+PageCounts pageCounts(const ScriptedMapping& mapping, View view) {
+    const PageStates& states = statesOf(mapping, view);
     if (states.counts) {
         return *states.counts;
     }
     PageCounts counts;
     for (std::size_t index = 0; index < states.length(); ++index) {
-        const std::int32_t word = pageWord(mapping, charged, index);
+        const std::int32_t word = pageWord(mapping, view, index);
         const bool isPresent = (word & present) != 0;
         counts.resident += isPresent ? 1 : 0;
         counts.dirtied += (word & VM_PAGE_QUERY_PAGE_DIRTY) != 0 ? 1 : 0;

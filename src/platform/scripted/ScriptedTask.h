@@ -5,6 +5,7 @@
 
 #pragma once
 
+#include "platform/View.h"
 #include "platform/bsd_process.h"
 #include "platform/dyld_inspection.h"
 #include "platform/gather.h"
@@ -148,10 +149,10 @@ class ScriptedTask : public TaskRecord {
     std::map<std::uint64_t, ScriptedMapping> mappings_; // by start
 };
 
-/// The disposition word of page `index` of `mapping` in the charged or the object's view.
-std::int32_t pageWord(const ScriptedMapping& mapping, bool charged, std::size_t index);
+/// The disposition word of page `index` of `mapping`.
+std::int32_t pageWord(const ScriptedMapping& mapping, View view, std::size_t index);
 
-/// What the kernel counts in `mapping` in the charged or the object's view.
-PageCounts pageCounts(const ScriptedMapping& mapping, bool charged);
+/// What the kernel counts in `mapping`.
+PageCounts pageCounts(const ScriptedMapping& mapping, View view);
 
 } // namespace tally::platform

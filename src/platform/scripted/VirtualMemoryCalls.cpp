@@ -44,7 +44,7 @@ kern_return_t mach_vm_region_recurse(mach_port_t task, std::uint64_t* address, s
     if (mapping == nullptr) {
         return KERN_INVALID_ADDRESS;
     }
-    const PageCounts counts = pageCounts(*mapping, answer.isCharged());
+    const PageCounts counts = pageCounts(*mapping, answer.view());
     const std::uint64_t fullId = mapping->object.value_or(0);
     *address = *mapping->start;
     *size = mapping->size;
@@ -89,7 +89,7 @@ kern_return_t mach_vm_page_range_query(mach_port_t task, std::uint64_t address, 
         }
         const bool isMapped = mapping != nullptr && at >= *mapping->start;
         dispositions[page] =
-            isMapped ? pageWord(*mapping, answer.isCharged(), (at - *mapping->start) / pageSize) : 0;
+            isMapped ? pageWord(*mapping, answer.view(), (at - *mapping->start) / pageSize) : 0;
     }
     *count = pages;
     return KERN_SUCCESS;
@@ -109,8 +109,8 @@ std::uint64_t mach_vm_next_page(mach_port_t task, std::uint64_t address, std::ui
         }
         address = std::max(address, *mapping->start);
         for (; address < std::min(end, mapping->end()); address += answer.kernel.pageSize) {
-            if (pageWord(*mapping, answer.isCharged(),
-                         (address - *mapping->start) / answer.kernel.pageSize) != 0) {
+            if (pageWord(*mapping, answer.view(), (address - *mapping->start) / answer.kernel.pageSize) !=
+                0) {
                 return address;
             }
         }

@@ -19,7 +19,7 @@ bool isSwitch(const char* name) {
 
 } // namespace
 
-bool accountingSwitchIsOn() { return switchValue != 0; }
+View currentView() { return switchValue != 0 ? View::charged : View::object; }
 
 int sysctlbyname_read(const char* name, std::int32_t* value) {
     if (!isSwitch(name)) {

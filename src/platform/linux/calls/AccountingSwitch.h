@@ -2,9 +2,10 @@
 
 #pragma once
 
+#include "platform/View.h"
+
 namespace tally::platform {
 
-/// On: mappings count as charged to the task. Off: as the VM objects see them.
-bool accountingSwitchIsOn();
+View currentView();
 
 } // namespace tally::platform

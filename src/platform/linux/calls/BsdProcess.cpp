@@ -18,9 +18,7 @@
 #include <array>
 #include <cerrno>
 #include <cstring>
-#include <iterator>
 #include <memory>
-#include <ranges>
 #include <string>
 #include <vector>
 
@@ -237,7 +235,9 @@ std::optional<std::vector<owned_vmobject>> sysctl_owned_vmobjects(std::uint32_t 
     }
     task->addNotices(std::move(notes));
     std::vector<owned_vmobject> list;
-    std::ranges::copy(*objects | std::views::values, std::back_inserter(list));
+    for (const auto& [id, object] : *objects) {
+        list.push_back(object);
+    }
     return list;
 }
 

@@ -55,7 +55,7 @@ kern_return_t task_generate_corpse(mach_port_t task, mach_port_t* corpse) {
         return KERN_INVALID_ARGUMENT;
     }
     std::shared_ptr<Corpse> made;
-    const kern_return_t status = makeCorpse(live->identity(), !accountingSwitchIsOn(), &made);
+    const kern_return_t status = makeCorpse(live->identity(), currentView(), &made);
     if (status == KERN_SUCCESS) {
         *corpse = makePort(std::make_shared<Task>(std::move(made)));
     }

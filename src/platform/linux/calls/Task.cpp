@@ -111,8 +111,8 @@ const Walk* Task::walk(kern_return_t* status) {
         if (isSecondTenant() && compareAddressSpaces(identityOf(owner_).pid, identity_.pid) != 0) {
             owner_ = std::make_shared<MemberIdentity>(identity_); // it has loaded another program since
         }
-        Walk::Result result = Walk::read(identity_, key_, identityOf(owner_), !accountingSwitchIsOn(),
-                                         std::exchange(status_, {}));
+        Walk::Result result =
+            Walk::read(identity_, key_, identityOf(owner_), currentView(), std::exchange(status_, {}));
         walkStatus_ = result.status;
         walk_ = std::move(result.walk);
         addNotices(std::move(result.notices));

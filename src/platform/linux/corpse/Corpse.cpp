@@ -81,14 +81,14 @@ bool canHaveLiveRelatives(std::int32_t pid, const FamilyKey& key) {
 constexpr std::size_t mostOpened = 256; // smaps stands in for the others
 
 /// Whether a walk asks the page cache of such a file which of its pages there are.
-bool asksPages(Backing backing, const Mapping& mapping, bool objectView) {
-    return (backing == Backing::sharedMemory && (objectView || machineState().swapInUse)) ||
-           (backing == Backing::file && (objectView || mapping.shared));
+bool asksPages(Backing backing, const Mapping& mapping, View view) {
+    return (backing == Backing::sharedMemory && (view == View::object || machineState().swapInUse)) ||
+           (backing == Backing::file && (view == View::object || mapping.shared));
 }
 
 /// Asks of a running process's files what is needed of them, so that none is asked while the process holds
 /// still.
-FilesAhead askAhead(MemberIdentity task, bool objectView) {
+FilesAhead askAhead(MemberIdentity task, View view) {
     FilesAhead ahead;
     ProcessMemoryFiles files;
     std::vector<Mapping> mappings;
@@ -104,8 +104,7 @@ FilesAhead askAhead(MemberIdentity task, bool objectView) {
         if (known.object.backing == Backing::anonymous) { // new
             known.object = backingOf(mapping, files.folder);
         }
-        if (asksPages(known.object.backing, mapping, objectView) && !known.file.isOpen() &&
-            opened < mostOpened) {
+        if (asksPages(known.object.backing, mapping, view) && !known.file.isOpen() && opened < mostOpened) {
             known.file = openForPageStates(files.folder, mapping);
             ++opened;
         }
@@ -126,7 +125,7 @@ kern_return_t statusOfUnread() { return isRefusal(errno) ? KERN_FAILURE : KERN_T
 
 /// What is found out while the process holds still.
 struct Capture {
-    bool objectView = false;
+    View view = View::charged;
     FilesAhead files;
     bool hasRelatives = false; // by which it is known what else to read
     std::optional<Identification> identification;
@@ -165,7 +164,7 @@ kern_return_t lookAt(MemberIdentity task, SeizedThreads& seized, CorpseSpace& sp
     if (!capture.identification) {
         return statusOfUnread();
     }
-    Walk::Result result = Walk::read(task, FamilyKey(), task, capture.objectView);
+    Walk::Result result = Walk::read(task, FamilyKey(), task, capture.view);
     const auto counted = result.walk ? result.walk->resident() : std::nullopt;
     capture.charges = readCharges(task.pid, false, counted).value_or(Charges());
     const kern_return_t status = result.walk ? result.walk->statusPastEnd() : result.status;
@@ -219,7 +218,7 @@ std::vector<std::string> Corpse::notices() const { return noticesOf(*space_); }
 
 bool Corpse::hasRelatives() const { return !space_->key.isKnown() || countCorpses(space_->key) > 1; }
 
-kern_return_t makeCorpse(MemberIdentity task, bool objectView, std::shared_ptr<Corpse>* corpse) {
+kern_return_t makeCorpse(MemberIdentity task, View view, std::shared_ptr<Corpse>* corpse) {
     const std::optional<ProcessStat> stat = readProcessStat(task.pid);
     const FamilyKey key = stat ? familyKeyOf(*stat) : FamilyKey();
     if (auto space = corpseSpaceOfTwin(key, task)) {
@@ -238,9 +237,9 @@ kern_return_t makeCorpse(MemberIdentity task, bool objectView, std::shared_ptr<C
         space->execRandom = readExecRandom(task.pid);
     }
     Capture capture;
-    capture.objectView = objectView;
+    capture.view = view;
     capture.hasRelatives = canHaveLiveRelatives(task.pid, key);
-    capture.files = askAhead(task, objectView);
+    capture.files = askAhead(task, view);
     SeizedThreads seized;
     const kern_return_t status =
         runApart([&] { return lookAt(task, seized, *space, capture); }, [&] { seized.takeNoteOfEnds(); });

@@ -43,8 +43,7 @@ class Corpse {
 
 /// Makes a corpse of the process `task`. Its threads hold still for as long as it takes to read their page
 /// tables.
-/// @param objectView as for Walk::read.
 /// @return KERN_SUCCESS, or what StoppedThreads or Walk say.
-kern_return_t makeCorpse(MemberIdentity task, bool objectView, std::shared_ptr<Corpse>* corpse);
+kern_return_t makeCorpse(MemberIdentity task, View view, std::shared_ptr<Corpse>* corpse);
 
 } // namespace tally::platform

@@ -1,7 +1,7 @@
 // Gather: what is found out once for all processes that are measured together.
 //
 // Each room keeps its own kind of knowledge in a table that the first who asks makes. All of them go with the
-// gather. Thread-safe; one gather at a time.
+// gather. Thread-safe; one gather at a time. A table is made under the lock: making one asks for no other.
 
 #pragma once
 

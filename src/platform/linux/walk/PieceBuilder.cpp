@@ -129,11 +129,11 @@ void PieceBuilder::build(std::size_t index) {
         // The kernel's pages: part of the task's resident memory, but of no object that could be told from
         // others.
         Piece& piece = addPiece(index, mapping.pages());
-        piece.resident = facts_.objectView ? 0 : static_cast<std::uint32_t>(states.object);
+        piece.resident = facts_.view == View::object ? 0 : static_cast<std::uint32_t>(states.object);
     } else if (backing.backing == Backing::anonymous) {
         addOwnPiece(index, states, restIsApart ? states.own() : mapping.pages());
     } else {
-        DividedObject object = facts_.objectView ? objects_.seen(index) : objects_.charged(index);
+        DividedObject object = facts_.view == View::object ? objects_.seen(index) : objects_.charged(index);
         if (restIsApart || states.own() != 0) { // the task's own pages stand between them
             pack(object.others.words);
             pack(object.marked.words);

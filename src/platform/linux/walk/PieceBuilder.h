@@ -6,6 +6,7 @@
 
 #pragma once
 
+#include "platform/View.h"
 #include "platform/linux/families/FamilyScan.h"
 #include "platform/linux/machine/Charges.h"
 #include "platform/linux/objects/Backing.h"
@@ -24,8 +25,8 @@ namespace tally::platform {
 
 /// What holds for all mappings of a walk.
 struct WalkFacts {
-    MemberIdentity owner;    // who stands for the address space
-    bool objectView = false; // as the VM objects see it
+    MemberIdentity owner; // who stands for the address space
+    View view = View::charged;
     bool swapInUse = false;
     bool asksLazyFree = false; // smaps must be asked for lazily freed pages
     bool asksLocked = false;   // and for locked mappings

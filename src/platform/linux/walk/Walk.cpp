@@ -22,10 +22,10 @@ namespace tally::platform {
 namespace {
 
 /// Finds out which figures that only smaps tells the process can have at all.
-WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, bool objectView, const std::string& folder,
+WalkFacts gatherFacts(MemberIdentity task, MemberIdentity owner, View view, const std::string& folder,
                       std::optional<ProcessStatus> known) {
     const MachineState machine = machineState();
-    WalkFacts facts{.owner = owner, .objectView = objectView, .swapInUse = machine.swapInUse};
+    WalkFacts facts{.owner = owner, .view = view, .swapInUse = machine.swapInUse};
     if (!known) {
         const std::optional<std::string> text = readSystemRecord(folder + "/status");
         known = text ? std::optional(decodeStatus(*text)) : std::nullopt;
@@ -69,7 +69,7 @@ constexpr const char* unreadRelativesNotice =
 
 } // namespace
 
-Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView,
+Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, View view,
                         std::optional<ProcessStatus> known) {
     Result result;
     const NoteTaker taker(result.notices);
@@ -90,7 +90,7 @@ Walk::Result Walk::read(MemberIdentity task, const FamilyKey& key, MemberIdentit
         walk->statusPastEnd_ = space.status;
         space.mappings.resize(space.states.mappings.size());
     }
-    const WalkFacts facts = gatherFacts(task, owner, objectView, space.folder, known);
+    const WalkFacts facts = gatherFacts(task, owner, view, space.folder, known);
     SmapsOfProcess smaps(space.folder);
     PieceBuilder builder(facts, space, smaps);
     for (std::size_t i = 0; i < space.mappings.size(); ++i) {

@@ -5,6 +5,7 @@
 
 #pragma once
 
+#include "platform/View.h"
 #include "platform/kern_return.h"
 #include "platform/linux/families/FamilyKey.h"
 #include "platform/linux/families/SharedParts.h"
@@ -33,9 +34,8 @@ class Walk {
 
     /// Reads the address space of `task`, with its relatives when a gather measures some.
     /// @param owner who stands for the address space: the task, or one that shares it whole.
-    /// @param objectView counts as the VM objects see it instead of as charged to the task.
     /// @param known its status, where that was just read.
-    static Result read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, bool objectView,
+    static Result read(MemberIdentity task, const FamilyKey& key, MemberIdentity owner, View view,
                        std::optional<ProcessStatus> known = {});
 
     /// The first piece that ends above `address`; null when there is none.
