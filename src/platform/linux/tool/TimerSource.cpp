@@ -45,6 +45,7 @@ class KernelTimer final : public TimerSource {
 
     // The kernel's own timers need no leeway.
     void setTimer(std::uint64_t start, std::uint64_t interval, std::uint64_t /*leeway*/) override {
+        isSet_ = true;
         const itimerspec setting{.it_interval = duration(interval), .it_value = duration(start)};
         timerfd_settime(timer_.number(), 0, &setting, nullptr);
     }
@@ -62,7 +63,7 @@ class KernelTimer final : public TimerSource {
                                          pollfd{end_.number(), POLLIN, 0}};
             std::uint64_t ticks = 0;
             if (poll(events.data(), events.size(), longestSleep) > 0 && (events[0].revents & POLLIN) != 0 &&
-                read(timer_.number(), &ticks, sizeof(ticks)) == sizeof(ticks)) {
+                read(timer_.number(), &ticks, sizeof(ticks)) == sizeof(ticks) && isSet_) {
                 // Not read again before the handler has run: what falls due meanwhile adds up.
                 queue_.sync([this, ticks] {
                     if (!isCancelled_) {
@@ -78,6 +79,8 @@ class KernelTimer final : public TimerSource {
     SerialQueue& queue_;
     std::function<void(std::uint64_t)> handler_;
     std::atomic<bool> isCancelled_ = false;
+    // What came before the setting comes before the handler: the descriptor says so to the kernel only.
+    std::atomic<bool> isSet_ = false;
     std::thread thread_;
 };
 
