@@ -1,7 +1,7 @@
 # What ./run and ./test share: the packages and the build folders. Sourced; $root is the checkout.
 
 packages_to_build='g++ cmake ninja-build pkg-config libbsd-dev libelf-dev nlohmann-json3-dev'
-packages_to_test="$packages_to_build libgtest-dev libbenchmark-dev clang-format clang-tidy clang \
+packages_to_test="$packages_to_build libgtest-dev clang-format clang-tidy clang \
     libclang-rt-dev python3 python3-jsonschema bindfs"
 
 # Sees to it that the named Debian packages are there: root installs what is missing, others are told.

@@ -1,4 +1,4 @@
-#include "output/JSONWriter.h"
+#include "base/JSONWriter.h"
 
 #include "base/Format.h"
 #include "base/JSONString.h"

@@ -5,7 +5,7 @@
 
 #pragma once
 
-#include "output/JSONWriter.h"
+#include "base/JSONWriter.h"
 #include "platform/output_file.h"
 #include "report/TLOutputFormatter.h"
 

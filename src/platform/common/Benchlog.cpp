@@ -6,7 +6,7 @@
 #include "platform/benchlog.h"
 
 #include "base/Format.h"
-#include "base/JSONString.h"
+#include "base/JSONWriter.h"
 #include "platform/clock.h"
 #include "platform/output_file.h"
 
@@ -37,47 +37,34 @@ struct Value {
     std::vector<std::string> tags{};
 };
 
-/// Appends `,"name":` to `line`.
-void appendKey(std::string& line, std::string_view name) {
-    line += ',';
-    appendJSONString(line, name);
-    line += ':';
-}
-
-void appendText(std::string& line, std::string_view name, std::string_view text) {
-    appendKey(line, name);
-    appendJSONString(line, text);
+void addText(JSONWriter& json, std::string_view name, std::string_view text) {
+    json.key(name);
+    json.string(text);
 }
 
 /// Leaves out what is empty, as all lists of a line are.
-void appendTexts(std::string& line, std::string_view name, const Texts& texts) {
+void addTexts(JSONWriter& json, std::string_view name, const Texts& texts) {
     if (texts.empty()) {
         return;
     }
-    appendKey(line, name);
-    char separator = '{';
+    json.key(name);
+    json.beginObject();
     for (const auto& [key, text] : texts) {
-        line += separator;
-        appendJSONString(line, key);
-        line += ':';
-        appendJSONString(line, text);
-        separator = ',';
+        addText(json, key, text);
     }
-    line += '}';
+    json.endObject();
 }
 
-void appendTags(std::string& line, const std::vector<std::string>& tags) {
+void addTags(JSONWriter& json, const std::vector<std::string>& tags) {
     if (tags.empty()) {
         return;
     }
-    appendKey(line, "tags");
-    char separator = '[';
+    json.key("tags");
+    json.beginArray();
     for (const std::string& tag : tags) {
-        line += separator;
-        appendJSONString(line, tag);
-        separator = ',';
+        json.string(tag);
     }
-    line += ']';
+    json.endArray();
 }
 
 /// The shortest decimal number, without an exponent, that reads as `number`.
@@ -99,30 +86,43 @@ std::string secondsNow() {
 
 struct BenchlogWriter {
     std::unique_ptr<OutputFile> file;
-    std::optional<std::string> header; // until it is written
+    std::optional<JSONWriter> header; // until it is written
     std::uint64_t group = 0;
     std::optional<Value> value; // the one that can still get something attached
     std::string lines;          // complete, not written yet
 
     void finishHeader() {
         if (header) {
-            lines += *std::exchange(header, std::nullopt) + "}\n";
+            finishLine(*std::exchange(header, std::nullopt));
         }
+    }
+
+    JSONWriter lineOfGroup() const {
+        JSONWriter json;
+        json.beginObject();
+        json.key("group");
+        json.number(group);
+        return json;
+    }
+
+    void finishLine(JSONWriter json) {
+        json.endObject();
+        lines += json.text() + "\n";
     }
 
     void finishValue() {
         if (!value) {
             return;
         }
-        lines += formatted("{\"group\":%" PRIu64, group);
-        appendText(lines, "metric", value->metric);
-        appendText(lines, "unit", value->unit);
-        appendKey(lines, "value");
-        lines += decimal(value->number);
-        appendTexts(lines, "variables", value->variables);
-        appendTexts(lines, "labels", value->labels);
-        appendTags(lines, value->tags);
-        lines += "}\n";
+        JSONWriter json = lineOfGroup();
+        addText(json, "metric", value->metric);
+        addText(json, "unit", value->unit);
+        json.key("value");
+        json.element(decimal(value->number));
+        addTexts(json, "variables", value->variables);
+        addTexts(json, "labels", value->labels);
+        addTags(json, value->tags);
+        finishLine(std::move(json));
         value.reset();
         if (lines.size() >= mostBytesKept) {
             writeLines();
@@ -145,30 +145,35 @@ BenchlogHandle blwriter_open(const std::string& path, std::string_view benchmark
     }
     BenchlogHandle writer(new BenchlogWriter);
     writer->file = std::move(file);
-    writer->header = formatted("{\"benchlog\":%d", formatVersion);
-    appendText(*writer->header, "benchmark", benchmark);
-    *writer->header += formatted(",\"version\":%d", version);
+    JSONWriter& header = writer->header.emplace();
+    header.beginObject();
+    header.key("benchlog");
+    header.signedNumber(formatVersion);
+    addText(header, "benchmark", benchmark);
+    header.key("version");
+    header.signedNumber(version);
     return writer;
 }
 
 void blwriter_set_description(BenchlogWriter& writer, std::string_view description) {
-    appendText(*writer.header, "description", description);
+    addText(*writer.header, "description", description);
 }
 
 void blwriter_set_primary_metric(BenchlogWriter& writer, std::string_view metric) {
-    appendText(*writer.header, "primary_metric", metric);
+    addText(*writer.header, "primary_metric", metric);
 }
 
 void blwriter_new_group(BenchlogWriter& writer) {
     writer.finishHeader();
     writer.finishValue();
     writer.writeLines();
-    writer.lines += formatted("{\"group\":%" PRIu64, ++writer.group);
+    ++writer.group;
+    JSONWriter json = writer.lineOfGroup();
     if (const std::string time = secondsNow(); !time.empty()) {
-        appendKey(writer.lines, "time");
-        writer.lines += time;
+        json.key("time");
+        json.element(time);
     }
-    writer.lines += "}\n";
+    writer.finishLine(std::move(json));
 }
 
 void blwriter_new_value(BenchlogWriter& writer, std::string_view metric, BenchlogUnit unit, double value) {

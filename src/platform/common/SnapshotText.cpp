@@ -1,6 +1,7 @@
 #include "platform/common/SnapshotText.h"
 
-#include <algorithm>
+#include "base/Format.h"
+
 #include <cstddef>
 
 namespace tally::platform {
@@ -14,36 +15,12 @@ bool isEscape(std::string_view sequence) {
     return sequence.size() >= 4 && sequence.starts_with(escapeLead) && (sequence[2] & '\x3E') == '\x3E';
 }
 
-/// Length of the character at the start of `text`, as strict readers of UTF-8 see it; 0 when there is none.
-std::size_t characterLength(std::string_view text) {
-    const auto byte = [&](std::size_t at) { return static_cast<unsigned char>(text[at]); };
-    const unsigned lead = byte(0);
-    const std::size_t length = lead < 0x80   ? 1
-                               : lead < 0xC2 ? 0
-                               : lead < 0xE0 ? 2
-                               : lead < 0xF0 ? 3
-                               : lead < 0xF5 ? 4
-                                             : 0;
-    if (length < 2) {
-        return length;
-    }
-    // The second byte decides on forms that are too long, surrogates and what lies beyond the last character.
-    const unsigned lowest = lead == 0xE0 ? 0xA0 : lead == 0xF0 ? 0x90 : 0x80;
-    const unsigned highest = lead == 0xED ? 0x9F : lead == 0xF4 ? 0x8F : 0xBF;
-    if (text.size() < length || byte(1) < lowest || byte(1) > highest) {
-        return 0;
-    }
-    const bool isWhole = std::all_of(text.begin() + 2, text.begin() + static_cast<std::ptrdiff_t>(length),
-                                     [](char c) { return (c & '\xC0') == '\x80'; });
-    return isWhole ? length : 0;
-}
-
 } // namespace
 
 std::string snapshotTextOfName(std::string_view name) {
     std::string text;
     while (!name.empty()) {
-        const std::size_t length = characterLength(name);
+        const std::size_t length = utf8SequenceLength(name);
         if (length != 0 && !isEscape(name)) {
             text += name.substr(0, length);
             name.remove_prefix(length);

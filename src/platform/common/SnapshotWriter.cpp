@@ -1,44 +1,42 @@
 // SnapshotWriter: a snapshot as a document, one region a line. What a key stands for when it is left out is
 // not written.
 
+#include "base/JSONWriter.h"
 #include "platform/common/SnapshotKeys.h"
 #include "platform/common/SnapshotText.h"
 #include "platform/quarry.h"
 
-#include <nlohmann/json.hpp>
+#include <string_view>
 
 namespace tally::platform {
 
 namespace {
 
-using Json = nlohmann::ordered_json;
+void addText(JSONWriter& json, const char* key, std::string_view text) {
+    json.key(key);
+    json.string(text);
+}
+
+void addName(JSONWriter& json, const char* key, std::string_view name) {
+    addText(json, key, snapshotTextOfName(name));
+}
 
 template <typename Record, typename Numbers, typename Flags>
-void addKeys(Json& object, const Record& record, const Numbers& numbers, const Flags& flags) {
+void addKeys(JSONWriter& json, const Record& record, const Numbers& numbers, const Flags& flags,
+             std::string_view leftOut = {}) {
     static const Record missing;
     for (const auto& key : numbers) {
-        if (key.isRequired || key.get(record) != key.get(missing)) {
-            object[key.name] = key.get(record);
+        if ((key.isRequired || key.get(record) != key.get(missing)) && key.name != leftOut) {
+            json.key(key.name);
+            json.number(key.get(record));
         }
     }
     for (const auto& key : flags) {
         if (key.isRequired || record.*(key.member) != missing.*(key.member)) {
-            object[key.name] = record.*(key.member);
+            json.key(key.name);
+            json.boolean(record.*(key.member));
         }
     }
-}
-
-Json documentOf(const QRYSnapshot& snapshot) {
-    Json document;
-    document["format"] = snapshotFormat;
-    document["version"] = snapshotVersion;
-    document["process_name"] = snapshotTextOfName(snapshot.processName);
-    document["architecture"] = snapshot.architecture;
-    if (!snapshot.binaryImages.empty()) {
-        document["binary_images"] = snapshotTextOfName(snapshot.binaryImages);
-    }
-    addKeys(document, snapshot, snapshotNumbers, snapshotFlags);
-    return document;
 }
 
 /// Tags that the platform has given to names mean something in this run only: they travel as names.
@@ -47,31 +45,41 @@ std::optional<std::string> nameOfTag(std::uint32_t tag) {
     return name && !name->starts_with("Memory Tag") ? name : std::nullopt;
 }
 
-Json documentOf(const QRYVMRegion& region) {
-    Json document;
-    addKeys(document, region, snapshotRegionNumbers, snapshotRegionFlags);
-    document["type"] = snapshotTextOfName(region.type.view());
+void addRegion(JSONWriter& json, const QRYVMRegion& region) {
+    const std::optional<std::string> tagName = nameOfTag(region.user_tag);
+    json.beginObject();
+    addKeys(json, region, snapshotRegionNumbers, snapshotRegionFlags, tagName ? "user_tag" : "");
+    addName(json, "type", region.type.view());
     if (!region.path.isNull()) {
-        document["path"] = snapshotTextOfName(region.path.view());
+        addName(json, "path", region.path.view());
     }
-    if (const std::optional<std::string> name = nameOfTag(region.user_tag)) {
-        document.erase("user_tag");
-        document["tag_name"] = snapshotTextOfName(*name);
+    if (tagName) {
+        addName(json, "tag_name", *tagName);
     }
-    return document;
+    json.endObject();
 }
 
 } // namespace
 
 std::string QRYDataWithSnapshot(const QRYSnapshot& snapshot) {
-    std::string text = documentOf(snapshot).dump();
-    text.back() = ','; // the regions come last
-    text += "\"regions\":[";
-    const char* separator = "\n";
+    JSONWriter json;
+    json.beginObject();
+    addText(json, "format", snapshotFormat);
+    json.key("version");
+    json.number(snapshotVersion);
+    addName(json, "process_name", snapshot.processName);
+    addText(json, "architecture", snapshot.architecture);
+    if (!snapshot.binaryImages.empty()) {
+        addName(json, "binary_images", snapshot.binaryImages);
+    }
+    addKeys(json, snapshot, snapshotNumbers, snapshotFlags);
+    json.key("regions"); // last
+    json.beginArray();
+    std::string text = json.takeText();
     for (const QRYVMRegion& region : snapshot.regions) {
-        text += separator;
-        text += documentOf(region).dump();
-        separator = ",\n";
+        addRegion(json, region);
+        const std::string written = json.takeText();
+        text += written.starts_with(',') ? ",\n" + written.substr(1) : "\n" + written;
     }
     return text + "\n]}\n";
 }
