@@ -1,6 +1,7 @@
 #include "scripted/KernelFromCase.h"
 
 #include <cctype>
+#include <sstream>
 #include <stdexcept>
 
 namespace tally {
@@ -35,6 +36,16 @@ class KernelBuilder {
             addTasks(statement);
         } else if (keyword == "map") {
             addMapping(statement);
+        } else if (keyword == "cache") {
+            for (ScriptedTask* task : tasks_) {
+                task->sharedCache = dyld_shared_cache{
+                    .uuid = {static_cast<std::uint8_t>(statement.number("uuid").value_or(1))},
+                    .base_address = statement.number("base").value(),
+                    .mapped_size = statement.number("size").value(),
+                    .mapped_private = statement.flag("private")};
+            }
+        } else if (keyword == "image") {
+            addImage(statement);
         } else if (keyword == "owned") {
             addOwnedObject(statement);
         } else if (keyword == "notice") {
@@ -83,6 +94,9 @@ class KernelBuilder {
     void setUpMachine(CaseStatement& statement) {
         kernel_.effectiveUserId = static_cast<std::uint32_t>(statement.number("uid").value_or(0));
         kernel_.pageSize = statement.number("page-size").value_or(kernel_.pageSize);
+        if (statement.flag("short-ids")) {
+            kernel_.submapInfoCount = VM_REGION_SUBMAP_INFO_V1_COUNT_64;
+        }
         if (const auto state = statement.text("switch")) {
             kernel_.selfRegionTally =
                 *state == "absent" ? std::nullopt : std::optional(*state == "on" ? 1 : 0);
@@ -105,19 +119,52 @@ class KernelBuilder {
         record.portStatus = static_cast<kern_return_t>(statement.number("port").value_or(KERN_SUCCESS));
         record.dirtyFlags = static_cast<std::uint32_t>(statement.number("dirty").value_or(0));
         record.state = statement.flag("zombie") ? TaskState::zombie : TaskState::alive;
+        if (statement.flag("no-owned-list")) {
+            record.owned.reset();
+        }
         tasks_.clear();
         for (record.pid = first; record.pid <= last; ++record.pid) {
             tasks_.push_back(&kernel_.addTask(record));
         }
     }
 
+    /// "name@start+size" is a segment.
+    void addImage(CaseStatement& statement) {
+        RKSymbolOwner image{
+            .path = takeWord(statement), .base_address = statement.number("base").value(), .segments = {}};
+        while (!statement.words.empty()) {
+            const std::string word = takeWord(statement);
+            const std::size_t at = word.rfind('@');
+            const std::size_t plus = word.rfind('+');
+            image.segments.push_back({.start = caseNumber(word.substr(at + 1, plus - at - 1)),
+                                      .size = caseNumber(word.substr(plus + 1)),
+                                      .name = word.substr(0, at)});
+        }
+        for (ScriptedTask* task : tasks_) {
+            task->images.push_back(image);
+        }
+    }
+
+    /// "9,0x10": raw dispositions.
+    static PageStates pagesOf(CaseStatement& statement, const std::string& key) {
+        if (const auto letters = statement.text(key)) {
+            return repeatedLetters(*letters);
+        }
+        std::vector<std::int32_t> words;
+        std::istringstream numbers(statement.text(key + "-words").value_or(""));
+        for (std::string number; std::getline(numbers, number, ',');) {
+            words.push_back(static_cast<std::int32_t>(caseNumber(number)));
+        }
+        return words;
+    }
+
     void addMapping(CaseStatement& statement) {
         ScriptedMapping mapping{.start = statement.number("start")};
         mapping.size = statement.number("size").value_or(0);
         mapping.tag = static_cast<std::uint32_t>(statement.number("tag").value_or(0));
-        mapping.pages = repeatedLetters(statement.text("pages").value_or(""));
-        if (const auto pages = statement.text("object-pages")) {
-            mapping.objectPages = repeatedLetters(*pages);
+        mapping.pages = pagesOf(statement, "pages");
+        if (const PageStates pages = pagesOf(statement, "object-pages"); pages.length() != 0) {
+            mapping.objectPages = pages;
         }
         mapping.object = statement.number("object");
         mapping.offset = statement.number("offset").value_or(0);
@@ -129,9 +176,21 @@ class KernelBuilder {
             mapping.externalPager = *external != 0;
         }
         mapping.purgeable = static_cast<int>(statement.number("purgeable").value_or(VM_PURGABLE_DENY));
+        mapping.purgeableStatus =
+            static_cast<kern_return_t>(statement.number("purgeable-fails").value_or(KERN_SUCCESS));
         mapping.wiredCount = statement.flag("wired") ? 1 : 0;
-        for (ScriptedTask* task : tasks_) {
-            task->map(mapping);
+        open_.push_back({mapping, statement.number("submap").value_or(0)});
+        for (; !open_.empty() && open_.back().missing == 0;
+             open_.pop_back()) { // whole, with all that it holds
+            const ScriptedMapping& whole = open_.back().mapping;
+            if (open_.size() > 1) {
+                open_[open_.size() - 2].mapping.nested.push_back(whole);
+                --open_[open_.size() - 2].missing;
+                continue;
+            }
+            for (ScriptedTask* task : tasks_) {
+                task->map(whole);
+            }
         }
     }
 
@@ -155,6 +214,11 @@ class KernelBuilder {
 
     ScriptedKernel& kernel_;
     std::vector<ScriptedTask*> tasks_; // those of the last task line
+    struct Submap {
+        ScriptedMapping mapping;
+        std::uint64_t missing = 0; // mappings in it that are yet to come
+    };
+    std::vector<Submap> open_; // the outermost first
 };
 
 } // namespace
