@@ -32,37 +32,6 @@ TEST_F(OwnedMemory, IsChargedWhereItIsMappedFirstElseUnmapped) {
     EXPECT_EQ(walkedLines().at(0), "10000+3000 audio d3000");
 }
 
-// Without a list: what is found behind purgeable mappings comes off the kernel's one figure.
-TEST_F(OwnedMemory, WithoutAListComesOffTheKernelsFigure) {
-    const std::string surplus = "p [7]: Tally changed while analyzing – unmapped owned physical tally may be "
-                                "over-counted by 4096 bytes";
-    const std::string rest = "unmapped+9000 Owned physical tally (unmapped)";
-    const std::tuple<PageCounts, PageCounts, Lines> cases[] = {
-        {{}, {2, 2, 0, 1}, {"10000+9000 audio", rest + " d2000 s1000"}},
-        {{2, 1, 0, 4},
-         {3, 3, 0, 1},
-         {"10000+9000 audio d2000 owned", rest + " d1000 s1000"}}, // clean is dirty
-        {{3, 3}, {2, 2, 0, 2}, {"10000+9000 audio d3000 owned", rest + " s1000"}},
-        {{3, 3}, {2, 2, 0, 1}, {"10000+9000 audio d3000 owned"}},
-        {{4, 4}, {2, 2, 0, 1}, {"10000+9000 audio d4000 owned", surplus}},
-    };
-    task.owned.reset();
-    task.map({.start = 0xa0000, .pages = "D"}); // the walk ends before it
-    for (const auto& [found, unmapped, expected] : cases) {
-        task.map({.start = 0x10000, .size = 0x9000, .tag = 90, .pages = found, .purgeable = 0});
-        task.map({.start = 0x80000, .size = 0x9000, .tag = TLUnmappedTag, .pages = unmapped});
-        EXPECT_EQ(walkedLines(), expected);
-        task.unmap(0x10000);
-        task.unmap(0x80000);
-    }
-    task.map({.tag = 87, .pages = "DC", .purgeable = 0});
-    task.map({.tag = 90, .pages = "DC"}); // not purgeable
-    task.map({.tag = 90, .pages = "SS", .purgeable = 0});
-    for (const std::string& line : walkedLines()) {
-        EXPECT_EQ(line.find("owned"), std::string::npos) << line;
-    }
-}
-
 TEST_F(OwnedMemory, IsNotListedWhereThereIsNoList) {
     walk();
     testing::internal::CaptureStderr();

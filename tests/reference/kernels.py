@@ -1,9 +1,9 @@
 """Random kernels in which what is rare on a real machine is common, and their text as a case file."""
-import dataclasses, random
+import dataclasses, itertools, random
 
 from model import DIRTY, EXTERNAL, PAGED_OUT, PRESENT, REUSABLE, UNMAPPED_TAG, round_up
 
-CACHE_BASE = 0x180000000
+CACHE_BASES = [0x180000000, 0x180000000, 0x1A0000000]
 RESERVED = [(0xFC0000000, 0x40000000), (0x1000000000, 0x6000000000), (0x1000000000, 0x5000000000)]
 SEGMENTS = ["__TEXT", "__TEXT_EXEC", "__DATA", "__DATA x", "__OBJC_RO", "__LINKEDIT", "__LINKEDIT_2", "MACH_HEADER", "", "other"]
 
@@ -14,6 +14,7 @@ class Mapping:
     size: int
     words: list = dataclasses.field(default_factory=list)  # what is charged; a disposition a page, 0 past the end
     object_words: list = dataclasses.field(default_factory=list)  # what the object holds; empty: the same
+    counts: tuple = None  # resident, dirty, reusable and swapped pages where the mapping's counts say otherwise than `words`
     tag: int = 0
     object: int = 0
     offset: int = 0
@@ -61,6 +62,7 @@ class Task:
     owned: dict  # by id; None: no list
     cache: Cache
     images: list
+    links: dict  # of paths
     mappings: list
 
 
@@ -118,8 +120,13 @@ class Maker:
         mapping.purge_fails = self.chance(5)
         mapping.wired = self.chance(10)
         self.contents(mapping)
+        if self.chance(4):  # more than one query asks for, with gaps
+            mapping.size = self.random.randrange(4090, 9000) * self.page
+            mapping.words += [0] * self.random.randrange(3000, 4100) + mapping.words
+        if self.chance(8):  # as when pages come and go between two counters
+            mapping.counts = tuple(self.random.randrange(6) for _ in range(4))
         uniform = self.random.randrange(10)  # mappings that are wholly of one kind, or untouched
-        if uniform < 3:
+        if uniform < 3 and mapping.size < 100 * self.page:
             mapping.words = [(PRESENT | DIRTY, PRESENT | EXTERNAL, 0)[uniform]] * (mapping.size // self.page)
         return mapping
 
@@ -148,23 +155,24 @@ class Maker:
 
     def with_cache(self, task):
         uuid = self.one(1, 1, 2)
-        size = self.cache_sizes[uuid]
-        task.cache = Cache(uuid, CACHE_BASE, size, self.chance(10))
+        size, base = self.cache_sizes[uuid], self.one(*CACHE_BASES)
+        task.cache = Cache(uuid, base, size, self.chance(10))
         ids = dict(object=self.one(70, 70, 71), offset=0x5000, share=self.one(1, 4), external=True, wired=self.chance(20))
         if self.chance(50):
             middle = self.random.randrange(1, size // self.page) * self.page
-            whole = Mapping(CACHE_BASE, size, **ids)
-            whole.nested = [self.contents(Mapping(CACHE_BASE, middle, tag=33, **ids)),
-                            self.contents(Mapping(CACHE_BASE + middle, size - middle, tag=33, **ids))]
+            whole = Mapping(base, size, **ids)
+            whole.nested = [self.contents(Mapping(base, middle, tag=33, **ids)),
+                            self.contents(Mapping(base + middle, size - middle, tag=33, **ids))]
         else:
-            whole = self.contents(Mapping(CACHE_BASE, size, **ids))
-        segments = [s for s in self.cache_segments if s[1] < CACHE_BASE + size]
+            whole = self.contents(Mapping(base, size, **ids))
+        segments = [(name, base + start, length) for name, start, length in self.cache_segments if start < size]
         half = len(segments) // 2
-        task.images += [Image("/lib one", CACHE_BASE, segments[:half]), Image("/lib two", CACHE_BASE + 1, segments[half:])]
+        task.images += [Image("/lib one", base, segments[:half]), Image("/lib two", base + 1, segments[half:])]
         return [whole]
 
     def task(self, pid):
-        task = Task(pid, self.one("p", "q") + str(pid), self.one(0, 0x3000, -5), None, None, [], [])
+        task = Task(pid, self.one("p", "q") + str(pid), self.one(0, 0x3000, -5), None, None, [], {}, [])
+        task.links = self.one({}, {"/bin/p": "/bin/real", "/lib one": "/never asked"})
         task.mappings = self.mappings(self.one(0x10000, 0x40000000))
         if self.chance(30):  # what an image covers
             first = task.mappings[0]
@@ -172,7 +180,7 @@ class Maker:
         if self.chance(50):
             task.mappings += self.with_cache(task)
         if self.chance(40):
-            task.mappings += self.mappings(CACHE_BASE + 0x8000000)
+            task.mappings += self.mappings(0x1B0000000)
         if self.chance(20):
             task.mappings += [Mapping(*self.one(*RESERVED), object=3)]
         if self.chance(60):
@@ -190,7 +198,7 @@ class Maker:
 
     def kernel(self):
         self.cache_sizes = {uuid: self.random.randrange(2, 12) * self.page for uuid in (1, 2)}
-        self.cache_segments = self.segments(CACHE_BASE + self.one(0, 0x800, self.page), 10 * self.page)
+        self.cache_segments = self.segments(self.one(0, 0x800, self.page), 10 * self.page)
         tasks = [self.task(100 + i) for i in range(self.random.randrange(1, 5))]
         charged = self.chance(70)
         targets = [task.pid for task in tasks if task.pid == 100 or self.chance(60)]
@@ -209,11 +217,11 @@ def statement(keyword, **values):
 
 
 def mapping_lines(mapping):
-    words = lambda list: ",".join(map(str, list))
+    words = lambda list: ",".join("%d*%d" % (word, len([*run])) for word, run in itertools.groupby(list))
     yield statement("map", start=hex(mapping.start), size=mapping.size, submap=len(mapping.nested) or None, tag=mapping.tag,
                     object=mapping.object, offset=mapping.offset, share=mapping.share, file=escaped(mapping.file),
                     external=int(mapping.external), purgeable=mapping.purgeable, purgeable_fails=5 if mapping.purge_fails else None,
-                    wired=mapping.wired, pages_words=words(mapping.words), object_pages_words=words(mapping.object_words))
+                    wired=mapping.wired, counts=mapping.counts and ",".join(map(str, mapping.counts)), pages_words=words(mapping.words), object_pages_words=words(mapping.object_words))
     for inner in mapping.nested:
         yield from mapping_lines(inner)
 
@@ -225,6 +233,7 @@ def case_of(kernel):
                                no_owned_list=task.owned is None))
         if task.cache:
             lines.append(statement("cache", uuid=task.cache.uuid, base=task.cache.base, size=task.cache.size, private=task.cache.private))
+        lines += ["link %s %s" % (escaped(link), escaped(target)) for link, target in task.links.items()]
         for image in task.images:
             segments = " ".join("%s@%d+%d" % (escaped(name), start, size) for name, start, size in image.segments)
             lines.append("image %s base=%d %s" % (escaped(image.path), image.base, segments))

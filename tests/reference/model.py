@@ -83,7 +83,7 @@ def walked_mappings(task):
     """Every mapping, or the cache's as one: (mapping, whether it is the cache's as one)."""
     cache = shared_cache(task)
     # What lies below the cache is searched for to 16 MiB; without anything there the cache is walked like the rest.
-    is_passed = cache and any(m.start > 16 << 20 and m.start + m.size <= cache.base for m in task.mappings)
+    is_passed = cache and any(16 << 20 < m.start + m.size <= cache.base for m in task.mappings)
     seen_unmapped = False
     for top in task.mappings:
         if is_passed and top.start < cache.base + cache.size and top.start + top.size > cache.base:
@@ -112,7 +112,7 @@ def segments_of(task):
         in_cache = cache and cache.base <= image.base < cache.base + cache.size
         for name, start, size in image.segments:
             shown = "__TEXT" if name == "MACH_HEADER" else name.split(" ")[0] or "unknown"
-            kind, path = segment_kind(shown), image.path
+            kind, path = segment_kind(shown), image.path if in_cache else task.links.get(image.path, image.path)
             if in_cache and kind == "linkedit":
                 if start in linkedits:
                     continue
@@ -176,12 +176,16 @@ def cache_pieces(kernel, task, segments, mapping, as_one):
     return pieces
 
 
-def counted_sizes(kernel, mapping, purge):
+def counts_of(kernel, mapping):
     words = words_of(kernel, mapping)
-    resident = sum(1 for w in words if w & PRESENT)
-    reusable = sum(1 for w in words if w & PRESENT and w & REUSABLE)
-    written = sum(1 for w in words if w & DIRTY)
-    swapped = sum(1 for w in words if w & PAGED_OUT)
+    if mapping.counts and words is mapping.words:
+        return mapping.counts
+    return [sum(1 for w in words if is_counted(w)) for is_counted in (lambda w: w & PRESENT, lambda w: w & DIRTY, lambda w:
+            w & PRESENT and w & REUSABLE, lambda w: w & PAGED_OUT)]
+
+
+def counted_sizes(kernel, mapping, purge):
+    resident, written, reusable, swapped = counts_of(kernel, mapping)
     if purge == EMPTIED:
         return [0, 0, 0, mapping.size, 0]
     if purge == VOLATILE:
@@ -192,7 +196,7 @@ def counted_sizes(kernel, mapping, purge):
 
 
 def runs_of_pages(kernel, mapping, region, purge):
-    """The ranges of one state, by their place in the object."""
+    """The ranges of one state, by their place in the object; None without any."""
     def kind(word):
         return 1 if word & PAGED_OUT else 0 if word & DIRTY else \
             3 if word & (PRESENT if purge == VOLATILE else REUSABLE) else 2 if word & PRESENT else None
@@ -204,7 +208,7 @@ def runs_of_pages(kernel, mapping, region, purge):
             sizes[state] = length
             ranges.add(at, length, kernel.page, sizes)
         at += length
-    return ranges
+    return ranges if ranges.nodes else None
 
 
 def charge_owned(region, owned):
@@ -250,7 +254,7 @@ def regions_of(kernel, task, hidden, warn):
                 region.name = with_ledger(region.name, record.tag)
                 behind_mappings += region.charged()
             elif kernel.charged and owned is None and purge != NOT_PURGEABLE and mapping.tag != 87 and \
-                    any(w & PRESENT for w in words_of(kernel, mapping)):
+                    counts_of(kernel, mapping)[0]:
                 region.owned = True
                 region.sizes = [region.sizes[0] + region.sizes[2], 0, 0, region.sizes[3], 0]
                 behind_mappings += region.charged()

@@ -46,6 +46,12 @@ class KernelBuilder {
             }
         } else if (keyword == "image") {
             addImage(statement);
+        } else if (keyword == "link") {
+            const std::string link = takeWord(statement);
+            const std::string target = takeWord(statement);
+            for (ScriptedTask* task : tasks_) {
+                task->resolvedPaths[link] = target;
+            }
         } else if (keyword == "owned") {
             addOwnedObject(statement);
         } else if (keyword == "notice") {
@@ -145,7 +151,7 @@ class KernelBuilder {
         }
     }
 
-    /// "9,0x10": raw dispositions.
+    /// "9,0*100,0x10": raw dispositions, one of them a hundred times.
     static PageStates pagesOf(CaseStatement& statement, const std::string& key) {
         if (const auto letters = statement.text(key)) {
             return repeatedLetters(*letters);
@@ -153,7 +159,9 @@ class KernelBuilder {
         std::vector<std::int32_t> words;
         std::istringstream numbers(statement.text(key + "-words").value_or(""));
         for (std::string number; std::getline(numbers, number, ',');) {
-            words.push_back(static_cast<std::int32_t>(caseNumber(number)));
+            const std::size_t star = number.find('*');
+            const std::size_t times = star == std::string::npos ? 1 : std::stoul(number.substr(star + 1));
+            words.insert(words.end(), times, static_cast<std::int32_t>(caseNumber(number.substr(0, star))));
         }
         return words;
     }
@@ -163,6 +171,12 @@ class KernelBuilder {
         mapping.size = statement.number("size").value_or(0);
         mapping.tag = static_cast<std::uint32_t>(statement.number("tag").value_or(0));
         mapping.pages = pagesOf(statement, "pages");
+        if (const auto counts = statement.text("counts")) {
+            PageCounts& told = mapping.pages.counts.emplace();
+            char comma = 0;
+            std::istringstream(*counts) >> told.resident >> comma >> told.dirtied >> comma >> told.reusable >>
+                comma >> told.swapped;
+        }
         if (const PageStates pages = pagesOf(statement, "object-pages"); pages.length() != 0) {
             mapping.objectPages = pages;
         }

@@ -7,9 +7,11 @@
 //     map start=1M size=64K tag=2 pages=D3C2S1.8 object-pages=... object=7 offset=4K share=4 file=/a/b
 //         external=1 purgeable=1 wired         (on one line) one mapping of the task or tasks above
 //     map submap=2 size=1M                     the next two lines are what this submap holds
-//     map pages-words=9,0x10 purgeable-fails=5 raw dispositions; a state that cannot be read
+//     map pages-words=9,0*7,16 purgeable-fails=5 raw dispositions; a state that cannot be read
+//     map pages=D counts=1,1,2,0               resident, dirty, reusable, swapped where the pages say otherwise
 //     cache uuid=1 base=0x180000000 size=64K private
 //     image /lib base=0x180000000 __TEXT@0x180000000+12K __DATA\sx@0x180003000+1
+//     link /lib /usr/lib                       where a path leads
 //     owned id=9 virtual=64K resident=16K wired=0 reusable=0 swapped=4K tag=4 purgeable=0 no-tally
 //     notice TEXT                             what the platform has to say about it
 //   fail CALL ERROR nth=2 times=3 pid=100     as ScriptedKernel::fail; "times=always"
