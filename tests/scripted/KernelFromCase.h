@@ -7,8 +7,8 @@
 //     map start=1M size=64K tag=2 pages=D3C2S1.8 object-pages=... object=7 offset=4K share=4 file=/a/b
 //         external=1 purgeable=1 wired         (on one line) one mapping of the task or tasks above
 //     map submap=2 size=1M                     the next two lines are what this submap holds
-//     map pages-words=9,0*7,16 purgeable-fails=5 raw dispositions; a state that cannot be read
-//     map pages=D counts=1,1,2,0               resident, dirty, reusable, swapped where the pages say otherwise
+//     map pages-words=9,0*7,16 purgeable-fails=5 raw; a state that cannot be read
+//     map pages=D counts=1,1,2,0               resident, dirty, reusable, swapped, told otherwise
 //     cache uuid=1 base=0x180000000 size=64K private
 //     image /lib base=0x180000000 __TEXT@0x180000000+12K __DATA\sx@0x180003000+1
 //     link /lib /usr/lib                       where a path leads
