@@ -41,12 +41,16 @@ TEST_P(Golden, PrintsWhatTheCaseSays) {
     for (std::size_t run = 0; run < file.runs.size(); ++run) {
         const CaseRun& expected = file.runs[run];
         SCOPED_TRACE(path + ", run " + std::to_string(run + 1));
-        const std::string command = std::string("cd ") + folder + " && exec '" + TALLY_SCRIPTED + "' '" +
-                                    path + "' " + std::to_string(run) + " >out 2>err";
+        const std::string command = std::string("cd ") + folder + " && TZ=UTC0 exec '" + TALLY_SCRIPTED +
+                                    "' '" + path + "' " + std::to_string(run) + " >out 2>err";
         const int ended = std::system(command.c_str());
         EXPECT_TRUE(WIFEXITED(ended) && WEXITSTATUS(ended) == expected.status) << "wait status " << ended;
         EXPECT_EQ(contents(std::string(folder) + "/out"), expected.standardOutput);
         EXPECT_EQ(contents(std::string(folder) + "/err"), expected.standardError);
+        for (const auto& [name, text] : expected.files) {
+            std::string found = contents(std::string(folder) + "/" + name);
+            EXPECT_EQ(found.ends_with('\n') ? found : found + "\n", text);
+        }
     }
     std::filesystem::remove_all(folder);
 }

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <fstream>
+#include <regex>
 #include <sstream>
 #include <stdexcept>
 
@@ -100,8 +101,7 @@ CaseFile CaseFile::read(const std::string& path) {
             continue;
         }
         if (keyword == "run") {
-            result.runs.push_back(
-                {.arguments = statement.words, .status = 0, .standardOutput = "", .standardError = ""});
+            result.runs.emplace_back().arguments = statement.words;
         } else if (result.runs.empty()) {
             result.kernel.push_back(std::move(statement));
         } else if (keyword == "status") {
@@ -112,6 +112,10 @@ CaseFile CaseFile::read(const std::string& path) {
             result.runs.back().standardOutput = readBlock(file, lineNumber);
         } else if (keyword == "stderr") {
             result.runs.back().standardError = readBlock(file, lineNumber);
+        } else if (keyword == "file") {
+            const std::string block = readBlock(file, lineNumber);
+            result.runs.back().files[statement.words.at(0)] =
+                std::regex_replace(block, std::regex("\n +"), "");
         } else {
             throw std::runtime_error(place + ": unknown keyword " + keyword);
         }

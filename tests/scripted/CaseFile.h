@@ -11,6 +11,9 @@
 //   stderr                                    left out: nothing
 //   ...
 //   end
+//   file out.json                             what the run leaves in its folder: as stdout; a line that begins
+//   ...                                       with blanks continues the one before, without them
+//   end
 //
 // Blanks separate words. In a word \x41 is a byte, \s a blank, \n a newline and \\ a backslash.
 
@@ -48,6 +51,7 @@ struct CaseRun {
     int status = 0;
     std::string standardOutput;
     std::string standardError;
+    std::map<std::string, std::string> files; // contents by name
 };
 
 struct CaseFile {
