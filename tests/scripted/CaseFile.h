@@ -11,8 +11,8 @@
 //   stderr                                    left out: nothing
 //   ...
 //   end
-//   file out.json                             what the run leaves in its folder: as stdout; a line that begins
-//   ...                                       with blanks continues the one before, without them
+//   file out.json                             what the run leaves in its folder, as stdout; a line that
+//   ...                                       begins with blanks continues the one before, without them
 //   end
 //
 // Blanks separate words. In a word \x41 is a byte, \s a blank, \n a newline and \\ a backslash.
