@@ -26,10 +26,10 @@ Name typeOf(const TLMemoryRegion& region, bool isFile) {
 void SnapshotCapture::enumerateRegions(const RegionCallback& callback) {
     const std::size_t warningsBefore = warnings().size(); // a walk that breaks off leaves one, or an error
     TLUserProcess::enumerateRegions([&](const EnumeratedRegion& mapping) {
-        const std::size_t before = walk.regions.size();
+        const std::size_t before = walk_.regions.size();
         const bool ends = callback(mapping);
-        for (std::size_t i = before; i < walk.regions.size(); ++i) {
-            addRegion(mapping, walk.regions[i]);
+        for (std::size_t i = before; i < walk_.regions.size(); ++i) {
+            addRegion(mapping, walk_.regions[i]);
         }
         return ends;
     });

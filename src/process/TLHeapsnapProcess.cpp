@@ -170,7 +170,7 @@ void TLHeapsnapProcess::enumerateRegions(const RegionCallback& callback) {
             image.size = region.length;
             image.ownerPath =
                 inCache && image.segment == TLSegmentKind::linkedit ? sharedLinkedit : region.path;
-            walk.images.push_back(image); // the callback names the region by it
+            walk_.images.push_back(image); // the callback names the region by it
         }
         return callback(describe(region, inCache));
     });

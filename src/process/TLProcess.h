@@ -26,7 +26,7 @@ namespace tally {
 /// What is known of a process's readiness to be ended when idle.
 enum class TLIdleExitStatus : std::int32_t { unknown = 0, notTracked = 1, clean = 2, dirty = 3 };
 
-class TLProcess : public virtual MemoryHolder {
+class TLProcess : public MemoryHolder {
   public:
     using RegionList = std::vector<TLMemoryRegion>;
 

@@ -56,7 +56,7 @@ void TLUserProcess::gatherPageTableSize() {
     std::vector<ledger_entry_info> entries(*layout.entryCount);
     const int count = ledger_entries(pid(), entries);
     if (count < 0) {
-        reportWarning("Unable to retrieve ledger entry info");
+        walk_.reportWarning("Unable to retrieve ledger entry info");
         return;
     }
     tl_assert(static_cast<std::size_t>(count) > *layout.pageTable, "count > pageTableIndex");
@@ -90,21 +90,40 @@ void TLUserProcess::_setIdleExitStatusFromDirtyFlags(std::uint32_t flags) {
     }
 }
 
-void TLUserProcess::_gatherImageData() { tally::gatherImageData(*this); }
+void TLUserProcess::_gatherImageData() { tally::gatherImageData(walk_); }
 
-std::optional<OwnedVmObjects> TLUserProcess::_gatherOwnedVmObjects() { return gatherOwnedVmObjects(*this); }
+std::optional<OwnedVmObjects> TLUserProcess::_gatherOwnedVmObjects() { return gatherOwnedVmObjects(walk_); }
 
 void TLUserProcess::enumerateRegions(const RegionCallback& callback) {
-    tally::enumerateRegions(*this, callback);
+    tally::enumerateRegions(walk_, callback);
 }
 
 bool TLUserProcess::_populateMemoryRegionWithPageQueries(TLMemoryRegion& region,
                                                          const vm_region_submap_info_64& /*info*/) {
-    return populateMemoryRegionWithPageQueries(*this, region);
+    return populateMemoryRegionWithPageQueries(walk_, region);
 }
 
 void TLUserProcess::_addSubrangesForRegion(TLMemoryRegion& region, int purgeState) {
-    addSubrangesForRegion(*this, region, purgeState);
+    addSubrangesForRegion(walk_, region, purgeState);
+}
+
+WalkedTask TLUserProcess::makeWalk() {
+    return {.task = task(),
+            .pid = pid(),
+            .pageSize = pageSize(),
+            .breakDownPhysTally = breakDownPhysTally(),
+            .isAlive = _isAlive(),
+            .hiddenFromDisplay = hiddenFromDisplay(),
+            .displayString = displayString(),
+            .sharedCache = sharedCache(),
+            .addWarning = [this](std::string text) { addWarning(std::move(text)); },
+            .addError = [this](std::string text) { addError(std::move(text)); },
+            .populateMemoryRegionWithPageQueries =
+                [this](TLMemoryRegion& region, const vm_region_submap_info_64& info) {
+                    return _populateMemoryRegionWithPageQueries(region, info);
+                },
+            .addSubrangesForRegion = [this](TLMemoryRegion& region,
+                                            int purgeState) { _addSubrangesForRegion(region, purgeState); }};
 }
 
 void TLUserProcess::gatherData() {
@@ -116,13 +135,14 @@ void TLUserProcess::gatherData() {
                                  " due to an error configuring page size for analysis");
         return;
     }
+    walk_ = makeWalk();
     if (!hiddenFromDisplay()) {
         _gatherImageData();
         _gatherPhysTally();
         gatherPageTableSize();
-        walk.ownedVmObjects = _gatherOwnedVmObjects();
+        walk_.ownedVmObjects = _gatherOwnedVmObjects();
     }
-    RegionRecorder recorder(*this);
+    RegionRecorder recorder(walk_);
     enumerateRegions([&](const EnumeratedRegion& mapping) { return recorder.record(mapping); });
     recorder.recordUnmappedOwnedObjects();
     recordPageTables();
@@ -133,9 +153,9 @@ void TLUserProcess::gatherData() {
     for (std::string& notice : notices.of_machine) {
         addMachineWarning(std::move(notice));
     }
-    walk.regions.shrink_to_fit();
-    setMemoryRegions(std::move(walk.regions));
-    walk = WalkState();
+    walk_.regions.shrink_to_fit();
+    setMemoryRegions(std::move(walk_.regions));
+    walk_ = WalkedTask();
 }
 
 void TLUserProcess::recordPageTables() {
@@ -149,7 +169,7 @@ void TLUserProcess::recordPageTables() {
     region.name = Name("page table");
     region.object_id = TLNotSet;
     region.share_mode = SM_PRIVATE;
-    walk.regions.push_back(std::move(region));
+    walk_.regions.push_back(std::move(region));
 }
 
 std::optional<TLAuxDictionary> TLUserProcess::auxData() const {

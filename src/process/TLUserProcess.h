@@ -18,7 +18,7 @@
 
 namespace tally {
 
-class TLUserProcess : public TLProcess, public WalkedTask {
+class TLUserProcess : public TLProcess {
   public:
     /// Ledger figures of a task, in bytes.
     struct Ledgers {
@@ -32,23 +32,15 @@ class TLUserProcess : public TLProcess, public WalkedTask {
     /// What the task is charged for, now and at most; absent when that is not known.
     std::optional<TLAuxDictionary> auxData() const override;
 
-    platform::mach_port_t task() const override { return task_.name(); }
+    platform::mach_port_t task() const { return task_.name(); }
     std::uint64_t phys_tally() const { return ledgers_.physTally; } // bytes
-
-    const std::string& displayString() const override { return TLProcess::displayString(); }
-    bool hiddenFromDisplay() const override { return TLProcess::hiddenFromDisplay(); }
-    const std::shared_ptr<const TLSharedCache>& sharedCache() const override {
-        return TLProcess::sharedCache();
-    }
-    void addWarning(std::string text) override { TLProcess::addWarning(std::move(text)); }
-    void addError(std::string text) override { TLProcess::addError(std::move(text)); }
 
     // Hooks.
     bool _populateTask() override;
     bool _isAlive() const override { return true; }
-    bool _populateMemoryRegionWithPageQueries(TLMemoryRegion& region,
-                                              const platform::vm_region_submap_info_64& info) override;
-    void _addSubrangesForRegion(TLMemoryRegion& region, int purgeState) override;
+    virtual bool _populateMemoryRegionWithPageQueries(TLMemoryRegion& region,
+                                                      const platform::vm_region_submap_info_64& info);
+    virtual void _addSubrangesForRegion(TLMemoryRegion& region, int purgeState);
     virtual void _gatherIsTranslated() {}
     virtual bool _configurePageSize() { return true; }
     virtual void _gatherIdleExitStatus();
@@ -58,9 +50,12 @@ class TLUserProcess : public TLProcess, public WalkedTask {
     virtual void enumerateRegions(const RegionCallback& callback);
 
   protected:
+    WalkedTask makeWalk();
     void _setIdleExitStatusFromDirtyFlags(std::uint32_t flags);
     void setTask(platform::PortRight task) { task_ = std::move(task); }
     void setLedgers(const Ledgers& ledgers) { ledgers_ = ledgers; }
+
+    WalkedTask walk_; // while it is gathered
 
   private:
     void gatherPageTableSize();

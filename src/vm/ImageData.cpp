@@ -25,12 +25,12 @@ Name displayNameOfSegment(std::string_view rawName) {
 
 void gatherImageData(WalkedTask& task) {
     static const Name sharedLinkedit("dyld shared cache");
-    const TLSharedCache* const cache = task.sharedCache().get();
+    const TLSharedCache* const cache = task.sharedCache.get();
     std::unordered_set<std::uint64_t> linkeditStarts;
-    auto& images = task.walk.images;
-    RKForeachSymbolOwner(task.task(), [&](const RKSymbolOwner& owner) {
+    auto& images = task.images;
+    RKForeachSymbolOwner(task.task, [&](const RKSymbolOwner& owner) {
         const bool isInCache = cache != nullptr && cache->contains(owner.base_address);
-        const Name ownerPath(isInCache ? owner.path : RKResolvedPath(task.task(), owner.path));
+        const Name ownerPath(isInCache ? owner.path : RKResolvedPath(task.task, owner.path));
         for (const RKSegment& segment : owner.segments) {
             TLImage image;
             image.start = segment.start;

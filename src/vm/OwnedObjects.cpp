@@ -15,7 +15,7 @@ std::optional<OwnedVmObjects> gatherOwnedVmObjects(WalkedTask& task) {
     if (!physTallyCollectionEnabled()) {
         return std::nullopt;
     }
-    const auto list = sysctl_owned_vmobjects(task.task());
+    const auto list = sysctl_owned_vmobjects(task.task);
     if (!list) {
         if (errno != ENOENT) {
             task.reportWarning("vm.get_owned_vmobjects");

@@ -29,9 +29,9 @@ bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t 
     for (std::uint64_t first = 0; first < pageCount;) {
         std::uint64_t count = std::min(pageCount - first, wanted);
         const std::span<std::int32_t> chunk = std::span(words).first(count);
-        const std::uint64_t address = start + first * task.pageSize();
+        const std::uint64_t address = start + first * task.pageSize;
         const kern_return_t status =
-            mach_vm_page_range_query(task.task(), address, count * task.pageSize(), chunk, &count);
+            mach_vm_page_range_query(task.task, address, count * task.pageSize, chunk, &count);
         if (status != KERN_SUCCESS) {
             mach_error("mach_vm_page_range_query", status);
             task.recordRegionError(status);
@@ -41,9 +41,9 @@ bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t 
         first += chunk.size();
         wanted = std::min(2 * wanted, PagesPerQuery);
         if (first < pageCount) {
-            const std::uint64_t next = mach_vm_next_page(task.task(), start + first * task.pageSize(),
-                                                         start + pageCount * task.pageSize());
-            const std::uint64_t index = std::min((next - start) / task.pageSize(), pageCount - 1);
+            const std::uint64_t next = mach_vm_next_page(task.task, start + first * task.pageSize,
+                                                         start + pageCount * task.pageSize);
+            const std::uint64_t index = std::min((next - start) / task.pageSize, pageCount - 1);
             wanted = index == first ? wanted : PagesBehindGap;
             first = index;
         }
@@ -74,14 +74,14 @@ std::uint64_t bytesInLastPage(const TLMemoryRegion& region, std::uint64_t pageSi
 
 /// Gives the gap that ends where `region` begins its bytes of the page in which they meet.
 void settlePendingGap(WalkedTask& task, const TLMemoryRegion& region, std::int32_t disposition) {
-    auto& pending = task.walk.pendingUnusedSharedRegion;
+    auto& pending = task.pendingUnusedSharedRegion;
     if (!pending) {
         return;
     }
-    TLMemoryRegion& gap = task.walk.regions[*pending];
+    TLMemoryRegion& gap = task.regions[*pending];
     tl_assert(gap.end() == region.start, "self.pendingUnusedSharedRegion.end == region.start");
     TLRangeSizes share;
-    addBytesOfPage(share, disposition, bytesInLastPage(gap, task.pageSize()));
+    addBytesOfPage(share, disposition, bytesInLastPage(gap, task.pageSize));
     gap.dirtySize += share.dirty;
     gap.swappedSize += share.swapped;
     pending.reset();
@@ -151,25 +151,24 @@ PageRun::Kind kindOfPage(std::int32_t disposition, std::int32_t reclaimableMask)
 bool populateMemoryRegionWithPageQueries(WalkedTask& task, TLMemoryRegion& region) {
     tl_assert(region.dirtySize == 0 && region.swappedSize == 0,
               "region.dirtySize == 0 && region.swappedSize == 0");
-    const std::uint64_t pageSize = task.pageSize();
+    const std::uint64_t pageSize = task.pageSize;
     const std::uint64_t firstPage = roundDownToPage(region.start, pageSize);
     const std::uint64_t pagesEnd = roundUpToPage(region.end(), pageSize);
     const std::uint64_t pageCount = (pagesEnd - firstPage) / pageSize;
     const bool startsInsidePage = region.start != firstPage;
     const bool endsInsidePage = region.end() != pagesEnd;
-    WalkState& walk = task.walk;
 
     TLRangeSizes sizes;
-    const bool firstIsCached = firstPage == walk.cachedDispositionAddress;
+    const bool firstIsCached = firstPage == task.cachedDispositionAddress;
     if (firstIsCached) {
-        addBytesOfPage(sizes, walk.cachedDisposition, bytesInFirstPage(region, pageSize));
+        addBytesOfPage(sizes, task.cachedDisposition, bytesInFirstPage(region, pageSize));
     }
     const std::uint64_t known = firstIsCached ? 1 : 0; // pages that need not be asked for
     if (region.unusedSharedCacheRegion) {
         region.dirtySize = sizes.dirty;
         region.swappedSize = sizes.swapped;
         if (endsInsidePage && pageCount > known) {
-            walk.pendingUnusedSharedRegion = walk.regions.size() - 1;
+            task.pendingUnusedSharedRegion = task.regions.size() - 1;
         }
         return true;
     }
@@ -181,8 +180,8 @@ bool populateMemoryRegionWithPageQueries(WalkedTask& task, TLMemoryRegion& regio
         }
         if (index == pageCount - 1 && endsInsidePage) {
             bytes = bytesInLastPage(region, pageSize);
-            walk.cachedDispositionAddress = pagesEnd - pageSize;
-            walk.cachedDisposition = disposition;
+            task.cachedDispositionAddress = pagesEnd - pageSize;
+            task.cachedDisposition = disposition;
         }
         addBytesOfPage(sizes, disposition, bytes);
     };
@@ -200,7 +199,7 @@ bool populateMemoryRegionWithPageQueries(WalkedTask& task, TLMemoryRegion& regio
 
 void addSubrangesForRegion(WalkedTask& task, TLMemoryRegion& region, int purgeState) {
     tl_assert(!region.ownedExclusivelyByParentProcess, "!region.ownedExclusivelyByParentProcess");
-    const std::uint64_t pageSize = task.pageSize();
+    const std::uint64_t pageSize = task.pageSize;
     const std::uint64_t firstPage = roundDownToPage(region.start, pageSize);
     const std::uint64_t pageCount = (roundUpToPage(region.end(), pageSize) - firstPage) / pageSize;
     const std::int32_t reclaimableMask =

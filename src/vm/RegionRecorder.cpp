@@ -50,8 +50,8 @@ std::uint64_t takeOff(std::uint64_t& size, std::uint64_t bytes) {
 } // namespace
 
 RegionRecorder::RegionRecorder(WalkedTask& task)
-    : task_(task), images_(task.walk.images), breakDown_(task.breakDownPhysTally()) {
-    if (const auto& cache = task.sharedCache()) {
+    : task_(task), images_(task.images), breakDown_(task.breakDownPhysTally) {
+    if (const auto& cache = task.sharedCache) {
         cacheBase_ = cache->baseAddress;
         cacheEnd_ = cache->baseAddress + cache->mappedSize;
     }
@@ -59,7 +59,7 @@ RegionRecorder::RegionRecorder(WalkedTask& task)
 
 bool RegionRecorder::record(const EnumeratedRegion& mapping) {
     if (mapping.end() > cacheBase_ && mapping.start < cacheEnd_) {
-        return !task_.hiddenFromDisplay() && !recordSharedCachePieces(task_, images_, mapping);
+        return !task_.hiddenFromDisplay && !recordSharedCachePieces(task_, images_, mapping);
     }
     recordMapping(mapping);
     return false;
@@ -67,7 +67,7 @@ bool RegionRecorder::record(const EnumeratedRegion& mapping) {
 
 void RegionRecorder::recordMapping(const EnumeratedRegion& mapping) {
     const bool isUnmapped = isUnmappedMemory(mapping);
-    if (isUnmapped && task_.walk.ownedVmObjects) { // the owned objects say it in more detail
+    if (isUnmapped && task_.ownedVmObjects) { // the owned objects say it in more detail
         return;
     }
     TLMemoryRegion region;
@@ -83,19 +83,19 @@ void RegionRecorder::recordMapping(const EnumeratedRegion& mapping) {
         region.object_id = mapping.info.object_id;
     }
     nameAndMatch(region, mapping);
-    if (breakDown_ && !task_.hiddenFromDisplay() && region.needsSubrangeBreakdown(task_.pageSize())) {
-        task_._addSubrangesForRegion(region, mapping.purgeState);
+    if (breakDown_ && !task_.hiddenFromDisplay && region.needsSubrangeBreakdown(task_.pageSize)) {
+        task_.addSubrangesForRegion(region, mapping.purgeState);
     }
     if (isUnmapped) {
         kernelsUnmappedRegion_ = std::move(region);
     } else {
-        task_.walk.regions.push_back(std::move(region));
+        task_.regions.push_back(std::move(region));
     }
 }
 
 void RegionRecorder::sizeByCounts(TLMemoryRegion& region, const EnumeratedRegion& mapping) const {
     const vm_region_submap_info_64& info = mapping.info;
-    const std::uint64_t pageSize = task_.pageSize();
+    const std::uint64_t pageSize = task_.pageSize;
     const std::uint64_t resident = info.pages_resident;
     const std::uint64_t reusable = info.pages_reusable;
     if (mapping.purgeState == VM_PURGABLE_EMPTY) {
@@ -141,7 +141,7 @@ void RegionRecorder::nameAndMatch(TLMemoryRegion& region, const EnumeratedRegion
 
 /// Where the process owns the object behind a mapping it is charged for all of it.
 void RegionRecorder::matchOwnedObject(TLMemoryRegion& region, const EnumeratedRegion& mapping) {
-    auto& owned = task_.walk.ownedVmObjects;
+    auto& owned = task_.ownedVmObjects;
     if (owned) {
         const auto record = owned->find(mapping.info.object_id_full);
         if (record == owned->end()) {
@@ -163,14 +163,14 @@ void RegionRecorder::matchOwnedObject(TLMemoryRegion& region, const EnumeratedRe
 }
 
 void RegionRecorder::recordUnmappedOwnedObjects() {
-    if (const auto& owned = task_.walk.ownedVmObjects) {
+    if (const auto& owned = task_.ownedVmObjects) {
         std::vector<const owned_vmobject*> records;
         for (const auto& [id, record] : *owned) {
             records.push_back(&record);
         }
         std::ranges::sort(records, std::less(), &owned_vmobject::id); // the table has no order
         for (const owned_vmobject* record : records) {
-            task_.walk.regions.push_back(unmappedRegionForOwnedObject(*record));
+            task_.regions.push_back(unmappedRegionForOwnedObject(*record));
         }
     }
     if (kernelsUnmappedRegion_) {
@@ -184,14 +184,14 @@ void RegionRecorder::recordKernelsUnmappedRegion() {
     const std::uint64_t notDirty = takeOff(region.dirtySize, ownedBehindMappings_);
     const std::uint64_t surplus = takeOff(region.swappedSize, notDirty);
     if (surplus != 0) {
-        task_.addWarning(task_.displayString() +
+        task_.addWarning(task_.displayString +
                          formatted(": Tally changed while analyzing \u2013 unmapped owned physical tally may "
                                    "be over-counted by %" PRIu64 " bytes",
                                    surplus));
     }
     if (region.chargedSize() != 0) {
         region.start = TLNotSet;
-        task_.walk.regions.push_back(std::move(region));
+        task_.regions.push_back(std::move(region));
     }
 }
 

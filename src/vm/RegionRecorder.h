@@ -16,7 +16,7 @@ namespace tally {
 
 class RegionRecorder {
   public:
-    /// The regions go to `task.walk.regions`.
+    /// The regions go to `task.regions`.
     explicit RegionRecorder(WalkedTask& task);
 
     /// Makes the regions of one mapping; mappings come in rising address order. @return true to end the walk.

@@ -18,7 +18,7 @@ namespace {
 class RegionWalk {
   public:
     explicit RegionWalk(WalkedTask& task) : task_(task) {
-        if (const auto& cache = task.sharedCache()) {
+        if (const auto& cache = task.sharedCache) {
             cacheBase_ = cache->baseAddress;
             cacheEnd_ = cache->baseAddress + cache->mappedSize;
         }
@@ -55,7 +55,7 @@ bool RegionWalk::next() {
     mapping_.start = from;
     if (isPastPrivateMappings()) {
         vm_region_basic_info_64 basic;
-        const kern_return_t status = mach_vm_region(task_.task(), &mapping_.start, &mapping_.size, &basic);
+        const kern_return_t status = mach_vm_region(task_.task, &mapping_.start, &mapping_.size, &basic);
         if (status != KERN_SUCCESS) {
             return end("mach_vm_region", status);
         }
@@ -90,7 +90,7 @@ bool RegionWalk::descend() {
     std::uint32_t depth = std::numeric_limits<std::uint32_t>::max();
     std::uint32_t count = VM_REGION_SUBMAP_INFO_COUNT_64;
     const kern_return_t status =
-        mach_vm_region_recurse(task_.task(), &mapping_.start, &mapping_.size, &depth, &info, &count);
+        mach_vm_region_recurse(task_.task, &mapping_.start, &mapping_.size, &depth, &info, &count);
     if (count <= VM_REGION_SUBMAP_INFO_V1_COUNT_64) {
         info.object_id_full = info.object_id;
     }
@@ -102,13 +102,13 @@ bool RegionWalk::descend() {
         return end("mach_vm_region_recurse", status);
     }
     seenUnmapped_ = seenUnmapped_ || isUnmapped;
-    if (mach_vm_purgable_get_state(task_.task(), mapping_.start, &mapping_.purgeState) != KERN_SUCCESS) {
+    if (mach_vm_purgable_get_state(task_.task, mapping_.start, &mapping_.purgeState) != KERN_SUCCESS) {
         mapping_.purgeState = VM_PURGABLE_DENY;
     }
     tl_assert(info.is_submap == 0, "!info.is_submap");
-    if (info.external_pager != 0 && task_._isAlive()) {
+    if (info.external_pager != 0 && task_.isAlive) {
         std::array<char, 1024> name;
-        const int length = proc_regionfilename(task_.pid(), mapping_.start, name);
+        const int length = proc_regionfilename(task_.pid, mapping_.start, name);
         if (length > 0) {
             mapping_.fileName.emplace(name.data(), static_cast<std::size_t>(length));
         }
@@ -139,10 +139,10 @@ void enumerateRegions(WalkedTask& task, const RegionCallback& callback) {
 
 std::uint64_t lastNonSharedCacheRegion(const WalkedTask& task) {
     constexpr std::uint64_t precision = 16 << 20;
-    if (!task.sharedCache()) {
+    if (!task.sharedCache) {
         return 0;
     }
-    const std::uint64_t cacheBase = task.sharedCache()->baseAddress;
+    const std::uint64_t cacheBase = task.sharedCache->baseAddress;
     std::uint64_t low = 0;
     std::uint64_t high = cacheBase;
     do {
@@ -150,11 +150,11 @@ std::uint64_t lastNonSharedCacheRegion(const WalkedTask& task) {
         std::uint64_t address = middle;
         std::uint64_t size = 0;
         vm_region_basic_info_64 info;
-        if (mach_vm_region(task.task(), &address, &size, &info) != KERN_SUCCESS || address == low) {
+        if (mach_vm_region(task.task, &address, &size, &info) != KERN_SUCCESS || address == low) {
             return low;
         }
         if (address + size > cacheBase) {
-            high = middle - task.pageSize();
+            high = middle - task.pageSize;
         } else {
             low = address;
         }
@@ -163,7 +163,7 @@ std::uint64_t lastNonSharedCacheRegion(const WalkedTask& task) {
 }
 
 void announceBailOut(const WalkedTask& task) {
-    printLineToStandardError("bailing out for process " + task.displayString() + "; data may be incomplete!");
+    printLineToStandardError("bailing out for process " + task.displayString + "; data may be incomplete!");
 }
 
 } // namespace tally

@@ -48,7 +48,7 @@ class PieceCutter {
 };
 
 bool PieceCutter::cut() {
-    task_.walk.pendingUnusedSharedRegion.reset();
+    task_.pendingUnusedSharedRegion.reset();
     while (at_ < mapping_.end()) {
         const TLImage* const image = images_.nextImageOverlapping(at_, mapping_.end());
         const bool isGap = image == nullptr || at_ < image->start;
@@ -80,7 +80,7 @@ bool PieceCutter::appendGap(const TLImage* image) {
     gap.name = unused;
     gap.segment = gapSegment(previous_, image);
     const bool isWholePages =
-        isMultipleOf(task_.pageSize(), gap.start) && isMultipleOf(task_.pageSize(), gap.end());
+        isMultipleOf(task_.pageSize, gap.start) && isMultipleOf(task_.pageSize, gap.end());
     const bool needsQueries = !isNeverDirty(gap.segment) && !isWholePages;
     return append(std::move(gap), needsQueries);
 }
@@ -93,14 +93,14 @@ bool PieceCutter::appendImagePiece(const TLImage& image) {
     previous_ = &image;
     const bool needsQueries = !isNeverDirty(image.segment);
     if (!needsQueries) {
-        task_.walk.pendingUnusedSharedRegion.reset();
+        task_.pendingUnusedSharedRegion.reset();
     }
     return append(std::move(part), needsQueries);
 }
 
 /// Where the piece of `image` that begins here ends: with the image, or where padding after it does.
 std::uint64_t PieceCutter::imagePieceEnd(const TLImage& image) {
-    const std::uint64_t alignment = task_.sharedCache()->alignment;
+    const std::uint64_t alignment = task_.sharedCache->alignment;
     const std::uint64_t end = std::min(image.end(), mapping_.end());
     const TLImage* const next = images_.nextImageOverlapping(end, mapping_.end());
     const bool startsAreAligned =
@@ -110,9 +110,9 @@ std::uint64_t PieceCutter::imagePieceEnd(const TLImage& image) {
 
 bool PieceCutter::append(TLMemoryRegion piece, bool withPageQueries) {
     at_ = piece.end();
-    auto& regions = task_.walk.regions;
+    auto& regions = task_.regions;
     TLMemoryRegion& appended = regions.emplace_back(std::move(piece));
-    if (withPageQueries && !task_._populateMemoryRegionWithPageQueries(appended, mapping_.info)) {
+    if (withPageQueries && !task_.populateMemoryRegionWithPageQueries(appended, mapping_.info)) {
         regions.pop_back();
         return false;
     }

@@ -34,16 +34,17 @@ TEST_F(OwnedMemory, IsChargedWhereItIsMappedFirstElseUnmapped) {
 
 TEST_F(OwnedMemory, IsNotListedWhereThereIsNoList) {
     walk();
+    WalkedTask walked = process->makeWalk();
     testing::internal::CaptureStderr();
     for (const int error : {ENOENT, EPERM}) {
         kernel.fail("sysctl_owned_vmobjects", error);
-        EXPECT_FALSE(gatherOwnedVmObjects(*process));
+        EXPECT_FALSE(gatherOwnedVmObjects(walked));
     }
     const std::string warning = "p [7]: vm.get_owned_vmobjects - Operation not permitted";
     EXPECT_EQ(process->warnings(), (Lines{warning}));
     EXPECT_EQ(testing::internal::GetCapturedStderr(), warning + "\n");
     task.owned->clear();
-    EXPECT_TRUE(gatherOwnedVmObjects(*process)) << "an empty list is one";
+    EXPECT_TRUE(gatherOwnedVmObjects(walked)) << "an empty list is one";
 }
 
 } // namespace

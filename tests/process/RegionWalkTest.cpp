@@ -21,9 +21,9 @@ TEST_F(RegionWalk, PassesOverTheSharedCacheWithOneQuery) {
     task.map({.start = base + 0x8000000, .pages = "D"});
     EXPECT_EQ(walkedLines().at(2), "180000000+4000000 unused dyld shared cache area @0 gap");
     EXPECT_EQ(kernel.callCount("mach_vm_region_recurse"), 4u) << "three mappings and the end";
-    EXPECT_EQ(lastNonSharedCacheRegion(*process), base - 0x1000);
+    EXPECT_EQ(lastNonSharedCacheRegion(process->makeWalk()), base - 0x1000);
     task.unmap(base - 0x1000);
-    EXPECT_EQ(lastNonSharedCacheRegion(*process), 0x10000000u);
+    EXPECT_EQ(lastNonSharedCacheRegion(process->makeWalk()), 0x10000000u);
 }
 
 TEST_F(RegionWalk, EndsWhereTheKernelRefusesAndKeepsWhatItHas) {

@@ -47,6 +47,7 @@ class WalkTest : public testing::Test {
   protected:
     struct Process final : TLUserProcess {
         bool _isAlive() const override { return alive; }
+        using TLUserProcess::makeWalk;
         bool alive = true;
     };
 

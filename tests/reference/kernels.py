@@ -190,7 +190,7 @@ class Maker:
                           for _ in range(self.random.randrange(4))}
         if self.chance(40):  # the kernel's own figure, at the end
             figure = self.contents(Mapping(0x8000000000, 9 * self.page, tag=UNMAPPED_TAG, object=self.one(0, 88)))
-            figure.purgeable = self.one(3, 3, 1)
+            figure.purgeable, figure.share = self.one(3, 3, 1), self.one(2, 4)
             task.mappings += [figure]
             if self.chance(50):
                 task.mappings += self.mappings(0x8000000000 + 20 * self.page)
