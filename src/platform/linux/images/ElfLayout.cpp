@@ -19,7 +19,6 @@ namespace {
 constexpr std::size_t mostHeaders = 4096; // linkers make a dozen; a damaged file can claim billions
 
 std::uint64_t pageBelow(std::uint64_t address) { return address & ~(basePage - 1); }
-std::uint64_t pageAbove(std::uint64_t address) { return pageBelow(address + basePage - 1); }
 
 /// Whether a segment can be mapped at all: no end beyond the last page, and address and offset alike within
 /// a page.
@@ -74,9 +73,9 @@ bool areApart(const std::vector<LoadSegment>& loads) {
 
 std::uint64_t LoadSegment::firstPage() const { return pageBelow(address); }
 std::uint64_t LoadSegment::endOfFilePages() const {
-    return fileSize == 0 ? firstPage() : pageAbove(address + fileSize);
+    return fileSize == 0 ? firstPage() : wholePages(address + fileSize);
 }
-std::uint64_t LoadSegment::endPage() const { return pageAbove(address + memorySize); }
+std::uint64_t LoadSegment::endPage() const { return wholePages(address + memorySize); }
 
 std::optional<ElfLayout> readElfLayout(const Descriptor& file) {
     return readElfLayout(

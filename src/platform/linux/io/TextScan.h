@@ -46,6 +46,17 @@ bool takeNumber(std::string_view& text, Integer* value, int base = 10) {
     return true;
 }
 
+/// Reads a row "Key:   12 kB" as `*key` and bytes; a number without "kB" stays what it is.
+/// @return false, with `*number` untouched, when there is no number.
+inline bool readRow(std::string_view line, std::string_view* key, std::uint64_t* number) {
+    *key = takeUntil(line, ':');
+    if (!takeNumber(line, number)) {
+        return false;
+    }
+    *number *= takeWord(line) == "kB" ? 1024 : 1;
+    return true;
+}
+
 /// Takes `expected` off the front. @return whether it was there.
 inline bool takeChar(std::string_view& text, char expected) {
     if (text.empty() || text.front() != expected) {

@@ -35,11 +35,10 @@ std::string symbolOf(std::string_view caller, std::string_view rest) {
 
 Meminfo::Meminfo(std::string_view text) {
     while (!text.empty()) {
-        std::string_view line = takeLine(text);
-        const std::string_view key = takeUntil(line, ':');
+        std::string_view key;
         std::uint64_t number = 0;
-        if (takeNumber(line, &number)) {
-            rows_.emplace(key, takeWord(line) == "kB" ? number * 1024 : number);
+        if (readRow(takeLine(text), &key, &number)) {
+            rows_.emplace(key, number);
         }
     }
 }

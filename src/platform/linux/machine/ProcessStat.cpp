@@ -95,12 +95,14 @@ ProcessStatus decodeStatus(std::string_view text) {
     }};
     ProcessStatus status;
     while (!text.empty()) {
-        std::string_view line = takeLine(text);
-        const std::string_view key = takeUntil(line, ':');
+        std::string_view key;
+        std::uint64_t bytes = 0;
+        if (!readRow(takeLine(text), &key, &bytes)) {
+            continue;
+        }
         for (const auto& [name, member] : sizes) {
-            std::uint64_t kibibytes = 0;
-            if (key == name && takeNumber(line, &kibibytes)) {
-                status.*member = kibibytes * 1024;
+            if (key == name) {
+                status.*member = bytes;
                 status.hasAddressSpace = true;
             }
         }

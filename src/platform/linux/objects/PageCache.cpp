@@ -37,7 +37,7 @@ std::optional<std::uint64_t> pagesInMemory(const Descriptor& file, AddressRange 
     std::uint64_t count = 0;
     while (range.start < range.end) {
         const std::size_t length = std::min(range.end - range.start, isHere.size() * basePage);
-        const std::size_t pages = (length + basePage - 1) / basePage;
+        const std::size_t pages = wholePages(length) / basePage;
         void* const memory =
             mmap(nullptr, length, PROT_READ, MAP_SHARED, file.number(), static_cast<off_t>(range.start));
         const bool isAnswered = memory != MAP_FAILED && mincore(memory, length, isHere.data()) == 0;
@@ -75,7 +75,7 @@ std::optional<CachedPages> sharedMemoryPages(const Descriptor& file, AddressRang
             return std::nullopt;
         }
         pages.cached += *here;
-        pages.evicted += (found.end - found.start + basePage - 1) / basePage - *here;
+        pages.evicted += wholePages(found.end - found.start) / basePage - *here;
         range.start = static_cast<std::uint64_t>(hole);
     }
     return pages;

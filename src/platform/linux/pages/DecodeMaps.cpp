@@ -44,15 +44,16 @@ std::uint64_t* sizeField(SmapsEntry& entry, std::string_view key) {
 }
 
 void decodeSmapsField(std::string_view line, SmapsEntry& entry) {
-    const std::string_view key = takeUntil(line, ':');
-    std::uint64_t kibibytes = 0;
-    if (key == "VmFlags") {
+    std::string_view key;
+    std::uint64_t bytes = 0;
+    if (readRow(line, &key, &bytes)) {
+        if (std::uint64_t* field = sizeField(entry, key)) {
+            *field += bytes;
+        }
+    } else if (takeUntil(line, ':') == "VmFlags") {
         for (std::string_view flag = takeWord(line); !flag.empty(); flag = takeWord(line)) {
             entry.locked |= flag == "lo";
         }
-    } else if (std::uint64_t* field = sizeField(entry, key);
-               field != nullptr && takeNumber(line, &kibibytes)) {
-        *field += kibibytes * 1024;
     }
 }
 
@@ -107,10 +108,10 @@ void decodeSmaps(std::string_view lines, std::vector<SmapsEntry>* entries) {
 
 std::uint64_t decodeRollupLazyFree(std::string_view text) {
     while (!text.empty()) {
-        std::string_view line = takeLine(text);
-        std::uint64_t kibibytes = 0;
-        if (takeUntil(line, ':') == "LazyFree" && takeNumber(line, &kibibytes)) {
-            return kibibytes * 1024;
+        std::string_view key;
+        std::uint64_t bytes = 0;
+        if (readRow(takeLine(text), &key, &bytes) && key == "LazyFree") {
+            return bytes;
         }
     }
     return 0;
