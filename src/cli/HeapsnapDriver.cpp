@@ -2,6 +2,7 @@
 
 #include "analysis/TLTally.h"
 #include "base/Format.h"
+#include "cli/OptionScanner.h"
 #include "cli/OutputFiles.h"
 #include "platform/output_file.h"
 #include "platform/quarry.h"
@@ -41,17 +42,18 @@ struct HeapsnapArgs {
 /// Absent for a command line that is none.
 std::optional<HeapsnapArgs> parse(int argc, char** argv) {
     constexpr int vmObjectDirty = 0x100;
-    constexpr std::array options = {LongOption{"help", false, 'h'}, LongOption{"output", true, 'o'},
-                                    LongOption{"vmObjectDirty", false, vmObjectDirty}};
+    constexpr std::array options = {option{"help", no_argument, nullptr, 'h'},
+                                    option{"output", required_argument, nullptr, 'o'},
+                                    option{"vmObjectDirty", no_argument, nullptr, vmObjectDirty}, option{}};
     HeapsnapArgs args;
-    OptionScanner scanner(argc, argv, "ho:", options);
-    for (int option = scanner.next(); option != OptionScanner::End; option = scanner.next()) {
-        switch (option) {
+    beginOptionScan();
+    for (int letter = 0; (letter = nextOption(argc, argv, ":ho:", options.data())) != -1;) {
+        switch (letter) {
         case 'h':
             args.wantsHelp = true;
             return args;
         case 'o':
-            args.file = scanner.argument();
+            args.file = optarg;
             break;
         case vmObjectDirty:
             args.vmObjectDirty = true;
@@ -60,10 +62,10 @@ std::optional<HeapsnapArgs> parse(int argc, char** argv) {
             return std::nullopt;
         }
     }
-    if (scanner.index() + 1 != argc) {
+    if (optind + 1 != argc) {
         return std::nullopt;
     }
-    args.target = argv[scanner.index()];
+    args.target = argv[optind];
     return args;
 }
 

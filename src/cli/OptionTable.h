@@ -4,7 +4,7 @@
 
 #pragma once
 
-#include "platform/system.h"
+#include "cli/OptionScanner.h"
 
 #include <algorithm>
 #include <array>
@@ -29,29 +29,30 @@ enum LongOnlyOption : int {
     optionSample,
 };
 
-inline constexpr const char* shortOptions = "aj:htp:x:svf:yw";
+inline constexpr const char* shortOptions = ":aj:htp:x:svf:yw";
 
 inline constexpr std::array longOptions = {
-    platform::LongOption{"all", false, 'a'},
-    platform::LongOption{"json", true, 'j'},
-    platform::LongOption{"benchlog", true, optionBenchlog},
-    platform::LongOption{"help", false, 'h'},
-    platform::LongOption{"targetChildren", false, 't'},
-    platform::LongOption{"proc", true, optionProc},
-    platform::LongOption{"exclude", true, 'x'},
-    platform::LongOption{"pid", true, optionPid},
-    platform::LongOption{"skip", false, 's'},
-    platform::LongOption{"forkCorpse", false, optionForkCorpse},
-    platform::LongOption{"format", true, 'f'},
-    platform::LongOption{"sort", true, optionSort},
-    platform::LongOption{"summary", false, 'y'},
-    platform::LongOption{"physTally", false, optionPhysTally},
-    platform::LongOption{"vmObjectDirty", false, optionVmObjectDirty},
-    platform::LongOption{"wide", false, 'w'},
-    platform::LongOption{"swapped", false, optionSwapped},
-    platform::LongOption{"wired", false, optionWired},
-    platform::LongOption{"unmapped", false, optionUnmapped},
-    platform::LongOption{"sample", true, optionSample},
+    option{"all", no_argument, nullptr, 'a'},
+    option{"json", required_argument, nullptr, 'j'},
+    option{"benchlog", required_argument, nullptr, optionBenchlog},
+    option{"help", no_argument, nullptr, 'h'},
+    option{"targetChildren", no_argument, nullptr, 't'},
+    option{"proc", required_argument, nullptr, optionProc},
+    option{"exclude", required_argument, nullptr, 'x'},
+    option{"pid", required_argument, nullptr, optionPid},
+    option{"skip", no_argument, nullptr, 's'},
+    option{"forkCorpse", no_argument, nullptr, optionForkCorpse},
+    option{"format", required_argument, nullptr, 'f'},
+    option{"sort", required_argument, nullptr, optionSort},
+    option{"summary", no_argument, nullptr, 'y'},
+    option{"physTally", no_argument, nullptr, optionPhysTally},
+    option{"vmObjectDirty", no_argument, nullptr, optionVmObjectDirty},
+    option{"wide", no_argument, nullptr, 'w'},
+    option{"swapped", no_argument, nullptr, optionSwapped},
+    option{"wired", no_argument, nullptr, optionWired},
+    option{"unmapped", no_argument, nullptr, optionUnmapped},
+    option{"sample", required_argument, nullptr, optionSample},
+    option{}, // the end
 };
 
 /// `text` with its ASCII letters in lower case: sort columns are shown and compared so.

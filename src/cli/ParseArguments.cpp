@@ -183,16 +183,16 @@ std::optional<TLError> combineOptions(TLTallyArgs& args) {
 
 std::variant<TLTallyArgs, TLError> parseArguments(int argc, char** argv) {
     TLTallyArgs args;
-    platform::OptionScanner scanner(argc, argv, shortOptions, longOptions);
-    for (int option = scanner.next(); option != platform::OptionScanner::End; option = scanner.next()) {
-        if (auto error = applyOption(args, option, scanner.argument())) {
+    beginOptionScan();
+    for (int option = 0; (option = nextOption(argc, argv, shortOptions, longOptions.data())) != -1;) {
+        if (auto error = applyOption(args, option, optarg)) {
             return *std::move(error);
         }
     }
     if (auto error = combineOptions(args)) {
         return *std::move(error);
     }
-    args.potentialTargetProcesses.insert(argv + scanner.index(), argv + argc);
+    args.potentialTargetProcesses.insert(argv + optind, argv + argc);
     return args;
 }
 

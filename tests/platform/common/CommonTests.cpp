@@ -1,9 +1,8 @@
-// What both platforms share: dates, error texts, serial queues and the option scanner.
+// What both platforms share: dates, error texts, serial queues.
 
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/kern_return.h"
-#include "platform/system.h"
 
 #include <gtest/gtest.h>
 
@@ -70,38 +69,6 @@ TEST(ErrorTexts, SayWhatTheStatusMeans) {
     mach_error("task_read_for_pid", 12345);
     EXPECT_EQ(testing::internal::GetCapturedStderr(),
               "mach_vm_region: invalid argument\ntask_read_for_pid: unknown error code\n");
-}
-
-struct Scan {
-    std::vector<int> options;
-    std::vector<std::string> arguments; // of the options, "-" where there is none
-    std::vector<std::string> rest;
-};
-
-Scan scan(std::vector<std::string> words) {
-    const std::array<LongOption, 2> known{{{"pid", true, 'p'}, {"wired", false, 1000}}};
-    std::vector<char*> argv;
-    words.insert(words.begin(), "tally");
-    for (std::string& word : words) {
-        argv.push_back(word.data());
-    }
-    argv.push_back(nullptr);
-    OptionScanner scanner(static_cast<int>(words.size()), argv.data(), "p:v", known);
-    Scan result;
-    for (int option = scanner.next(); option != OptionScanner::End; option = scanner.next()) {
-        result.options.push_back(option);
-        result.arguments.emplace_back(scanner.argument() == nullptr ? "-" : scanner.argument());
-    }
-    result.rest.assign(argv.begin() + scanner.index(), argv.end() - 1);
-    return result;
-}
-
-TEST(OptionScanner, ScansEachVectorFromItsStart) {
-    const Scan first = scan({"bash", "-p", "7", "-vp8", "--wired", "--pid=9", "--", "-x"});
-    EXPECT_EQ(first.options, (std::vector<int>{'p', 'v', 'p', 1000, 'p'}));
-    EXPECT_EQ(first.arguments, (std::vector<std::string>{"7", "-", "8", "-", "9"}));
-    EXPECT_EQ(first.rest, (std::vector<std::string>{"bash", "-x"}));
-    EXPECT_EQ(scan({"-v"}).options, std::vector<int>{'v'}) << "a second scan, of a shorter vector";
 }
 
 } // namespace
