@@ -19,9 +19,22 @@ struct mach_zone_info {
     std::uint64_t collectable = 0; // non-zero: the zone can give memory back
 };
 
-/// One accounting site of the kernel; `flags` holds its type in the low 8 bits.
+// The low 8 bits of a site's flags are its type.
+inline constexpr std::uint64_t kernelSiteTypeMask = 0xff;
+inline constexpr std::uint64_t kernelSiteIsTag = 0;
+inline constexpr std::uint64_t kernelSiteIsModule = 1;
+inline constexpr std::uint64_t kernelSiteIsCode = 2;
+inline constexpr std::uint64_t kernelSiteIsCounter = 3;
+inline constexpr std::uint64_t kernelSiteIsWired = 0x100;
+inline constexpr std::uint64_t kernelSiteIsHidden = 0x200;
+inline constexpr std::uint64_t kernelSiteIsNamed = 0x400;
+inline constexpr std::uint64_t kernelSiteIsOfZone = 0x800;
+
+inline constexpr std::uint64_t kernelTagMlock = 24; // memory that is wired on behalf of user processes
+
+/// One accounting site of the kernel.
 struct mach_memory_site {
-    std::uint64_t flags = 0;
+    std::uint64_t flags = 0; // kernelSiteIs...
     std::uint64_t site = 0;
     std::uint64_t size = 0;   // bytes
     std::uint64_t mapped = 0; // bytes

@@ -1,5 +1,6 @@
 #include "process/CorpseKcdata.h"
 
+#include "platform/kcdata.h"
 #include "platform/mach_task.h"
 
 #include <cstring>
@@ -11,21 +12,9 @@ using namespace platform;
 
 namespace {
 
-constexpr std::uint32_t BeginMarker = 0xDEADF157;
-constexpr std::uint32_t EndMarker = 0xF19158ED;
-constexpr std::uint32_t ArrayType = 0x11;
-constexpr std::uint32_t FirstPaddedArrayType = 0x20; // one for each of 0 to 15 bytes of padding
-
-struct ItemHeader {
-    std::uint32_t type;
-    std::uint32_t payloadSize;
-    std::uint64_t flags;
-};
-static_assert(sizeof(ItemHeader) == 16);
-
 /// Takes the first item off `rest`; absent when it does not fit.
 std::optional<KcdataItem> takeItem(std::span<const std::byte>& rest) {
-    ItemHeader header;
+    KcdataHeader header;
     if (rest.size() < sizeof header) {
         return std::nullopt;
     }
@@ -35,8 +24,8 @@ std::optional<KcdataItem> takeItem(std::span<const std::byte>& rest) {
         return std::nullopt;
     }
     rest = payload.subspan(header.payloadSize);
-    const bool isPaddedArray = (header.type & ~std::uint32_t{0xF}) == FirstPaddedArrayType;
-    return KcdataItem{isPaddedArray ? ArrayType : header.type, payload.first(header.payloadSize)};
+    const bool isPaddedArray = (header.type & ~std::uint32_t{0xF}) == kcdataFirstPaddedArray;
+    return KcdataItem{isPaddedArray ? kcdataArray : header.type, payload.first(header.payloadSize)};
 }
 
 /// Crash information that is mapped into the tool for as long as this lives.
@@ -64,10 +53,10 @@ class MappedCrashInformation {
 
 bool enumerateKcdata(std::span<const std::byte> buffer, const KcdataItemHandler& handler) {
     auto item = takeItem(buffer);
-    if (!item || item->type != BeginMarker) {
+    if (!item || item->type != kcdataBegin) {
         return false;
     }
-    while (item && item->type != EndMarker) {
+    while (item && item->type != kcdataEnd) {
         handler(*item);
         item = takeItem(buffer);
     }

@@ -11,8 +11,8 @@ using namespace platform;
 
 namespace {
 
-constexpr std::size_t NameFieldSize = 80;
-constexpr std::uint64_t AnyTag = 255;
+constexpr std::size_t nameFieldSize = 80;
+constexpr std::uint64_t anyTag = 255;
 
 constexpr const char* tagNames[] = {
     "NONE",
@@ -69,7 +69,7 @@ constexpr const char* counterNames[] = {
 
 std::string tagName(std::uint64_t tag) {
     const std::string prefix = "VM_KERN_MEMORY_";
-    return prefix + (tag < std::size(tagNames) ? tagNames[tag] : tag == AnyTag ? "ANY" : std::to_string(tag));
+    return prefix + (tag < std::size(tagNames) ? tagNames[tag] : tag == anyTag ? "ANY" : std::to_string(tag));
 }
 
 std::string nameOfCounter(std::uint64_t counter) {
@@ -82,7 +82,7 @@ bool isReadable(const std::string& name) { return !name.empty() && isUTF8(name);
 
 } // namespace
 
-std::string kernelName(const std::string& name) { return name.substr(0, NameFieldSize).c_str(); }
+std::string kernelName(const std::string& name) { return name.substr(0, nameFieldSize).c_str(); }
 
 KernelSiteNames::KernelSiteNames(std::span<const std::string> zoneNames)
     : zoneNames_(zoneNames), modules_(copyLoadedModuleIdentifiers()),
@@ -90,36 +90,36 @@ KernelSiteNames::KernelSiteNames(std::span<const std::string> zoneNames)
 
 std::string KernelSiteNames::regionName(const mach_memory_site& site) const {
     std::string name = counterName(site);
-    if ((site.flags & KernelSiteIsOfZone) != 0 && site.zone < zoneNames_.size()) {
+    if ((site.flags & kernelSiteIsOfZone) != 0 && site.zone < zoneNames_.size()) {
         name += "[" + kernelName(zoneNames_[site.zone]) + "]";
     }
     return name;
 }
 
 std::string KernelSiteNames::counterName(const mach_memory_site& site) const {
-    if ((site.flags & KernelSiteIsNamed) != 0) {
+    if ((site.flags & kernelSiteIsNamed) != 0) {
         if (std::string name = kernelName(site.name); isReadable(name)) {
             return name;
         }
     }
-    return typeName(site.flags & KernelSiteTypeMask, site.site);
+    return typeName(site.flags & kernelSiteTypeMask, site.site);
 }
 
 std::string KernelSiteNames::typeName(std::uint64_t type, std::uint64_t site) const {
     switch (type) {
-    case KernelSiteIsTag:
+    case kernelSiteIsTag:
         return tagName(site);
-    case KernelSiteIsModule: {
+    case kernelSiteIsModule: {
         const auto module = modules_.find(site);
         return module != modules_.end() && isReadable(module->second)
                    ? module->second
                    : formatted("unloaded kmod %" PRIu64, site);
     }
-    case KernelSiteIsCode: {
+    case kernelSiteIsCode: {
         const auto symbol = site != 0 && symbolicator_ ? symbolicator_->symbolName(site) : std::nullopt;
         return symbol && isReadable(*symbol) ? *symbol : formatted("site 0x%" PRIx64, site);
     }
-    case KernelSiteIsCounter:
+    case kernelSiteIsCounter:
         return nameOfCounter(site);
     default:
         return formatted("unknown site (0x%x, 0x%" PRIx64 ")", static_cast<unsigned>(type), site);

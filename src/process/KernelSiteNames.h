@@ -17,19 +17,6 @@
 
 namespace tally {
 
-// The low 8 bits of a site's flags are its type.
-inline constexpr std::uint64_t KernelSiteTypeMask = 0xff;
-inline constexpr std::uint64_t KernelSiteIsTag = 0;
-inline constexpr std::uint64_t KernelSiteIsModule = 1;
-inline constexpr std::uint64_t KernelSiteIsCode = 2;
-inline constexpr std::uint64_t KernelSiteIsCounter = 3;
-inline constexpr std::uint64_t KernelSiteIsWired = 0x100;
-inline constexpr std::uint64_t KernelSiteIsHidden = 0x200;
-inline constexpr std::uint64_t KernelSiteIsNamed = 0x400;
-inline constexpr std::uint64_t KernelSiteIsOfZone = 0x800;
-
-inline constexpr std::uint64_t KernelTagMlock = 24; // memory that is wired on behalf of user processes
-
 /// `name`, cut at its first NUL and at the length of the kernel's name fields.
 std::string kernelName(const std::string& name);
 

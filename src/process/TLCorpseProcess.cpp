@@ -1,6 +1,7 @@
 #include "process/TLCorpseProcess.h"
 
 #include "base/Format.h"
+#include "platform/kcdata.h"
 #include "process/CorpseKcdata.h"
 
 #include <algorithm>
@@ -13,8 +14,7 @@ using namespace platform;
 
 namespace {
 
-constexpr std::size_t MaxPathLength = 1023;
-constexpr std::uint32_t TranslatedFlag = 0x20000;
+constexpr std::size_t maxPathLength = 1023;
 
 /// What the crash information says of the process.
 struct CrashInformation {
@@ -35,32 +35,32 @@ void readNumber(std::span<const std::byte> payload, Number& number) {
 
 std::string nameOfPath(std::span<const std::byte> payload) {
     const auto* const text = reinterpret_cast<const char*>(payload.data());
-    std::string_view path(text, std::min(payload.size(), MaxPathLength));
+    std::string_view path(text, std::min(payload.size(), maxPathLength));
     path = path.substr(0, path.find('\0'));
     return std::string(path.substr(path.rfind('/') + 1));
 }
 
 void readItem(const KcdataItem& item, CrashInformation& information) {
     switch (item.type) {
-    case 0x805:
+    case crashPid:
         readNumber(item.payload, information.pid);
         break;
-    case 0x80F:
+    case crashPath:
         information.name = nameOfPath(item.payload);
         break;
-    case 0x815:
+    case crashFlags:
         readNumber(item.payload, information.flags);
         break;
-    case 0x819:
+    case crashDirtyFlags:
         readNumber(item.payload, information.dirtyFlags);
         break;
-    case 0x825:
+    case crashPageTable:
         readNumber(item.payload, information.ledgers.pageTable);
         break;
-    case 0x826:
+    case crashPhysTally:
         readNumber(item.payload, information.ledgers.physTally);
         break;
-    case 0x827:
+    case crashPhysTallyPeak:
         readNumber(item.payload, information.ledgers.physTallyPeak);
         break;
     default:
@@ -69,17 +69,20 @@ void readItem(const KcdataItem& item, CrashInformation& information) {
 }
 
 /// The flags of an identity record that say what the crash information's flags say.
-std::uint32_t recordFlags(std::uint32_t crashFlags) {
+std::uint32_t recordFlags(std::uint32_t told) {
     struct Translation {
         std::uint32_t crashFlag;
         std::uint32_t recordFlag;
     };
-    constexpr Translation translations[] = {
-        {0x200, PROC_FLAG_SYSTEM}, {0x4, PROC_FLAG_LP64}, {0x2, 0x80},
-        {0x100, 0x2000},           {0x4000, 0x4000},      {0x1000000, 0x100}};
+    constexpr Translation translations[] = {{0x200, PROC_FLAG_SYSTEM},
+                                            {crashFlag64bit, PROC_FLAG_LP64},
+                                            {0x2, 0x80},
+                                            {0x100, 0x2000},
+                                            {0x4000, 0x4000},
+                                            {0x1000000, 0x100}};
     std::uint32_t flags = 0;
     for (const auto& [crashFlag, recordFlag] : translations) {
-        flags |= (crashFlags & crashFlag) != 0 ? recordFlag : 0;
+        flags |= (told & crashFlag) != 0 ? recordFlag : 0;
     }
     return flags;
 }
@@ -97,7 +100,7 @@ std::shared_ptr<TLCorpseProcess> TLCorpseProcess::initWithCorpse(mach_port_t cor
     }
     const auto process = std::make_shared<TLCorpseProcess>();
     process->setTask(PortRight(corpse));
-    process->setIsTranslated((information.flags & TranslatedFlag) != 0);
+    process->setIsTranslated((information.flags & crashFlagTranslated) != 0);
     proc_bsdinfo info;
     info.pbi_flags = recordFlags(information.flags);
     info.pbi_pid = static_cast<std::uint32_t>(information.pid);

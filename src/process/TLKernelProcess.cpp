@@ -15,8 +15,8 @@ using namespace platform;
 namespace {
 
 // Zones and sites are objects of their own: their ids are their numbers with one of these bits.
-constexpr std::uint64_t ZoneObject = std::uint64_t{1} << 33;
-constexpr std::uint64_t SiteObject = std::uint64_t{1} << 32;
+constexpr std::uint64_t zoneObject = std::uint64_t{1} << 33;
+constexpr std::uint64_t siteObject = std::uint64_t{1} << 32;
 
 TLMemoryRegion regionOfZone(const mach_zone_info& zone, const std::string& name, std::size_t index) {
     const std::uint64_t inUse = zone.elements_in_use * zone.element_size;
@@ -26,15 +26,15 @@ TLMemoryRegion regionOfZone(const mach_zone_info& zone, const std::string& name,
     region.size = zone.current_size;
     region.dirtySize = zone.collectable == 0 ? zone.current_size : std::min(inUse, zone.current_size);
     region.reclaimableSize = zone.current_size - region.dirtySize;
-    region.object_id = ZoneObject | index;
+    region.object_id = zoneObject | index;
     return region;
 }
 
 /// Memory of zones, of user processes and of what is hidden counts elsewhere already: it is clean here.
 TLMemoryRegion regionOfSite(const mach_memory_site& site, const KernelSiteNames& names, std::size_t index) {
-    const bool isHidden = (site.flags & KernelSiteIsHidden) != 0;
-    const bool isUserWired = site.site == KernelTagMlock;
-    const bool isWired = (site.flags & (KernelSiteIsWired | KernelSiteIsOfZone)) == KernelSiteIsWired;
+    const bool isHidden = (site.flags & kernelSiteIsHidden) != 0;
+    const bool isUserWired = site.site == kernelTagMlock;
+    const bool isWired = (site.flags & (kernelSiteIsWired | kernelSiteIsOfZone)) == kernelSiteIsWired;
     TLMemoryRegion region;
     region.name = Name(names.regionName(site));
     region.size = site.size;
@@ -44,20 +44,20 @@ TLMemoryRegion regionOfSite(const mach_memory_site& site, const KernelSiteNames&
         region.cleanNonSpecSize = site.size;
         region.detailedName = isHidden ? Name("(hidden)") : isUserWired ? Name("(user wired)") : Name();
     }
-    if ((site.flags & KernelSiteTypeMask) == KernelSiteIsCode) {
+    if ((site.flags & kernelSiteTypeMask) == kernelSiteIsCode) {
         if (const auto source = names.sourceOf(site.site)) {
             region.detailedName = Name(*source);
         }
     }
-    region.wired = (site.flags & KernelSiteIsWired) != 0;
+    region.wired = (site.flags & kernelSiteIsWired) != 0;
     region.user_tag = static_cast<std::uint32_t>(index);
-    region.object_id = SiteObject | index;
+    region.object_id = siteObject | index;
     return region;
 }
 
 bool isCounter(const mach_memory_site& site) {
-    constexpr std::uint64_t mask = KernelSiteTypeMask | KernelSiteIsWired | KernelSiteIsOfZone;
-    return (site.flags & mask) == KernelSiteIsCounter;
+    constexpr std::uint64_t mask = kernelSiteTypeMask | kernelSiteIsWired | kernelSiteIsOfZone;
+    return (site.flags & mask) == kernelSiteIsCounter;
 }
 
 } // namespace

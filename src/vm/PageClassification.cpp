@@ -14,8 +14,8 @@ using namespace platform;
 
 namespace {
 
-constexpr std::uint64_t PagesPerQuery = 4096;
-constexpr std::uint64_t PagesBehindGap = 64; // of the first query there; of each that follows twice as many
+constexpr std::uint64_t pagesPerQuery = 4096;
+constexpr std::uint64_t pagesBehindGap = 64; // of the first query there; of each that follows twice as many
 
 /// Asks for the state of `pageCount` pages from `start` on and calls handler(words, index of the first of
 /// them) for each chunk of them. Of what is absent behind a chunk only the last page is told: what is only
@@ -24,8 +24,8 @@ constexpr std::uint64_t PagesBehindGap = 64; // of the first query there; of eac
 template <typename Handler>
 bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t pageCount,
                            Handler&& handler) {
-    std::array<std::int32_t, PagesPerQuery> words;
-    std::uint64_t wanted = PagesPerQuery;
+    std::array<std::int32_t, pagesPerQuery> words;
+    std::uint64_t wanted = pagesPerQuery;
     for (std::uint64_t first = 0; first < pageCount;) {
         std::uint64_t count = std::min(pageCount - first, wanted);
         const std::span<std::int32_t> chunk = std::span(words).first(count);
@@ -39,12 +39,12 @@ bool queryPageDispositions(WalkedTask& task, std::uint64_t start, std::uint64_t 
         }
         handler(std::span<const std::int32_t>(chunk.first(count)), first);
         first += chunk.size();
-        wanted = std::min(2 * wanted, PagesPerQuery);
+        wanted = std::min(2 * wanted, pagesPerQuery);
         if (first < pageCount) {
             const std::uint64_t next = mach_vm_next_page(task.task, start + first * task.pageSize,
                                                          start + pageCount * task.pageSize);
             const std::uint64_t index = std::min((next - start) / task.pageSize, pageCount - 1);
-            wanted = index == first ? wanted : PagesBehindGap;
+            wanted = index == first ? wanted : pagesBehindGap;
             first = index;
         }
     }

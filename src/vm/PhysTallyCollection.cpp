@@ -13,7 +13,7 @@ using namespace platform;
 
 namespace {
 
-constexpr const char* SwitchName = "vm.self_region_tally";
+constexpr const char* switchName = "vm.self_region_tally";
 
 enum class Switch : std::uint8_t { off = 0, on = 1, unknown = 2 };
 
@@ -28,7 +28,7 @@ bool physTallyCollectionEnabled() {
     Switch state = cachedSwitch().load();
     if (state == Switch::unknown) {
         std::int32_t value = 0;
-        if (sysctlbyname_read(SwitchName, &value) != 0) {
+        if (sysctlbyname_read(switchName, &value) != 0) {
             if (errno != ENOENT) {
                 std::perror("Unable to retrieve status of physical tally data collection");
             }
@@ -41,7 +41,7 @@ bool physTallyCollectionEnabled() {
 }
 
 void setPhysTallyCollectionEnabled(int value) {
-    if (sysctlbyname_write(SwitchName, value) != 0 && errno != ENOENT) {
+    if (sysctlbyname_write(switchName, value) != 0 && errno != ENOENT) {
         std::perror("Unable to configure physical tally data collection");
     }
     cachedSwitch() = Switch::unknown;

@@ -16,7 +16,7 @@ using namespace platform;
 
 namespace {
 
-constexpr std::uint32_t NeverOwnedTag = 87; // its purgeable memory is charged to somebody else
+constexpr std::uint32_t neverOwnedTag = 87; // its purgeable memory is charged to somebody else
 
 struct ReservedArea {
     std::uint64_t start;
@@ -150,7 +150,7 @@ void RegionRecorder::matchOwnedObject(TLMemoryRegion& region, const EnumeratedRe
         chargeOwnedObject(region, record->second);
         region.name = nameWithLedgerTag(region.name, record->second);
         owned->erase(record);
-    } else if (mapping.purgeState != VM_PURGABLE_DENY && mapping.info.user_tag != NeverOwnedTag &&
+    } else if (mapping.purgeState != VM_PURGABLE_DENY && mapping.info.user_tag != neverOwnedTag &&
                mapping.info.pages_resident != 0) {
         region.ownedExclusivelyByParentProcess = true;
         region.dirtySize += region.cleanNonSpecSize;

@@ -12,8 +12,8 @@ using namespace platform;
 
 namespace {
 
-constexpr std::uint32_t FirstAppSpecificTag = 240;
-constexpr std::uint32_t TagCount = 256;
+constexpr std::uint32_t firstAppSpecificTag = 240;
+constexpr std::uint32_t tagCount = 256;
 
 struct TagName {
     std::uint32_t tag;
@@ -99,13 +99,13 @@ constexpr TagName tagNames[] = {
 };
 
 /// The tags that the tool names itself; the other slots are absent.
-std::array<Name, TagCount> makeNamedTags() {
-    std::array<Name, TagCount> names;
+std::array<Name, tagCount> makeNamedTags() {
+    std::array<Name, tagCount> names;
     for (const TagName& row : tagNames) {
         names[row.tag] = Name(row.name);
     }
-    for (std::uint32_t tag = FirstAppSpecificTag; tag < TagCount; ++tag) {
-        names[tag] = Name(formatted("app-specific tag %u", tag - FirstAppSpecificTag + 1));
+    for (std::uint32_t tag = firstAppSpecificTag; tag < tagCount; ++tag) {
+        names[tag] = Name(formatted("app-specific tag %u", tag - firstAppSpecificTag + 1));
     }
     return names;
 }
@@ -113,12 +113,12 @@ std::array<Name, TagCount> makeNamedTags() {
 } // namespace
 
 Name nameForTag(std::uint32_t tag) {
-    static const std::array<Name, TagCount> names = makeNamedTags();
+    static const std::array<Name, tagCount> names = makeNamedTags();
     static const Name unmapped("Owned physical tally (unmapped)");
     if (tag == TLUnmappedTag) {
         return unmapped;
     }
-    if (tag < TagCount) {
+    if (tag < tagCount) {
         if (!names[tag].isNull()) {
             return names[tag];
         }

@@ -42,7 +42,7 @@ TEST_F(RunDriver, EndsWithItsStatusAndMessage) {
         EXPECT_EQ(output, "") << words;
     }
     // A list of processes that cannot be had is no fault of the names that were not found before.
-    kernel.fail("proc_listallpids", 1, {.nth = 3, .times = platform::Always});
+    kernel.fail("proc_listallpids", 1, {.nth = 3, .times = platform::always});
     EXPECT_EQ(run("server nobody -t"), 1);
     EXPECT_EQ(messages, "Unable to obtain system process list\n");
     EXPECT_TRUE(output.starts_with("Gather memory information"));

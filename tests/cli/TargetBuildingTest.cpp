@@ -115,7 +115,7 @@ TEST_F(TargetBuilding, FollowsTheOptions) {
 
 TEST_F(TargetBuilding, FailsWithoutTargetsOrAList) {
     EXPECT_EQ(build("-t -x server").error.code, TLErrorNoTargets);
-    kernel.fail("proc_listallpids", 1, {.times = Always});
+    kernel.fail("proc_listallpids", 1, {.times = always});
     const struct {
         std::string words, targets, error;
     } cases[] = {

@@ -66,7 +66,7 @@ TEST_F(TargetSelection, WorksOnAListThatMayChangeOrFail) {
     ASSERT_TRUE(infos);
     EXPECT_EQ(infos->size(), 22u);
     EXPECT_EQ((*infos)[1].pbi_pid, 3u);
-    kernel.fail("proc_listallpids", EPERM, {.times = Always});
+    kernel.fail("proc_listallpids", EPERM, {.times = always});
     EXPECT_FALSE(allProcessesExcludingPids({}) || childPidsForPids(Pids{10}) ||
                  pidsForStringDescriptions({}, nullptr));
 }

@@ -84,7 +84,7 @@ class KernelBuilder {
     static CallSelector takeSelector(CaseStatement& statement) {
         CallSelector which{.nth = statement.number("nth").value_or(1)};
         const std::string times = statement.text("times").value_or("1");
-        which.times = times == "always" ? Always : caseNumber(times);
+        which.times = times == "always" ? always : caseNumber(times);
         which.pid = statement.number("pid");
         return which;
     }

@@ -26,7 +26,7 @@ struct CallSelector {
     std::uint64_t times = 1;           // how many in a row
     std::optional<std::int32_t> pid{}; // only those about this process
 };
-inline constexpr std::uint64_t Always = ~std::uint64_t{0}; // a value of `times`
+inline constexpr std::uint64_t always = ~std::uint64_t{0}; // a value of `times`
 
 /// Throws std::invalid_argument for a call that does not exist, or cannot fail where it must.
 void requireCallName(std::string_view call, bool canFail);

@@ -29,17 +29,6 @@ namespace tally::platform {
 
 namespace {
 
-// Types of items of crash information.
-constexpr std::uint32_t pidItem = 0x805;
-constexpr std::uint32_t pathItem = 0x80F;
-constexpr std::uint32_t flagsItem = 0x815;
-constexpr std::uint32_t dirtyFlagsItem = 0x819;
-constexpr std::uint32_t pageTableItem = 0x825;
-constexpr std::uint32_t physTallyItem = 0x826;
-constexpr std::uint32_t peakItem = 0x827;
-
-constexpr std::uint32_t flag64bit = 0x4;
-
 /// Who the process is, as its crash information says it.
 struct Identification {
     std::string path; // the link to the executable, or a name
@@ -53,19 +42,19 @@ std::optional<Identification> identify(std::int32_t pid) {
         return std::nullopt;
     }
     return Identification{.path = executableLink(pid).value_or(stat->comm),
-                          .flags = is64bitProgram(*stat) ? flag64bit : 0};
+                          .flags = is64bitProgram(*stat) ? crashFlag64bit : 0};
 }
 
 std::vector<std::byte> crashInformationOf(std::int32_t pid, const Identification& identification,
                                           const Charges& charges) {
     KcdataWriter writer;
-    writer.addNumber(pidItem, static_cast<std::uint32_t>(pid));
-    writer.addText(pathItem, executablePath(pid, identification.path));
-    writer.addNumber(flagsItem, identification.flags);
-    writer.addNumber(dirtyFlagsItem, std::uint32_t{0}); // nothing is tracked for idle exit here
-    writer.addNumber(pageTableItem, charges.pageTable);
-    writer.addNumber(physTallyItem, charges.physTally);
-    writer.addNumber(peakItem, charges.peak);
+    writer.addNumber(crashPid, static_cast<std::uint32_t>(pid));
+    writer.addText(crashPath, executablePath(pid, identification.path));
+    writer.addNumber(crashFlags, identification.flags);
+    writer.addNumber(crashDirtyFlags, std::uint32_t{0}); // nothing is tracked for idle exit here
+    writer.addNumber(crashPageTable, charges.pageTable);
+    writer.addNumber(crashPhysTally, charges.physTally);
+    writer.addNumber(crashPhysTallyPeak, charges.peak);
     return writer.finish();
 }
 

@@ -2,6 +2,8 @@
 
 #pragma once
 
+#include "platform/kcdata.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
@@ -15,7 +17,7 @@ namespace tally::platform {
 /// the flags of an item say by how many.
 class KcdataWriter {
   public:
-    KcdataWriter() { add(beginMarker, {}); }
+    KcdataWriter() { add(kcdataBegin, {}); }
 
     template <typename Number>
     void addNumber(std::uint32_t type, Number number) {
@@ -28,20 +30,16 @@ class KcdataWriter {
         add(type, std::as_bytes(std::span(bytes)));
     }
     std::vector<std::byte> finish() {
-        add(endMarker, {});
+        add(kcdataEnd, {});
         return std::move(buffer_);
     }
 
   private:
-    static constexpr std::uint32_t beginMarker = 0xDEADF157;
-    static constexpr std::uint32_t endMarker = 0xF19158ED;
     static constexpr std::size_t alignment = 16;
 
     void add(std::uint32_t type, std::span<const std::byte> payload) {
         const std::size_t padded = (payload.size() + alignment - 1) / alignment * alignment;
-        appendBytes(type);
-        appendBytes(static_cast<std::uint32_t>(padded));
-        appendBytes(std::uint64_t{padded - payload.size()});
+        appendBytes(KcdataHeader{type, static_cast<std::uint32_t>(padded), padded - payload.size()});
         buffer_.insert(buffer_.end(), payload.begin(), payload.end());
         buffer_.resize(buffer_.size() + padded - payload.size());
     }

@@ -27,14 +27,6 @@ namespace tally::platform {
 
 namespace {
 
-// Types and flags of sites.
-constexpr std::uint64_t isTag = 0;
-constexpr std::uint64_t isModule = 1;
-constexpr std::uint64_t isCode = 2;
-constexpr std::uint64_t isCounter = 3;
-constexpr std::uint64_t isWired = 0x100;
-constexpr std::uint64_t isNamed = 0x400;
-
 // Sites of the kernel's table of tags.
 constexpr std::uint64_t stackTag = 8;
 constexpr std::uint64_t processorTag = 9;
@@ -44,7 +36,6 @@ constexpr std::uint64_t zoneTag = 12;
 constexpr std::uint64_t allocationTag = 13;
 constexpr std::uint64_t compressedTag = 15;
 constexpr std::uint64_t fileCacheTag = 22;
-constexpr std::uint64_t lockedTag = 24;
 
 // Counters.
 constexpr std::uint64_t managedCount = 0;
@@ -117,19 +108,20 @@ class KernelRecord {
 
     /// Adds a site that nothing else counts.
     void addWired(std::uint64_t type, std::uint64_t site, std::uint64_t size, std::string name = "") {
-        add(type | isWired, site, size, std::move(name));
+        add(type | kernelSiteIsWired, site, size, std::move(name));
         accounted_ += size;
     }
     void add(std::uint64_t flags, std::uint64_t site, std::uint64_t size, std::string name = "") {
         if (size != 0) {
-            record_.sites.push_back({.flags = flags | (name.empty() ? 0 : isNamed),
+            record_.sites.push_back({.flags = flags | (name.empty() ? 0 : kernelSiteIsNamed),
                                      .site = site,
                                      .size = size,
                                      .name = std::move(name)});
         }
     }
     void addCounter(std::uint64_t counter, std::uint64_t value) {
-        record_.sites.push_back({.flags = isCounter, .site = counter, .size = value, .mapped = value});
+        record_.sites.push_back(
+            {.flags = kernelSiteIsCounter, .site = counter, .size = value, .mapped = value});
     }
 
     const Meminfo& meminfo_;
@@ -154,7 +146,7 @@ mach_memory_record KernelRecord::take() {
     addZones();
     addVirtualMemory();
     addRowsOfMeminfo();
-    addWired(isTag, 0, hugePagesFree, "huge page pool (unused)");
+    addWired(kernelSiteIsTag, 0, hugePagesFree, "huge page pool (unused)");
     addRest();
     addClean();
     addCounters();
@@ -188,7 +180,8 @@ void KernelRecord::addZones() {
     }
     accounted_ += inCaches;
     // Large allocations have no cache. Where the caches may not be read this is all of them.
-    addWired(isTag, record_.zones.empty() ? zoneTag : allocationTag, difference(meminfo_["Slab"], inCaches));
+    addWired(kernelSiteIsTag, record_.zones.empty() ? zoneTag : allocationTag,
+             difference(meminfo_["Slab"], inCaches));
 }
 
 void KernelRecord::addVirtualMemory() {
@@ -197,7 +190,7 @@ void KernelRecord::addVirtualMemory() {
                             : VmallocRows{{std::string(allOfVmalloc), meminfo_["VmallocUsed"]}};
     // Stacks are virtual memory too; where none of it is theirs they are apart.
     const std::uint64_t stacks = takeOff(rows, allocatesStacks, meminfo_["KernelStack"]);
-    addWired(isTag, stackTag, stacks != 0 ? stacks : meminfo_["KernelStack"]);
+    addWired(kernelSiteIsTag, stackTag, stacks != 0 ? stacks : meminfo_["KernelStack"]);
 
     const std::vector<LoadedModule> modules =
         decodeModules(readSystemFile(systemPath("/proc/modules")).value_or(""));
@@ -209,36 +202,37 @@ void KernelRecord::addVirtualMemory() {
     const bool areFound = takeOff(withoutModules, loadsModules, ofModules) == ofModules;
     for (const LoadedModule& module : modules) {
         if (areFound) {
-            addWired(isModule, loadTag(module.name), module.size);
+            addWired(kernelSiteIsModule, loadTag(module.name), module.size);
         } else { // some other row holds them
-            add(isModule, loadTag(module.name), module.size);
+            add(kernelSiteIsModule, loadTag(module.name), module.size);
         }
     }
     for (const auto& [symbol, bytes] : areFound ? withoutModules : rows) {
-        addWired(isCode, 0, bytes, symbol);
+        addWired(kernelSiteIsCode, 0, bytes, symbol);
     }
 }
 
 void KernelRecord::addRowsOfMeminfo() {
-    addWired(isTag, processorTag, meminfo_["Percpu"]);
-    addWired(isTag, pageMapTag, meminfo_["SecPageTables"]); // of virtual machines and devices
-    addWired(isTag, compressedTag, zones_.compressed);
+    addWired(kernelSiteIsTag, processorTag, meminfo_["Percpu"]);
+    addWired(kernelSiteIsTag, pageMapTag, meminfo_["SecPageTables"]); // of virtual machines and devices
+    addWired(kernelSiteIsTag, compressedTag, zones_.compressed);
     // Since 6.12 the kernel's own are among them, before it not even all of the processes' are.
-    addWired(isTag, 0, difference(meminfo_["PageTables"], userPageTables_), "other page tables");
+    addWired(kernelSiteIsTag, 0, difference(meminfo_["PageTables"], userPageTables_), "other page tables");
 }
 
 void KernelRecord::addRest() {
-    addWired(isTag, 0, difference(held_, accounted_ + userPageTables_), "other kernel memory");
+    addWired(kernelSiteIsTag, 0, difference(held_, accounted_ + userPageTables_), "other kernel memory");
 }
 
 /// What counts elsewhere.
 void KernelRecord::addClean() {
-    add(isTag, pageTableTag, userPageTables_);
-    add(isTag | isWired, lockedTag, meminfo_["Mlocked"]);
-    add(isTag, fileCacheTag, difference(meminfo_["Cached"] + meminfo_["Buffers"], meminfo_["Shmem"]));
+    add(kernelSiteIsTag, pageTableTag, userPageTables_);
+    add(kernelSiteIsTag | kernelSiteIsWired, kernelTagMlock, meminfo_["Mlocked"]);
+    add(kernelSiteIsTag, fileCacheTag,
+        difference(meminfo_["Cached"] + meminfo_["Buffers"], meminfo_["Shmem"]));
     const std::optional<std::string> iomem = read("/proc/iomem");
     for (const auto& [part, size] : decodeKernelImage(iomem.value_or(""))) {
-        add(isTag, 0, size, "kernel " + part);
+        add(kernelSiteIsTag, 0, size, "kernel " + part);
         imageSize_ += size;
     }
     if (iomem && imageSize_ == 0) {

@@ -24,8 +24,8 @@ struct ProcessStat {
     // 1 for the first where tracing is not permitted.
     std::array<std::uint64_t, 6> layout{};
 
-    static constexpr std::uint32_t KernelThread = 0x00200000;
-    bool isKernelThread() const { return (flags & KernelThread) != 0; }
+    static constexpr std::uint32_t kernelThread = 0x00200000;
+    bool isKernelThread() const { return (flags & kernelThread) != 0; }
     /// No process of its own: the id of a thread opens a folder too, and only a process signals its end.
     bool isThread() const { return exitSignal < 0; }
     /// Whether the kernel shows who asks what is in the process's memory.

@@ -37,11 +37,11 @@ struct procmap_query {
 static_assert(sizeof(procmap_query) == 104);
 
 constexpr unsigned long PROCMAP_QUERY = _IOWR('f', 17, procmap_query);
-constexpr std::uint64_t QueryReadable = 1;
-constexpr std::uint64_t QueryWritable = 2;
-constexpr std::uint64_t QueryExecutable = 4;
-constexpr std::uint64_t QueryShared = 8;
-constexpr std::uint64_t QueryCoveringOrNext = 0x10;
+constexpr std::uint64_t queryReadable = 1;
+constexpr std::uint64_t queryWritable = 2;
+constexpr std::uint64_t queryExecutable = 4;
+constexpr std::uint64_t queryShared = 8;
+constexpr std::uint64_t queryCoveringOrNext = 0x10;
 
 // A query costs more than a line of text once names are rare: in address spaces of this many mappings, which
 // are mostly anonymous, the text is read instead.
@@ -62,10 +62,10 @@ Mapping mappingFromAnswer(const procmap_query& answer, const char* name) {
     mapping.inode = answer.inode;
     mapping.deviceMajor = answer.dev_major;
     mapping.deviceMinor = answer.dev_minor;
-    mapping.readable = (answer.vma_flags & QueryReadable) != 0;
-    mapping.writable = (answer.vma_flags & QueryWritable) != 0;
-    mapping.executable = (answer.vma_flags & QueryExecutable) != 0;
-    mapping.shared = (answer.vma_flags & QueryShared) != 0;
+    mapping.readable = (answer.vma_flags & queryReadable) != 0;
+    mapping.writable = (answer.vma_flags & queryWritable) != 0;
+    mapping.executable = (answer.vma_flags & queryExecutable) != 0;
+    mapping.shared = (answer.vma_flags & queryShared) != 0;
     mapping.pageSize = answer.vma_page_size;
     if (answer.vma_name_size > 1) {
         mapping.name.assign(name, answer.vma_name_size - 1); // the size counts the NUL
@@ -79,7 +79,7 @@ QueryResult queryMappings(const Descriptor& maps, std::vector<Mapping>* mappings
     while (mappings->size() < mostQueries) {
         procmap_query query{};
         query.size = sizeof(query);
-        query.query_flags = QueryCoveringOrNext;
+        query.query_flags = queryCoveringOrNext;
         query.query_addr = address;
         query.vma_name_size = name.size();
         query.vma_name_addr = reinterpret_cast<std::uintptr_t>(name.data());

@@ -58,9 +58,9 @@ int scanPages(int pagemap, AddressRange range, bool withFile, std::uint64_t most
         query.vec = reinterpret_cast<std::uintptr_t>(used.data());
         query.vec_len = used.size();
         query.max_pages = mostPages;
-        query.category_anyof_mask = PageIsPresent | PageIsSwapped;
-        query.return_mask = PageIsPresent | PageIsSwapped | PageIsZero | PageIsHuge |
-                            (withFile ? PageIsFile : 0) | (withGuards ? PageIsGuard : 0);
+        query.category_anyof_mask = pageIsPresent | pageIsSwapped;
+        query.return_mask = pageIsPresent | pageIsSwapped | pageIsZero | pageIsHuge |
+                            (withFile ? pageIsFile : 0) | (withGuards ? pageIsGuard : 0);
         const int count = ioctl(pagemap, PAGEMAP_SCAN, &query);
         if (count < 0 && errno == EINVAL && withGuards) {
             tellsGuards = false;

@@ -18,12 +18,12 @@ struct PageRegion {
     std::uint64_t categories;
 };
 
-inline constexpr std::uint64_t PageIsFile = 4;
-inline constexpr std::uint64_t PageIsPresent = 8;
-inline constexpr std::uint64_t PageIsSwapped = 16;
-inline constexpr std::uint64_t PageIsZero = 32; // the kernel's zero page: no memory of its own
-inline constexpr std::uint64_t PageIsHuge = 64; // mapped as one page, by an entry one level up
-inline constexpr std::uint64_t PageIsGuard = 256;
+inline constexpr std::uint64_t pageIsFile = 4;
+inline constexpr std::uint64_t pageIsPresent = 8;
+inline constexpr std::uint64_t pageIsSwapped = 16;
+inline constexpr std::uint64_t pageIsZero = 32; // the kernel's zero page: no memory of its own
+inline constexpr std::uint64_t pageIsHuge = 64; // mapped as one page, by an entry one level up
+inline constexpr std::uint64_t pageIsGuard = 256;
 
 /// Which runs one call gave, and how far it came.
 struct PageScanStep {

@@ -59,11 +59,11 @@ Segment segmentAt(std::span<const Mapping> mappings, std::size_t first, std::siz
 }
 
 std::optional<PageKind> kindOfRegion(const PageRegion& region) {
-    if ((region.categories & (PageIsZero | PageIsGuard)) != 0) {
+    if ((region.categories & (pageIsZero | pageIsGuard)) != 0) {
         return std::nullopt; // no memory
     }
-    return (region.categories & PageIsFile) != 0      ? PageKind::object
-           : (region.categories & PageIsPresent) != 0 ? PageKind::anonymous
+    return (region.categories & pageIsFile) != 0      ? PageKind::object
+           : (region.categories & pageIsPresent) != 0 ? PageKind::anonymous
                                                       : PageKind::swapped;
 }
 
@@ -156,7 +156,7 @@ int PageSource::scanOn(std::size_t end, std::uint64_t last, bool withFile, std::
         for (std::size_t at = mapping; kind && at < end && mappings_[at].start < region.end; ++at) {
             sink({at, std::max(region.start, mappings_[at].start), std::min(region.end, mappings_[at].end),
                   isOwn && mappings_[at].isSharedMemory() ? PageKind::object : *kind,
-                  (region.categories & PageIsHuge) != 0});
+                  (region.categories & pageIsHuge) != 0});
         }
     }
     cursor->address = step.resume;
