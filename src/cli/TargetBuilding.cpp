@@ -4,7 +4,6 @@
 #include "platform/mach_task.h"
 #include "platform/system.h"
 #include "process/TLCorpseProcess.h"
-#include "process/TLHeapsnapProcess.h"
 #include "process/TLUserProcess.h"
 
 #include <cinttypes>
@@ -140,7 +139,7 @@ bool TargetBuilder::openSnapshots() {
 
 bool TargetBuilder::openSnapshot(const std::string& path) {
     std::optional<TLError> openError;
-    const std::shared_ptr<TLProcess> snapshot = processWithHeapsnap(path, &openError);
+    const std::shared_ptr<TLProcess> snapshot = TLProcess::processWithFile(path, &openError);
     if (!snapshot) {
         return targetOneProcess(path) ||
                fail(TLErrorBadSnapshot,

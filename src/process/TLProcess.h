@@ -6,6 +6,7 @@
 
 #pragma once
 
+#include "base/TLError.h"
 #include "platform/bsd_process.h"
 #include "platform/kern_return.h"
 #include "process/TLAuxData.h"
@@ -41,6 +42,8 @@ class TLProcess : public MemoryHolder {
     /// `refusal` where that is given (KERN_SUCCESS: there was none), else to standard error.
     static std::shared_ptr<TLProcess> processWithBsdInfo(const platform::proc_bsdinfo& info,
                                                          platform::kern_return_t* refusal = nullptr);
+    /// The target that the file `path` holds; null, with the reason in `error`, when it holds none.
+    static std::shared_ptr<TLProcess> processWithFile(const std::string& path, std::optional<TLError>* error);
     /// The last component of the executable's path, else a name from the record, else "Unknown". Thread-safe.
     static std::string nameForBsdInfo(const platform::proc_bsdinfo& info);
 

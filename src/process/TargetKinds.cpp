@@ -1,5 +1,6 @@
-// Which kind of target a process is.
+// Which kind of target a process is, and which one a file holds.
 
+#include "process/TLHeapsnapProcess.h"
 #include "process/TLKernelProcess.h"
 #include "process/TLUserProcess.h"
 
@@ -29,6 +30,12 @@ std::shared_ptr<TLProcess> TLProcess::processWithBsdInfo(const proc_bsdinfo& inf
     const bool isReadable = process->initWithBsdInfo(info);
     process->refusal_ = nullptr;
     return isReadable ? process : nullptr;
+}
+
+/// A snapshot is the one kind of file so far. Another one is told apart here, by what its first bytes are.
+std::shared_ptr<TLProcess> TLProcess::processWithFile(const std::string& path,
+                                                      std::optional<TLError>* error) {
+    return processWithHeapsnap(path, error);
 }
 
 } // namespace tally
