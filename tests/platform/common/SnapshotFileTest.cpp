@@ -230,6 +230,7 @@ TEST(SnapshotFile, ThatIsWrongSaysWhere) {
     for (const auto& [document, error] : cases) {
         EXPECT_EQ(errorOf(document), error) << document.substr(0, 400);
     }
+    EXPECT_EQ(errorOf(with("4096", "512")), "") << "the smallest page";
     EXPECT_EQ(errorOf(documentWith(region(R"(,"offset":18446744073709547520)"))), "");
     const std::string whole = QRYDataWithSnapshot(everyField());
     for (std::size_t length = 0; length + 1 < whole.size(); ++length) { // the last byte is a newline
