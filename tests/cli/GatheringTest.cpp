@@ -3,9 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-#include <set>
-
 namespace tally {
 namespace {
 
@@ -50,28 +47,6 @@ TEST(ThreadGather, StartsHighPidsFirstAndWaitsForAll) {
     EXPECT_LT(tally.gatherStartTime()->machAbsoluteTime(), tally.gatherEndTime()->machAbsoluteTime());
 }
 
-TEST(Gather, TellsWhatTheMachineCostsAllOnce) {
-    platform::ScriptedKernel kernel;
-    TLTally* all = nullptr;
-    TLTally tally(processes(5, [&](std::int32_t pid) {
-        TLProcess& process = **std::ranges::find(all->processes(), pid, &TLProcess::pid);
-        process.addWarning("own");
-        process.addMachineWarning(pid == 4 ? "of one" : "of most");
-    }));
-    all = &tally;
-    tally.processes()[0]->setHiddenFromDisplay(true); // process 1
-    EXPECT_FALSE(tally.gatherAllProcesses());
-    for (const auto& process : tally.processes()) {
-        std::vector<std::string> expected{"own"};
-        if (process->pid() < 3 || process->pid() == 4) {
-            expected.emplace_back(process->pid() == 4   ? "of one"
-                                  : process->pid() == 1 ? "of most"
-                                                        : "of most (so for 3 processes)");
-        }
-        EXPECT_EQ(process->warnings(), expected) << process->pid();
-    }
-}
-
 TEST(ThreadGather, AnInterruptStartsNoMore) {
     for (const bool beforeTheGather : {true, false}) {
         platform::ScriptedKernel kernel;
@@ -94,14 +69,6 @@ TEST(ThreadGather, AnInterruptStartsNoMore) {
         }
         EXPECT_TRUE(tally.gatherEndTime());
     }
-}
-
-TEST(Gathering, OfNothingIsNotInterrupted) {
-    platform::ScriptedKernel kernel;
-    TLTally tally({});
-    tally.earlyExit = true;
-    EXPECT_FALSE(tally.gatherAllProcesses());
-    EXPECT_TRUE(tally.gatherStartTime() && tally.gatherEndTime());
 }
 
 } // namespace

@@ -1,6 +1,11 @@
 #include "cli/RunDriver.h"
 #include "cli/CommandLine.h"
+#include "cli/Usage.h"
 #include "platform/scripted/ScriptedKernel.h"
+
+#include <filesystem>
+#include <fstream>
+#include <unistd.h>
 
 namespace tally {
 namespace {
@@ -24,28 +29,18 @@ class RunDriver : public testing::Test {
     std::string output, messages;
 };
 
-TEST_F(RunDriver, EndsWithItsStatusAndMessage) {
-    const struct {
-        std::string words, message;
-    } cases[] = {
-        {"--unmapped server", "Must run as root.\n"},
-        {"-j . server", "Unable to open JSON writer: Is a directory\nUnable to create JSON output\n"},
-        {"--benchlog no/x server",
-         "Unable to open blwriter: No such file or directory\nUnable to create benchlog output\n"},
-        {"--sample 1 nobody",
-         "Unable to find any processes matching the supplied process names or pids (try as root?)\n"},
-    };
-    kernel.effectiveUserId = 1000;
-    for (const auto& [words, message] : cases) {
-        EXPECT_EQ(run(words), 1) << words;
-        EXPECT_EQ(messages, message);
-        EXPECT_EQ(output, "") << words;
-    }
-    // A list of processes that cannot be had is no fault of the names that were not found before.
+TEST_F(RunDriver, TellsOnlyTheWorstOfTheListOfProcesses) {
+    // A list that cannot be had is no fault of the names that were not found before.
     kernel.fail("proc_listallpids", 1, {.nth = 3, .times = platform::always});
     EXPECT_EQ(run("server nobody -t"), 1);
     EXPECT_EQ(messages, "Unable to obtain system process list\n");
-    EXPECT_TRUE(output.starts_with("Gather memory information"));
+}
+
+TEST_F(RunDriver, ShowsInternalOptionsWhereTheirContentIs) {
+    kernel.internalContent.insert(subsystemIdentifier);
+    EXPECT_EQ(run("-h"), 0);
+    EXPECT_TRUE(output.ends_with(". 0.5)\n\nKestrelInternal:\n    --benchlog <file.blj>                 "
+                                 "print benchlog(1) output to a file\n"));
 }
 
 TEST_F(RunDriver, TurnsTheSwitchOnInTheDefaultModeAndNeverOff) {
@@ -56,44 +51,51 @@ TEST_F(RunDriver, TurnsTheSwitchOnInTheDefaultModeAndNeverOff) {
     }
 }
 
-TEST_F(RunDriver, ReportsWhatAnInterruptLeft) {
-    for (const bool isTerminal : {false, true}) {
+TEST_F(RunDriver, DeletesNoFileThatTookThePlaceOfItsOwn) {
+    const std::string path = testing::TempDir() + "tally-file-" + std::to_string(getpid());
+    kernel.before("proc_listallpids", [&] {
+        std::filesystem::rename(path, path + "-moved");
+        std::ofstream(path, std::ios::app);
+    });
+    EXPECT_EQ(run("nobody -j " + path), 1);
+    EXPECT_TRUE(std::filesystem::remove(path) && std::filesystem::remove(path + "-moved"));
+}
+
+TEST_F(RunDriver, MeetsSignals) {
+    const std::string early = "Exiting early due to SIGINT\n", finishing = "Finishing the output files\n";
+    const struct {
+        std::string words, call; // before which the signal comes
+        bool isTerminal, isTermination, isTaken;
+        std::string messages;
+        std::size_t restored; // how often the default action was, before and after
+    } cases[] = {
+        {"server", "mach_get_times", false, false, true, early, 1},
+        {"server", "mach_get_times", true, false, false, "", 0},
+        {"server", "mach_get_times", false, true, false, "", 1},
+        {"server -j /dev/null", "mach_get_times", false, true, true, early, 2},
+        {"server -j /dev/null", "mach_get_times", true, false, false, "", 1}, // where it listens later
+        {"server -j /dev/null", "fileInMemory", false, true, true, finishing, 2},
+        {"server -j /dev/null", "fileInMemory", true, false, true, finishing, 2},
+    };
+    for (const auto& [words, call, isTerminal, isTermination, isTaken, expected, restored] : cases) {
+        SCOPED_TRACE(words + " " + call + (isTerminal ? " terminal" : "") +
+                     (isTermination ? " SIGTERM" : ""));
+        const std::size_t before = kernel.callCount("restoreDefaultInterruptAction");
         kernel.outputIsTerminal = isTerminal;
-        bool wasTaken = isTerminal;
-        kernel.before("mach_get_times", [&] { wasTaken = kernel.interrupt(); });
-        EXPECT_EQ(run("server"), 0);
-        EXPECT_EQ(wasTaken, !isTerminal);
-        EXPECT_EQ(messages, isTerminal ? "" : "Exiting early due to SIGINT\n");
+        bool wasTaken = !isTaken;
+        kernel.before(call, [&] {
+            wasTaken = isTermination ? kernel.terminate() : kernel.interrupt();
+            EXPECT_EQ(kernel.callCount("restoreDefaultInterruptAction") - before, restored == 2)
+                << "the next one ends what writes files";
+        });
+        EXPECT_EQ(run(words), 0);
+        EXPECT_EQ(wasTaken, isTaken);
+        EXPECT_EQ(messages, expected);
         EXPECT_EQ(output.find("\tTally exited early due to SIGINT and did not finish gathering all data\n") !=
                       output.npos,
-                  !isTerminal);
+                  expected == early);
         EXPECT_FALSE(kernel.interrupt()); // the source is gone, and the default action is back
-        EXPECT_EQ(kernel.callCount("restoreDefaultInterruptAction"), 1U);
-    }
-}
-
-TEST_F(RunDriver, TerminationEndsEarlyOnlyWhatWritesFiles) {
-    for (const bool writesFile : {true, false}) {
-        bool wasTaken = !writesFile;
-        kernel.before("mach_get_times", [&] { wasTaken = kernel.terminate(); });
-        EXPECT_EQ(run(writesFile ? "server -j /dev/null" : "server"), 0);
-        EXPECT_EQ(wasTaken, writesFile);
-        EXPECT_EQ(messages, writesFile ? "Exiting early due to SIGINT\n" : "");
-    }
-}
-
-TEST_F(RunDriver, AnInterruptOfTheReportFinishesTheFiles) {
-    for (const bool isTerminal : {false, true}) {
-        kernel.outputIsTerminal = isTerminal;
-        bool wasTaken = false;
-        kernel.before("fileInMemory", [&] {
-            wasTaken = kernel.terminate();
-            EXPECT_EQ(kernel.callCount("restoreDefaultInterruptAction"), isTerminal ? 3U : 1U)
-                << "the next one ends it";
-        });
-        EXPECT_EQ(run("server -j /dev/null"), 0);
-        EXPECT_TRUE(wasTaken);
-        EXPECT_EQ(messages, "Finishing the output files\n");
+        EXPECT_EQ(kernel.callCount("restoreDefaultInterruptAction") - before, restored);
     }
 }
 

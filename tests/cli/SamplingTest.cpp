@@ -1,6 +1,7 @@
 #include "cli/Sampling.h"
 #include "analysis/TLTally.h"
 #include "cli/CommandLine.h"
+#include "cli/ParseArguments.h"
 #include "platform/dispatch.h"
 #include "platform/scripted/ScriptedKernel.h"
 #include "process/TLProcess.h"
@@ -150,16 +151,17 @@ TEST_F(ThreadSampling, StretchesTheIntervalFromTheSecondMissOn) {
 TEST_F(ThreadSampling, TakesAnyInterval) {
     constexpr std::uint64_t most = ~std::uint64_t{0};
     const struct {
-        double seconds;
+        std::string words;
         std::uint64_t interval, leeway;
         const char* shown;
-    } cases[] = {{0.5, 500'000'000, 250'000'000, "0.5"},
-                 {0.0123456, 12'345'600, 6'172'800, "0.0123"},
-                 {1e-300, 0, 0, "1e-300"},
-                 {1e300, most, 500'000'000, "1e+300"}};
+    } cases[] = {{"--sample 0.5s", 500'000'000, 250'000'000, "0.5"},
+                 {"--sample \t+0.0123456", 12'345'600, 6'172'800, "0.0123"},
+                 {"--sample 2.2250738585072014e-308", 0, 0, "2.23e-308"},
+                 {"--sample 1e300", most, 500'000'000, "1e+300"}};
     for (const auto& expected : cases) {
         platform::CallRecord setting;
-        args.sampleInterval = expected.seconds;
+        CommandLine line(expected.words);
+        args = std::get<TLTallyArgs>(parseArguments(line.argc(), line.argv()));
         const std::string messages = sampleWhile([&] {
             setting = *std::ranges::find(kernel.calls().rbegin(), kernel.calls().rend(), "setTimer",
                                          &platform::CallRecord::name);

@@ -38,14 +38,19 @@ TEST_P(Golden, PrintsWhatTheCaseSays) {
     ASSERT_FALSE(file.runs.empty());
     char folder[] = "/tmp/golden_XXXXXX"; // empty, so that no name of a case is a file's
     ASSERT_NE(mkdtemp(folder), nullptr);
+    for (const auto& [name, text] : file.files) {
+        std::ofstream(std::string(folder) + "/" + name) << text;
+    }
     for (std::size_t run = 0; run < file.runs.size(); ++run) {
         const CaseRun& expected = file.runs[run];
         SCOPED_TRACE(path + ", run " + std::to_string(run + 1));
-        const std::string command = std::string("cd ") + folder + " && TZ=UTC0 exec '" + TALLY_SCRIPTED +
-                                    "' '" + path + "' " + std::to_string(run) + " >out 2>err";
+        const std::string command = std::string("cd ") + folder + " && " + expected.shell +
+                                    " && TZ=UTC0 exec '" + TALLY_SCRIPTED + "' '" + path + "' " +
+                                    std::to_string(run) + " >out 2>err";
         const int ended = std::system(command.c_str());
         EXPECT_TRUE(WIFEXITED(ended) && WEXITSTATUS(ended) == expected.status) << "wait status " << ended;
-        EXPECT_EQ(contents(std::string(folder) + "/out"), expected.standardOutput);
+        const std::string out = contents(std::string(folder) + "/out");
+        EXPECT_EQ(out.empty() || out.ends_with('\n') ? out : out + "\n", expected.standardOutput);
         EXPECT_EQ(contents(std::string(folder) + "/err"), expected.standardError);
         for (const auto& [name, text] : expected.files) {
             std::string found = contents(std::string(folder) + "/" + name);

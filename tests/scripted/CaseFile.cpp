@@ -35,7 +35,8 @@ CaseStatement statementOf(const std::string& line, const std::string& place) {
     words >> statement.keyword;
     for (std::string word; words >> word;) {
         const std::size_t equals = word.find('=');
-        if (equals == std::string::npos || statement.keyword == "run") {
+        if (equals == std::string::npos || statement.keyword == "run" || statement.keyword == "heapsnap" ||
+            statement.keyword == "shell") {
             statement.words.push_back(unescaped(word));
         } else {
             statement.values[word.substr(0, equals)] = unescaped(word.substr(equals + 1));
@@ -100,8 +101,13 @@ CaseFile CaseFile::read(const std::string& path) {
         if (keyword.empty() || keyword.front() == '#') {
             continue;
         }
-        if (keyword == "run") {
+        if (keyword == "run" || keyword == "heapsnap") {
             result.runs.emplace_back().arguments = statement.words;
+            result.runs.back().isHeapsnap = keyword == "heapsnap";
+        } else if (keyword == "file") {
+            auto& files = result.runs.empty() ? result.files : result.runs.back().files;
+            files[statement.words.at(0)] =
+                std::regex_replace(readBlock(file, lineNumber), std::regex("\n +"), "");
         } else if (result.runs.empty()) {
             result.kernel.push_back(std::move(statement));
         } else if (keyword == "status") {
@@ -112,10 +118,8 @@ CaseFile CaseFile::read(const std::string& path) {
             result.runs.back().standardOutput = readBlock(file, lineNumber);
         } else if (keyword == "stderr") {
             result.runs.back().standardError = readBlock(file, lineNumber);
-        } else if (keyword == "file") {
-            const std::string block = readBlock(file, lineNumber);
-            result.runs.back().files[statement.words.at(0)] =
-                std::regex_replace(block, std::regex("\n +"), "");
+        } else if (keyword == "shell") {
+            result.runs.back().shell = line.substr(keyword.size() + 1);
         } else {
             throw std::runtime_error(place + ": unknown keyword " + keyword);
         }

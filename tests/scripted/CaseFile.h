@@ -12,8 +12,10 @@
 //   ...
 //   end
 //   file out.json                             what the run leaves in its folder, as stdout; a line that
-//   ...                                       begins with blanks continues the one before, without them
-//   end
+//   ...                                       begins with blanks continues the one before, without them;
+//   end                                       before the first run: what is there from the start
+//   shell COMMAND                             to be run before, in the shell that becomes the tool
+//   heapsnap 100                              a run of the other program
 //
 // Blanks separate words. In a word \x41 is a byte, \s a blank, \n a newline and \\ a backslash.
 
@@ -48,6 +50,8 @@ std::uint64_t caseNumber(const std::string& word);
 
 struct CaseRun {
     std::vector<std::string> arguments;
+    bool isHeapsnap = false;
+    std::string shell = "true"; // command
     int status = 0;
     std::string standardOutput;
     std::string standardError;
@@ -56,6 +60,7 @@ struct CaseRun {
 
 struct CaseFile {
     std::vector<CaseStatement> kernel;
+    std::map<std::string, std::string> files; // from the start, contents by name
     std::vector<CaseRun> runs;
 
     /// Reads the file of `path`. Throws std::runtime_error that names the line.

@@ -54,10 +54,14 @@ class KernelBuilder {
             }
         } else if (keyword == "owned") {
             addOwnedObject(statement);
-        } else if (keyword == "notice") {
+        } else if (keyword == "notice" || keyword == "machine-notice") {
+            const std::string text = takeWord(statement);
             for (ScriptedTask* task : tasks_) {
-                task->notices.of_task.push_back(takeWord(statement));
+                (keyword == "notice" ? task->notices.of_task : task->notices.of_machine).push_back(text);
             }
+        } else if (keyword == "tag") {
+            const std::string number = takeWord(statement);
+            kernel_.tagDescriptions[static_cast<std::uint32_t>(caseNumber(number))] = takeWord(statement);
         } else if (keyword == "fail") {
             const std::string call = takeWord(statement);
             const int error = static_cast<int>(caseNumber(takeWord(statement)));

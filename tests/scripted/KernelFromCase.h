@@ -14,6 +14,8 @@
 //     link /lib /usr/lib                       where a path leads
 //     owned id=9 virtual=64K resident=16K wired=0 reusable=0 swapped=4K tag=4 purgeable=0 no-tally
 //     notice TEXT                             what the platform has to say about it
+//     machine-notice TEXT                     ... and about every process of such a machine
+//   tag 120 TEXT                              what memory with this tag is for
 //   fail CALL ERROR nth=2 times=3 pid=100     as ScriptedKernel::fail; "times=always"
 //   ends CALL nth=2 pid=100                   the process ends before that call
 //   interrupt CALL nth=2 pid=100              a SIGINT before that call

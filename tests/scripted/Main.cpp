@@ -1,5 +1,7 @@
-// tally-scripted CASE RUN: the tool, on the kernel that a case file writes down. RUN counts from 0.
+// tally-scripted CASE RUN: the tool, or heapsnap, on the kernel that a case file writes down. RUN counts from
+// 0.
 
+#include "cli/HeapsnapDriver.h"
 #include "cli/RunDriver.h"
 #include "scripted/KernelFromCase.h"
 
@@ -14,8 +16,9 @@ int main(int argc, char** argv) {
     }
     try {
         const CaseFile file = CaseFile::read(argv[1]);
-        std::vector<std::string> arguments = file.runs.at(std::stoul(argv[2])).arguments;
-        arguments.insert(arguments.begin(), "tally");
+        const CaseRun& run = file.runs.at(std::stoul(argv[2]));
+        std::vector<std::string> arguments = run.arguments;
+        arguments.insert(arguments.begin(), run.isHeapsnap ? "heapsnap" : "tally");
         std::vector<char*> words;
         for (std::string& argument : arguments) {
             words.push_back(argument.data());
@@ -23,7 +26,8 @@ int main(int argc, char** argv) {
         words.push_back(nullptr);
         platform::ScriptedKernel kernel;
         buildKernel(kernel, file.kernel);
-        const int status = runTally(static_cast<int>(arguments.size()), words.data());
+        const int count = static_cast<int>(arguments.size());
+        const int status = run.isHeapsnap ? runHeapsnap(count, words.data()) : runTally(count, words.data());
         if (kernel.heldPortReferences() != 0 || kernel.heldBuffers() != 0) {
             std::fputs("tally-scripted: the run kept ports or buffers\n", stderr);
             return 3;

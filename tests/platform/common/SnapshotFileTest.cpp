@@ -1,11 +1,10 @@
-// Snapshot files: what is written comes back, and what anybody else writes is refused with a reason.
+// Snapshot files: what is written comes back, and what anybody else writes is refused with a reason. That
+// damaged files which are not refused hold together is the fuzzer's.
 
 #include "platform/quarry.h"
 #include "platform/scripted/ScriptedKernel.h"
 
 #include <gtest/gtest.h>
-
-#include <random>
 
 namespace tally::platform {
 namespace {
@@ -231,43 +230,12 @@ TEST(SnapshotFile, ThatIsWrongSaysWhere) {
     for (const auto& [document, error] : cases) {
         EXPECT_EQ(errorOf(document), error) << document.substr(0, 400);
     }
+    EXPECT_EQ(errorOf(with("4096", "512")), "") << "the smallest page";
     EXPECT_EQ(errorOf(documentWith(region(R"(,"offset":18446744073709547520)"))), "");
-}
-
-TEST(SnapshotFile, CutOffOrDamagedIsRefusedOrHoldsTogether) {
-    const ScriptedKernel kernel;
     const std::string whole = QRYDataWithSnapshot(everyField());
     for (std::size_t length = 0; length + 1 < whole.size(); ++length) { // the last byte is a newline
         EXPECT_NE(errorOf(whole.substr(0, length)), "") << length;
     }
-    std::mt19937 random(1);
-    const std::string bytes = "0123456789{}[]\",:-.eE\\u truefals\xff\xc3";
-    std::size_t accepted = 0;
-    for (int round = 0; round < 20'000; ++round) {
-        std::string damaged = whole;
-        for (std::size_t i = 0; i <= random() % 4; ++i) {
-            const std::size_t at = random() % damaged.size();
-            const char byte = bytes[random() % bytes.size()];
-            random() % 3 == 0   ? damaged.erase(at, random() % 9)
-            : random() % 2 == 0 ? damaged.insert(at, 1, byte)
-                                : damaged.replace(at, 1, 1, byte);
-        }
-        std::string error;
-        const auto graph = QRYDirectedGraphWithData(damaged, &error);
-        if (!graph) {
-            ASSERT_NE(error, "");
-            continue;
-        }
-        ++accepted;
-        std::uint64_t end = 0;
-        for (const QRYVMRegion& r : regionsOf(*graph)) {
-            ASSERT_TRUE(r.address >= end && r.length != 0 &&
-                        r.resident_size + r.swapped_out_size <= r.length);
-            ASSERT_LE(r.dirty_size + r.reusable_size, r.resident_size);
-            end = r.address + r.length;
-        }
-    }
-    EXPECT_GT(accepted, 500U) << "damage to names and numbers goes unseen, so that the check above is one";
 }
 
 } // namespace
