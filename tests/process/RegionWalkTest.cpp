@@ -60,8 +60,13 @@ TEST_F(RegionWalk, EndsWhereTheKernelRefusesAndKeepsWhatItHas) {
 
 TEST_F(RegionWalk, AsksForThePagesOfSharedMappingsInChunksAndDropsHalfAnAnswer) {
     const std::string pages = std::string(4095, '.') + "DDD" + std::string(4094, '.') + "C";
-    task.map({.pages = pages, .shareMode = SM_SHARED});
-    EXPECT_TRUE(walk().at(0).subrangeList);
+    task.map({.pages = pages, .offset = 0x1000000, .shareMode = SM_SHARED});
+    Lines runs;
+    const TLRangeList* const list = walk().at(0).subrangeList.get();
+    for (const auto* node = list ? list->rangeListHead() : nullptr; node; node = node->next.get()) {
+        runs.push_back(describeRange(formatted("%lx", node->start), node->size, "", node->sizes));
+    }
+    EXPECT_EQ(runs, (Lines{"1fff000+3000 d3000", "3000000+1000 c1000"}));
     EXPECT_EQ(kernel.callCount("mach_vm_page_range_query"), 3u) << "4096 pages a query";
     // Some of the runs would count for less than the mapping's own figures.
     kernel.fail("mach_vm_page_range_query", KERN_FAILURE, {.nth = 2});

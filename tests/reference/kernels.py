@@ -84,7 +84,7 @@ class Maker:
     def __init__(self, seed):
         self.random = random.Random(seed)
         self.page = self.random.choice([4096, 4096, 16384])
-        self.objects = [5, 6, 0x700000008, 9, 0x300000005]
+        self.objects = [5, 6, 0x700000008, 9, 0x300000005, 88]
 
     def one(self, *choices):
         return self.random.choice(choices)
@@ -111,7 +111,7 @@ class Maker:
 
     def mapping(self, start):
         mapping = Mapping(start, self.random.randrange(1, 9) * self.page, external=self.chance(30))
-        mapping.tag = self.one(0, 30, 87, 90, 90, 240, 300)
+        mapping.tag = self.one(0, 30, 87, 90, 300, self.random.randrange(256))
         mapping.object = self.one(*self.objects, *self.objects, 0, self.random.randrange(100, 1 << 40))
         mapping.offset = self.random.randrange(0, 4) * self.page
         mapping.share = self.one(1, 2, 3, 4, 4, 4, 5, 6, 7, 8)
@@ -121,8 +121,8 @@ class Maker:
         mapping.wired = self.chance(10)
         self.contents(mapping)
         if self.chance(4):  # more than one query asks for, with gaps
-            mapping.size = self.random.randrange(4090, 9000) * self.page
-            mapping.words += [0] * self.random.randrange(3000, 4100) + mapping.words
+            mapping.size = self.random.randrange(8100, 9000) * self.page
+            mapping.words += [0] * self.random.randrange(3000, 8000) + mapping.words
         if self.chance(8):  # as when pages come and go between two counters
             mapping.counts = tuple(self.random.randrange(6) for _ in range(4))
         uniform = self.random.randrange(10)  # mappings that are wholly of one kind, or untouched

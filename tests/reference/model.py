@@ -9,8 +9,24 @@ COW, PRIVATE, EMPTY, SHARED, PRIVATE_ALIASED = 1, 2, 3, 4, 6  # share modes
 VOLATILE, EMPTIED, NOT_PURGEABLE = 1, 2, 3
 UNMAPPED_TAG, NOT_SET = 0xFFFFFFFF, 2**64 - 1
 UNMAPPED_NAME = "Owned physical tally (unmapped)"
-TAG_NAMES = {0: 'untagged ("VM_ALLOCATE")', 30: "stack", 87: "graphics surfaces", 90: "audio", 240: "app-specific tag 1",
-             UNMAPPED_TAG: UNMAPPED_NAME}
+TAG_NAMES = {
+    0: 'untagged ("VM_ALLOCATE")', 1: "malloc metadata", 2: "MALLOC_SMALL", 3: "MALLOC_LARGE", 4: "MALLOC_HUGE",
+    5: "sbrk", 6: "realloc", 7: "MALLOC_TINY", 8: "MALLOC_LARGE_REUSABLE", 9: "MALLOC_LARGE_REUSED",
+    10: "performance tool data", 11: "MALLOC_NANO", 18: "system/kernel diagnostics", 20: "Mach message",
+    21: "driver framework", 30: "stack", 31: "guard", 32: "shared pmap", 33: "dylib", 34: "Objective-C dispatching code",
+    35: "unshared pmap", 40: "desktop toolkit", 41: "desktop toolkit data", 42: "graphics drawing",
+    43: "networking framework", 44: "Java", 45: "object persistence", 46: "object persistence cache", 50: "fonts",
+    51: "animation", 52: "graphics", 53: "graphics server", 54: "graphics devices", 55: "graphics acceleration",
+    56: "graphics mapping", 57: "graphics effects", 58: "web engine", 60: "dyld private memory",
+    61: "dyld malloc memory", 62: "SQLite page cache", 63: "WebAssembly", 64: "JS JIT generated code",
+    65: "JS VM register file", 66: "OpenGL Shading Language", 67: "OpenCL", 68: "image scaling", 69: "image decoding",
+    70: "font rendering", 71: "media", 72: "media playback", 73: "user-interface assets", 74: "networking",
+    75: "system logging", 76: "thumbnails", 77: "accounts", 78: "web engine scripts", 79: "web engine objects",
+    80: "corpse info", 81: "system log data", 82: "Swift runtime", 83: "Swift metadata", 84: "graphics data",
+    86: "graphics scenes", 87: "graphics surfaces", 88: "media captions", 89: "media codecs", 90: "audio",
+    91: "video bitstream", 92: "media decoding", 93: "media processing", 94: "media capture", 95: "image analysis",
+    96: "networking buffers", 97: "user-interface framework", 98: "font cache",
+    UNMAPPED_TAG: UNMAPPED_NAME}
 LEDGER_NAMES = {2: " (network)", 3: " (media)", 4: " (graphics)", 5: " (neural)"}
 RESERVED = {(0xFC0000000, 0x40000000): "commpage (reserved)", (0x1000000000, 0x6000000000): "GPU Carveout (reserved)"}
 CACHE_ALIGNMENT = 4096
@@ -220,6 +236,10 @@ def charge_owned(region, owned):
         region.sizes[:2] = [max(owned.resident - owned.reusable, 0), owned.swapped]
 
 
+def tag_name(tag):
+    return TAG_NAMES.get(tag) or ("app-specific tag %d" % (tag - 239) if 240 <= tag < 256 else "tag %d" % tag)
+
+
 def with_ledger(name, tag):
     return name + (" (VM ledger tag %d)" % tag if tag > 5 else LEDGER_NAMES.get(tag, ""))
 
@@ -247,7 +267,7 @@ def regions_of(kernel, task, hidden, warn):
         elif (mapping.start, mapping.size) in RESERVED:
             region.name = RESERVED[mapping.start, mapping.size]
         else:
-            region.name = TAG_NAMES.get(mapping.tag) or "tag %d" % mapping.tag
+            region.name = tag_name(mapping.tag)
             if kernel.charged and owned is not None and kernel.id(mapping) in owned:
                 record = owned.pop(kernel.id(mapping))
                 charge_owned(region, record)
