@@ -1,8 +1,8 @@
 // Process grouping: every object finds the set of processes that map it.
 //
-// The idea: processes come in one order, so a set is the set it grew from and the process that joined it
-// last. Sets that grow from one set by one process are one, so equal sets are found without comparing
-// members. Cost: a step per region, and a look-up per set and process. One thread.
+// The idea: processes are added in one order. So two things tell a set: the set it grew from, and the process
+// that joined last. Sets that agree in both are one, and members are never compared. Cost: a step per region,
+// and a look-up per set and process. One thread.
 
 #include "analysis/ProcessGrouping.h"
 

@@ -1,14 +1,21 @@
 // TLOutputFormatter: what a report calls and every output format implements.
 //
-// Order of calls for one report, each step on every formatter before the next:
-//   startAtTime; with region listing, printRegionlistLikeOutputForProcess for every process; then per process
-//   printProcessHeader, printProcessTotal (not with errors), endProcessHeader, its categories (its own first,
-//   then one call per group it shares memory with; with errors or in no group one call with nothing),
-//   printProcessAuxData; then printProcessesWithWarnings, printSummaryCategories, printGlobalAuxData,
-//   endAtTime.
-// configureForMultipleOutputs comes once before the first report of a sampling run, close once after the
-// last, discard instead of both. All calls come from one thread at a time. Arguments are valid during the
-// call only.
+// The calls of one report, in this order. Each goes to every formatter before the next one does.
+//
+//   startAtTime
+//   printRegionlistLikeOutputForProcess     for every process, where regions are listed
+//   for every process
+//       printProcessHeader
+//       printProcessTotal                   not with errors
+//       endProcessHeader
+//       printProcessCategories              its own; with errors, or in no group, with nothing
+//       printSharedCategories               once for each group that it shares memory with
+//       printProcessAuxData
+//   printProcessesWithWarnings, printSummaryCategories, printGlobalAuxData
+//   endAtTime
+//
+// A sampling run begins with configureForMultipleOutputs. Every run ends with close, or with discard where
+// nothing is to stay. Calls come from one thread at a time; arguments are valid during the call only.
 
 #pragma once
 

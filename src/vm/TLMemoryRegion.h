@@ -1,7 +1,8 @@
 // TLMemoryRegion: one mapped range of a process, a piece of one, or memory that is charged to it unmapped.
 //
-// A plain record of at most 160 bytes: a process can have 100,000 of them. Its walk makes and sizes it; the
-// analysis adds it to one memory object, whose name one that is not mapped takes; afterwards it is only read.
+// A plain record of at most 160 bytes: a process can have 100,000 of them. The walk makes and sizes it. The
+// analysis adds it to one memory object; where it is not mapped it takes that object's name. Then it is only
+// read.
 
 #pragma once
 

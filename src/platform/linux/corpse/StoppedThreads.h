@@ -1,13 +1,12 @@
 // StoppedThreads: a process that holds still while it is looked at.
 //
 // Its threads are seized by ptrace, interrupted and awaited, until a look at the list of threads finds no new
-// one. Nothing of it outlives the thread that made it: whatever way that ends, the kernel lets go of every
-// thread which it had seized, and they run on. Processes that share the memory without being threads of the
-// process are not stopped.
+// one. They stay seized no longer than the thread of the tool that seized them lives: however that ends, the
+// kernel lets go of them. Processes that share the memory without being threads of the process run on.
 //
-// A thread that loads another program ends the others, and waits until whoever traces them has taken note of
-// their ends; to seize one more thread is to wait for that program meanwhile. So another thread of the tool
-// takes note of them.
+// When a thread loads another program, the kernel ends the other threads and waits until their tracer has
+// taken note of it. To seize one more thread would be to wait for that very program. So a second thread of
+// the tool takes note.
 
 #pragma once
 

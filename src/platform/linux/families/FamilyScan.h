@@ -1,11 +1,12 @@
 // FamilyScan: reads a family of forked processes side by side and finds which pages they share.
 //
-// The idea: relatives that still share a page have the same frame at the same address (and, once it is
-// swapped out, the same place in swap). All members are read through one window of addresses before the next,
-// so memory does not grow with the family, and the kernel finds the descriptions of shared pages in its
-// caches. Windows without a page of any member are passed over. Cost: a page table entry per page and member,
-// one per huge page. Frames are compared wherever two members have pages of their own, also where the kernel
-// says "mapped once": of a huge page that bit tells the first part only.
+// The idea: relatives that still share a page have the same frame at the same address, or the same place in
+// swap. All members are read through one window of addresses before the next one. So memory does not grow
+// with the family, and the kernel finds its records of shared pages in its caches. Windows without a page of
+// any member are passed over.
+//
+// Frames are compared wherever two members have pages, even where the kernel says "mapped once": of a huge
+// page that bit tells the first part only. Cost: a page table entry per page and member, one per huge page.
 
 #pragma once
 
